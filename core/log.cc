@@ -1,0 +1,91 @@
+#include "core/log.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+
+namespace dr {
+namespace {
+
+std::mutex& SinkMutex() {
+  static std::mutex* mu = new std::mutex();
+  return *mu;
+}
+LogSink& CurrentSink() {
+  static LogSink* sink = new LogSink();
+  return *sink;
+}
+
+void WriteToStderr(std::string_view line) {
+  std::string buf(line);
+  buf += '\n';
+  const char* p = buf.data();
+  size_t left = buf.size();
+  while (left > 0) {
+    ssize_t n = ::write(STDERR_FILENO, p, left);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return;  // nowhere left to report a failing log
+    }
+    p += n;
+    left -= static_cast<size_t>(n);
+  }
+}
+
+}  // namespace
+
+void SystemLogLine(std::string_view text) {
+  std::string line;
+  line.reserve(text.size());
+  for (char c : text) {
+    if (c == '\n') {
+      line += "\\n";
+    } else if (c == '\r') {
+      line += "\\r";
+    } else {
+      line += c;
+    }
+  }
+  std::lock_guard<std::mutex> lock(SinkMutex());
+  if (CurrentSink()) {
+    CurrentSink()(line);
+  } else {
+    WriteToStderr(line);
+  }
+}
+
+LogSink SetLogSink(LogSink sink) {
+  std::lock_guard<std::mutex> lock(SinkMutex());
+  LogSink previous = std::move(CurrentSink());
+  CurrentSink() = std::move(sink);
+  return previous;
+}
+
+ScopedLogCapture::ScopedLogCapture() {
+  previous_ = SetLogSink([this](std::string_view line) {
+    std::lock_guard<std::mutex> lock(mu_);
+    lines_.emplace_back(line);
+  });
+}
+
+ScopedLogCapture::~ScopedLogCapture() { SetLogSink(std::move(previous_)); }
+
+std::vector<std::string> ScopedLogCapture::lines() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return lines_;
+}
+
+bool ScopedLogCapture::contains(std::string_view fragment) const {
+  std::lock_guard<std::mutex> lock(mu_);
+  for (const auto& l : lines_) {
+    if (l.find(fragment) != std::string::npos) return true;
+  }
+  return false;
+}
+
+void ScopedLogCapture::clear() {
+  std::lock_guard<std::mutex> lock(mu_);
+  lines_.clear();
+}
+
+}  // namespace dr

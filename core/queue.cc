@@ -1,0 +1,113 @@
+#include "core/queue.h"
+
+#include <algorithm>
+#include <cstdlib>
+#include <vector>
+
+#include "core/log.h"
+
+namespace dr {
+namespace {
+
+// The queues whose work the calling thread is running, innermost last.
+thread_local std::vector<const void*> tCurrentQueues;
+
+struct CurrentQueueScope {
+  explicit CurrentQueueScope(const void* q) { tCurrentQueues.push_back(q); }
+  ~CurrentQueueScope() { tCurrentQueues.pop_back(); }
+};
+
+}  // namespace
+
+SerialQueue::SerialQueue(std::string label)
+    : label_(std::move(label)), state_(std::make_shared<State>()) {}
+
+SerialQueue::~SerialQueue() {
+  std::thread worker;
+  {
+    std::lock_guard<std::mutex> lock(state_->mu);
+    state_->stopping = true;
+    worker = std::move(state_->worker);
+  }
+  state_->cv.notify_all();
+  if (!worker.joinable()) return;
+  if (worker.get_id() == std::this_thread::get_id()) {
+    // The last owner let go from inside the queue's own work: the thread
+    // runs what is left and ends on its own, holding the state alive.
+    worker.detach();
+  } else {
+    worker.join();
+  }
+}
+
+void SerialQueue::async(std::function<void()> work) {
+  {
+    std::lock_guard<std::mutex> lock(state_->mu);
+    state_->pending.emplace_back(state_->nextTicket++, std::move(work));
+    if (!state_->worker.joinable()) state_->worker = std::thread(runWorker, state_);
+  }
+  state_->cv.notify_all();
+}
+
+void SerialQueue::enter() {
+  std::unique_lock<std::mutex> lock(state_->mu);
+  uint64_t ticket = state_->nextTicket++;
+  state_->cv.wait(lock, [&] { return state_->serving == ticket; });
+}
+
+void SerialQueue::leave() {
+  {
+    std::lock_guard<std::mutex> lock(state_->mu);
+    ++state_->serving;
+  }
+  state_->cv.notify_all();
+}
+
+void SerialQueue::sync(const std::function<void()>& work) {
+  if (isCurrent()) {
+    SystemLog("queue \"%@\": synchronous entry from its own work would deadlock", label_);
+    std::abort();
+  }
+  enter();
+  struct Leave {
+    SerialQueue* q;
+    ~Leave() { q->leave(); }
+  } leave{this};
+  CurrentQueueScope scope(state_.get());
+  work();
+}
+
+void SerialQueue::runWorker(std::shared_ptr<State> s) {
+  std::unique_lock<std::mutex> lock(s->mu);
+  for (;;) {
+    s->cv.wait(lock, [&] {
+      return (!s->pending.empty() && s->pending.front().first == s->serving) ||
+             (s->stopping && s->pending.empty());
+    });
+    if (s->pending.empty()) return;  // stopping, and everything ran
+    std::function<void()> work = std::move(s->pending.front().second);
+    s->pending.pop_front();
+    lock.unlock();
+    {
+      CurrentQueueScope scope(s.get());
+      work();
+      work = nullptr;  // release captures before the next turn
+    }
+    lock.lock();
+    ++s->serving;
+    s->cv.notify_all();
+  }
+}
+
+bool SerialQueue::isCurrent() const {
+  return std::find(tCurrentQueues.begin(), tCurrentQueues.end(), state_.get()) !=
+         tCurrentQueues.end();
+}
+
+void SerialQueue::assertCurrent(const char* what) const {
+  if (isCurrent()) return;
+  SystemLog("%s: not on queue \"%@\"", what, label_);
+  std::abort();
+}
+
+}  // namespace dr

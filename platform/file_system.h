@@ -1,0 +1,70 @@
+// FileSystem: whole-file reads, atomic and durable writes, folder creation.
+//
+// The daemon's only writes of its own state go through writeFileAtomically:
+// the bytes go to a new temporary file beside the target, are fsynced, the
+// temporary is renamed over the target, and the folder is fsynced, so that a
+// crash at any point leaves either the old file or the new one, whole. A
+// failure before the rename leaves the old file untouched and removes the
+// temporary.
+//
+// FileSystem is an interface so that tests can inject faults;
+// FileSystem::Default() is the real one. Implementations are safe to use from
+// any thread. Errors: a missing file reads as kFileErrorDomain /
+// kFileReadNoSuchFileError; other failures carry the errno text.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+
+#include "core/status.h"
+
+namespace dr {
+
+class FileSystem {
+ public:
+  virtual ~FileSystem() = default;
+
+  // The whole contents of the file at `path`. Files larger than `maxBytes`
+  // are refused (kFileReadError), so a hostile file cannot exhaust memory.
+  virtual Result<std::string> readFile(const std::string& path,
+                                       size_t maxBytes = kDefaultMaxRead) = 0;
+
+  // Replaces the file at `path` with `bytes`, atomically and durably, with
+  // permissions `mode`. Errors: kFileErrorDomain / kFileWriteError.
+  virtual Status writeFileAtomically(const std::string& path, std::string_view bytes,
+                                     mode_t mode = 0600) = 0;
+
+  // Creates the folder `path` and any missing parents, each with `mode`.
+  // Succeeds when the folder exists already.
+  virtual Status makeDirectories(const std::string& path, mode_t mode = 0700) = 0;
+
+  static constexpr size_t kDefaultMaxRead = size_t{256} << 20;
+
+  // The real file system. Never null; lives for the whole process.
+  static FileSystem* Default();
+};
+
+// Forwards every call to another FileSystem, so that a fault-injecting fake
+// overrides only the call it breaks.
+class FileSystemWrapper : public FileSystem {
+ public:
+  explicit FileSystemWrapper(FileSystem* target) : target_(target) {}
+  Result<std::string> readFile(const std::string& path, size_t maxBytes) override {
+    return target_->readFile(path, maxBytes);
+  }
+  Status writeFileAtomically(const std::string& path, std::string_view bytes,
+                             mode_t mode) override {
+    return target_->writeFileAtomically(path, bytes, mode);
+  }
+  Status makeDirectories(const std::string& path, mode_t mode) override {
+    return target_->makeDirectories(path, mode);
+  }
+
+ private:
+  FileSystem* target_;
+};
+
+}  // namespace dr

@@ -1,0 +1,139 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <string>
+
+#include "core/value.h"
+#include "platform/file_system.h"
+
+namespace dr {
+namespace {
+
+Error FileError(int64_t code, int errnum, const std::string& what) {
+  Error posix = PosixError(errnum, what);
+  return Error(kFileErrorDomain, code, posix.ownDescription());
+}
+
+std::string ParentOf(const std::string& path) {
+  size_t slash = path.find_last_of('/');
+  if (slash == std::string::npos) return ".";
+  if (slash == 0) return "/";
+  return path.substr(0, slash);
+}
+
+// Writes all of `bytes` to `fd`, retrying short writes and EINTR.
+bool WriteAll(int fd, std::string_view bytes) {
+  const char* p = bytes.data();
+  size_t left = bytes.size();
+  while (left > 0) {
+    ssize_t n = ::write(fd, p, left);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    p += n;
+    left -= static_cast<size_t>(n);
+  }
+  return true;
+}
+
+class LinuxFileSystem final : public FileSystem {
+ public:
+  Result<std::string> readFile(const std::string& path, size_t maxBytes) override {
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+      int e = errno;
+      return FileError(e == ENOENT ? kFileReadNoSuchFileError : kFileReadError, e, "open " + path);
+    }
+    struct stat st;
+    if (::fstat(fd, &st) != 0 || S_ISDIR(st.st_mode)) {
+      int e = S_ISDIR(st.st_mode) ? EISDIR : errno;
+      ::close(fd);
+      return FileError(kFileReadError, e, "read " + path);
+    }
+    std::string out;
+    char buf[65536];
+    for (;;) {
+      ssize_t n = ::read(fd, buf, sizeof buf);
+      if (n < 0) {
+        if (errno == EINTR) continue;
+        int e = errno;
+        ::close(fd);
+        return FileError(kFileReadError, e, "read " + path);
+      }
+      if (n == 0) break;
+      if (out.size() + static_cast<size_t>(n) > maxBytes) {
+        ::close(fd);
+        return FileError(kFileReadError, EFBIG, "read " + path);
+      }
+      out.append(buf, static_cast<size_t>(n));
+    }
+    ::close(fd);
+    return out;
+  }
+
+  Status writeFileAtomically(const std::string& path, std::string_view bytes,
+                             mode_t mode) override {
+    // A unique temporary beside the target, so the rename stays within one
+    // file system and concurrent writers never share a temporary.
+    std::string tmp = path + ".tmp-" + Uuid::random().string();
+    int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode);
+    if (fd < 0) return FileError(kFileWriteError, errno, "create " + tmp);
+    auto fail = [&](const char* what) {
+      int e = errno;
+      ::close(fd);
+      ::unlink(tmp.c_str());
+      return Status(FileError(kFileWriteError, e, std::string(what) + " " + tmp));
+    };
+    if (::fchmod(fd, mode) != 0) return fail("chmod");  // the umask may have narrowed it
+    if (!WriteAll(fd, bytes)) return fail("write");
+    if (::fsync(fd) != 0) return fail("fsync");
+    if (::close(fd) != 0) {
+      int e = errno;
+      ::unlink(tmp.c_str());
+      return FileError(kFileWriteError, e, "close " + tmp);
+    }
+    if (::rename(tmp.c_str(), path.c_str()) != 0) {
+      int e = errno;
+      ::unlink(tmp.c_str());
+      return FileError(kFileWriteError, e, "rename " + tmp + " to " + path);
+    }
+    // Make the rename itself durable.
+    int dir = ::open(ParentOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (dir < 0) return FileError(kFileWriteError, errno, "open folder of " + path);
+    int rc = ::fsync(dir);
+    int e = errno;
+    ::close(dir);
+    if (rc != 0) return FileError(kFileWriteError, e, "fsync folder of " + path);
+    return Status::OK();
+  }
+
+  Status makeDirectories(const std::string& path, mode_t mode) override {
+    if (path.empty()) return FileError(kFileWriteError, ENOENT, "mkdir (empty path)");
+    size_t pos = 0;
+    for (;;) {
+      pos = path.find('/', pos + 1);
+      std::string part = path.substr(0, pos);
+      if (!part.empty() && ::mkdir(part.c_str(), mode) != 0 && errno != EEXIST) {
+        return FileError(kFileWriteError, errno, "mkdir " + part);
+      }
+      if (pos == std::string::npos) break;
+    }
+    struct stat st;
+    if (::stat(path.c_str(), &st) != 0) return FileError(kFileWriteError, errno, "stat " + path);
+    if (!S_ISDIR(st.st_mode)) return FileError(kFileWriteError, ENOTDIR, "mkdir " + path);
+    return Status::OK();
+  }
+};
+
+}  // namespace
+
+FileSystem* FileSystem::Default() {
+  static LinuxFileSystem* fs = new LinuxFileSystem();
+  return fs;
+}
+
+}  // namespace dr

@@ -1,0 +1,64 @@
+// pdoc: drd's structured-data files (information dictionaries, SDK
+// dictionaries, preferences, policy, the annotation file).
+//
+// A pdoc file holds one value. Two forms are read, told apart by the first
+// byte that is not white space: '<' is the XML form, '{' or '[' the JSON form.
+// Only the XML form is written:
+//
+//   <?xml version="1.0" encoding="UTF-8"?>
+//   <pdoc version="1.0">
+//     <dict>
+//       <key>count</key>
+//       <integer>-3</integer>
+//       ...
+//     </dict>
+//   </pdoc>
+//
+// Elements: dict (alternating key and value elements, keys unique), array,
+// string, integer (signed 64-bit; unsigned above INT64_MAX), real, true,
+// false, date (ISO 8601, UTC), data (base64, white space ignored). In JSON,
+// objects are dictionaries, numbers without fraction or exponent integers and
+// other numbers reals; null is refused. UUIDs and absent values do not occur
+// in pdoc files.
+//
+// Both parsers are libraries (expat, nlohmann-json) set up defensively: a
+// document type declaration is ignored, entity declarations and references
+// other than the five predefined entities and character references are
+// refused, nothing is fetched from outside, nesting deeper than kMaxDepth is
+// refused. Any input, however broken, answers a value or an error in
+// kPdocErrorDomain naming what is wrong; never a crash.
+//
+// Stateless; safe to call from any thread.
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/file_system.h"
+
+namespace dr::pdoc {
+
+inline constexpr int kMaxDepth = 256;
+
+// Codes of kPdocErrorDomain.
+inline constexpr int64_t kMalformed = 1;   // the bytes are not a pdoc document
+inline constexpr int64_t kUnwritable = 2;  // the value cannot be written as pdoc
+
+// Reads the one value in `bytes`.
+Result<Value> Parse(std::string_view bytes);
+
+// The XML form of `value`: indented by two spaces, dictionary keys ascending.
+// Fails with kUnwritable for values pdoc cannot hold: absent, a UUID, text
+// that is not UTF-8 or holds characters XML 1.0 cannot carry.
+Result<std::string> WriteXml(const Value& value);
+
+// Reads and parses the file at `path`; file errors as FileSystem::readFile.
+Result<Value> ReadFile(const std::string& path, FileSystem* fs = FileSystem::Default());
+
+// Writes `value` in the XML form to `path` atomically and durably.
+Status WriteFile(const std::string& path, const Value& value, mode_t mode = 0600,
+                 FileSystem* fs = FileSystem::Default());
+
+}  // namespace dr::pdoc
