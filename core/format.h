@@ -55,6 +55,8 @@ inline FormatArg Text(std::string s) {
   return a;
 }
 
+inline FormatArg CText(const char* s) { return Text(s ? std::string(s) : std::string("(null)")); }
+
 template <typename T>
 FormatArg Make(const T& v);
 
@@ -95,7 +97,7 @@ FormatArg Make(const T& v) {
     a.d = static_cast<double>(v);
     return a;
   } else if constexpr (std::is_same_v<D, const char*> || std::is_same_v<D, char*>) {
-    return Text(v ? std::string(v) : std::string("(null)"));
+    return CText(v);
   } else if constexpr (std::is_convertible_v<const D&, std::string_view>) {
     return Text(std::string(std::string_view(v)));
   } else if constexpr (std::is_same_v<D, std::filesystem::path>) {

@@ -1,0 +1,94 @@
+#include "core/queue.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <thread>
+#include <vector>
+
+namespace dr {
+namespace {
+
+TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
+  SerialQueue q("test");
+  std::vector<int> order;
+  std::atomic<int> running{0};
+  std::atomic<bool> overlapped{false};
+  auto work = [&](int i) {
+    if (running.fetch_add(1) != 0) overlapped = true;
+    order.push_back(i);  // unguarded on purpose: the queue is the guard
+    running.fetch_sub(1);
+  };
+  // async and sync interleaved from several threads: sync waits for the
+  // work submitted before it, and nothing overlaps.
+  for (int i = 0; i < 200; ++i) {
+    if (i % 3 == 0) {
+      q.sync([&, i] { work(i); });
+    } else {
+      q.async([&, i] { work(i); });
+    }
+  }
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&] {
+      for (int i = 0; i < 100; ++i) q.sync([&] { work(-1); });
+    });
+  }
+  for (auto& t : threads) t.join();
+  q.sync([] {});
+  EXPECT_FALSE(overlapped);
+  std::vector<int> mine;
+  for (int i : order) {
+    if (i >= 0) mine.push_back(i);
+  }
+  ASSERT_EQ(mine.size(), 200u);
+  for (int i = 0; i < 200; ++i) EXPECT_EQ(mine[i], i);
+}
+
+TEST(SerialQueueTest, SyncRunsOnTheCallersThreadAndKnowsItsQueue) {
+  SerialQueue a("a"), b("b");
+  const auto caller = std::this_thread::get_id();
+  EXPECT_FALSE(a.isCurrent());
+  a.sync([&] {
+    EXPECT_EQ(std::this_thread::get_id(), caller);
+    EXPECT_TRUE(a.isCurrent());
+    EXPECT_FALSE(b.isCurrent());
+    b.sync([&] {
+      EXPECT_TRUE(b.isCurrent());
+      EXPECT_TRUE(a.isCurrent());  // still inside a's work
+    });
+  });
+  EXPECT_FALSE(a.isCurrent());
+  std::atomic<bool> onWorker{false};
+  a.async([&] { onWorker = a.isCurrent() && std::this_thread::get_id() != caller; });
+  a.sync([] {});
+  EXPECT_TRUE(onWorker);
+  EXPECT_EQ(a.syncResult([] { return 42; }), 42);
+}
+
+TEST(SerialQueueTest, DestructionRunsQueuedWork) {
+  std::atomic<int> ran{0};
+  {
+    SerialQueue q("drain");
+    for (int i = 0; i < 50; ++i) q.async([&] { ran++; });
+  }
+  EXPECT_EQ(ran, 50);
+}
+
+TEST(SerialQueueDeathTest, SyncFromItsOwnWorkStopsTheProcess) {
+  EXPECT_DEATH(
+      {
+        SerialQueue q("self");
+        q.sync([&] { q.sync([] {}); });
+      },
+      "would deadlock");
+  EXPECT_DEATH(
+      {
+        SerialQueue q("checked");
+        q.assertCurrent("needs the queue");
+      },
+      "needs the queue: not on queue \"checked\"");
+}
+
+}  // namespace
+}  // namespace dr
