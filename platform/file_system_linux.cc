@@ -117,8 +117,15 @@ class LinuxFileSystem final : public FileSystem {
     for (;;) {
       pos = path.find('/', pos + 1);
       std::string part = path.substr(0, pos);
-      if (!part.empty() && ::mkdir(part.c_str(), mode) != 0 && errno != EEXIST) {
-        return FileError(kFileWriteError, errno, "mkdir " + part);
+      if (!part.empty()) {
+        if (::mkdir(part.c_str(), mode) == 0) {
+          // The umask may have narrowed the mode; set exactly what was asked.
+          if (::chmod(part.c_str(), mode) != 0) {
+            return FileError(kFileWriteError, errno, "chmod " + part);
+          }
+        } else if (errno != EEXIST) {
+          return FileError(kFileWriteError, errno, "mkdir " + part);
+        }
       }
       if (pos == std::string::npos) break;
     }
