@@ -1,0 +1,78 @@
+#include "tests/support/bundle_fixture.h"
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "platform/pdoc.h"
+
+namespace dr::test {
+
+BundleFixture::BundleFixture() {
+  const char* tmp = std::getenv("TMPDIR");
+  std::string pattern = std::string(tmp && *tmp ? tmp : "/tmp") + "/drd-bundles-XXXXXX";
+  if (::mkdtemp(pattern.data()) == nullptr) ADD_FAILURE() << "mkdtemp " << pattern;
+  root_ = pattern;
+}
+
+BundleFixture::~BundleFixture() {
+  std::error_code ec;
+  std::filesystem::remove_all(root_, ec);
+}
+
+std::string BundleFixture::path(const std::string& relative) const {
+  return root_ + "/" + relative;
+}
+
+std::string BundleFixture::makeFolder(const std::string& relative) {
+  std::string p = path(relative);
+  std::filesystem::create_directories(p);
+  return p;
+}
+
+std::string BundleFixture::writeFile(const std::string& relative, const std::string& bytes) {
+  std::string p = path(relative);
+  std::filesystem::create_directories(std::filesystem::path(p).parent_path());
+  std::ofstream(p, std::ios::binary | std::ios::trunc) << bytes;
+  return p;
+}
+
+std::string BundleFixture::writePdoc(const std::string& relative, const Value& value) {
+  Result<std::string> xml = pdoc::WriteXml(value);
+  EXPECT_TRUE(xml.ok()) << relative;
+  return writeFile(relative, xml.ok() ? *xml : std::string());
+}
+
+std::string BundleFixture::makeBundle(const std::string& relative, const Value& info,
+                                      const std::optional<std::string>& executable) {
+  std::string bundle = makeFolder(relative);
+  if (info.isPresent()) writePdoc(relative + "/Contents/Info.pdoc", info);
+  if (executable) {
+    std::string exe = writeFile(relative + "/Contents/Exec/" + *executable, "#!/bin/sh\n");
+    ::chmod(exe.c_str(), 0755);
+  }
+  return bundle;
+}
+
+ScopedEnv::ScopedEnv(std::string name, const std::optional<std::string>& value)
+    : name_(std::move(name)) {
+  if (const char* old = std::getenv(name_.c_str())) previous_ = old;
+  if (value) {
+    ::setenv(name_.c_str(), value->c_str(), 1);
+  } else {
+    ::unsetenv(name_.c_str());
+  }
+}
+
+ScopedEnv::~ScopedEnv() {
+  if (previous_) {
+    ::setenv(name_.c_str(), previous_->c_str(), 1);
+  } else {
+    ::unsetenv(name_.c_str());
+  }
+}
+
+}  // namespace dr::test

@@ -1,0 +1,57 @@
+// Real bundles in a temporary folder, for tests of the plug-in model.
+//
+// A BundleFixture makes a fresh folder with mkdtemp and removes it with
+// everything in it when destroyed. makeBundle lays out
+// <folder>/<relative>/Contents/Info.pdoc and, when asked, an executable in
+// Contents/Exec/. ScopedEnv sets or clears an environment variable for the
+// life of the object and restores it afterwards.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "core/value.h"
+
+namespace dr::test {
+
+class BundleFixture {
+ public:
+  BundleFixture();
+  ~BundleFixture();
+  BundleFixture(const BundleFixture&) = delete;
+  BundleFixture& operator=(const BundleFixture&) = delete;
+
+  const std::string& root() const { return root_; }
+  // root()/relative
+  std::string path(const std::string& relative) const;
+
+  // Makes the bundle folder root()/relative with Contents/Info.pdoc holding
+  // `info` (no file when absent); with `executable`, also an executable file
+  // Contents/Exec/<executable>. Answers the bundle's path.
+  std::string makeBundle(const std::string& relative, const Value& info,
+                         const std::optional<std::string>& executable = std::nullopt);
+  // Writes `value` as a pdoc file at root()/relative (parents made).
+  std::string writePdoc(const std::string& relative, const Value& value);
+  // Writes raw bytes at root()/relative (parents made).
+  std::string writeFile(const std::string& relative, const std::string& bytes);
+  // Makes the folder root()/relative and its parents.
+  std::string makeFolder(const std::string& relative);
+
+ private:
+  std::string root_;
+};
+
+class ScopedEnv {
+ public:
+  // Sets `name` to `value`, or clears it when `value` is absent.
+  ScopedEnv(std::string name, const std::optional<std::string>& value);
+  ~ScopedEnv();
+  ScopedEnv(const ScopedEnv&) = delete;
+  ScopedEnv& operator=(const ScopedEnv&) = delete;
+
+ private:
+  std::string name_;
+  std::optional<std::string> previous_;
+};
+
+}  // namespace dr::test
