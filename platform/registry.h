@@ -1,0 +1,205 @@
+// Registry: the store of record for installed plug-ins (one entry per plug-in,
+// named by a UUID), with install and uninstall events.
+// Threads: every member is safe to call from any thread; lookups run while a
+// registration is under way and see either the state before it or after it.
+// Entries are immutable and shared (RegistryEntryPtr) and may be read from any
+// thread, also after the registry is gone. Failure: open, register and
+// unregister answer a Status whose text says why; lookups never fail.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/file_system.h"
+
+namespace dr {
+
+// Errors of the registry.
+inline constexpr const char* kRegistryErrorDomain = "registry";
+// The bundle cannot be registered (not a folder, no or broken Info.pdoc, no
+// plug-in section, ...). Nothing was stored.
+inline constexpr int64_t kRegistryRefused = 1;
+// Unregistering a path with no registered plug-ins.
+inline constexpr int64_t kRegistryNotRegistered = 2;
+// The database is held by another process and stayed so for the busy timeout.
+inline constexpr int64_t kRegistryBusy = 3;
+// The database file is damaged or is not a registry database. It is left as
+// it was: nothing is overwritten or deleted.
+inline constexpr int64_t kRegistryCorrupt = 4;
+// Any other failure of the database (I/O, full disk, a newer schema, ...).
+inline constexpr int64_t kRegistryStorage = 5;
+
+// The application that contains a plug-in bundle: the nearest enclosing
+// "*.app" folder whose Contents/PlugIns/ holds the bundle.
+struct RegistryApplication {
+  std::string url;  // canonical path of the application folder
+  // "BNBundleDisplayName", else "BNBundleName" of the application's
+  // Info.pdoc; nothing when neither is a string.
+  std::optional<std::string> displayName;
+  bool operator==(const RegistryApplication&) const = default;
+};
+
+// The stored files of one registered bundle, shared by all its entries. The
+// bytes are parsed when a dictionary is first asked for (once, thread-safe),
+// so loading many entries parses nothing.
+class RegistryBundleFiles {
+ public:
+  RegistryBundleFiles(std::string infoBytes, std::optional<std::string> entitlementsBytes);
+
+  // The information dictionary (Contents/Info.pdoc); absent when the stored
+  // bytes no longer read as a dictionary.
+  const Value& infoDictionary() const;
+  // The entitlements (Contents/Entitlements.pdoc); an empty dictionary when
+  // the bundle has none or the stored bytes no longer read as a dictionary.
+  const Value& entitlements() const;
+
+ private:
+  void parse() const;
+
+  mutable std::once_flag parsed_;
+  mutable std::string infoBytes_;                         // released once parsed
+  mutable std::optional<std::string> entitlementsBytes_;  // released once parsed
+  mutable Value info_;
+  mutable Value entitlements_;
+};
+
+// One installed plug-in as the registry records it.
+class RegistryEntry {
+ public:
+  struct Fields {
+    Uuid uuid;                     // assigned by the registry at registration
+    std::string url;               // canonical path of the plug-in bundle
+    std::string plugInIdentifier;  // never empty
+    // True when the plug-in is one of the bundle's "Multiple" plug-ins; its
+    // plug-in dictionary is then its entry there.
+    bool multiple = false;
+    std::optional<std::string> bundleIdentifier;  // "BNBundleIdentifier"
+    std::optional<std::string> bundleVersion;     // "BNBundleVersion"
+    Date registrationDate;
+    bool onSystemVolume = false;
+    std::optional<RegistryApplication> containingApplication;
+    std::optional<std::string> displayName;  // "BNBundleDisplayName", else "BNBundleName"
+    std::optional<std::string> shortName;    // "BNBundleShortName"
+  };
+
+  RegistryEntry(Fields fields, std::shared_ptr<const RegistryBundleFiles> files);
+
+  const Uuid& uuid() const { return f_.uuid; }
+  const std::string& url() const { return f_.url; }
+  const std::string& plugInIdentifier() const { return f_.plugInIdentifier; }
+  bool multiple() const { return f_.multiple; }
+  const std::optional<std::string>& bundleIdentifier() const { return f_.bundleIdentifier; }
+  const std::optional<std::string>& bundleVersion() const { return f_.bundleVersion; }
+  Date registrationDate() const { return f_.registrationDate; }
+  bool onSystemVolume() const { return f_.onSystemVolume; }
+  const std::optional<RegistryApplication>& containingApplication() const {
+    return f_.containingApplication;
+  }
+  const std::optional<std::string>& displayName() const { return f_.displayName; }
+  const std::optional<std::string>& shortName() const { return f_.shortName; }
+
+  // The bundle's information dictionary (parsed on first use).
+  const Value& infoDictionary() const { return files_->infoDictionary(); }
+  // The plug-in's own section of the information dictionary: the top
+  // dictionary ("UXExtension", else the old-style "Dromon"), or for one of
+  // several plug-ins its entry under the top dictionary's "Multiple". Absent
+  // when the information dictionary is.
+  const Value& plugInDictionary() const;
+  // Entitlement name to value (parsed on first use); empty when none.
+  const Value& entitlements() const { return files_->entitlements(); }
+
+  // "<plug-in identifier> <uuid> at <path>", for logs.
+  std::string description() const;
+
+ private:
+  const Fields f_;
+  const std::shared_ptr<const RegistryBundleFiles> files_;
+  mutable std::once_flag plugInOnce_;
+  mutable Value plugIn_;
+};
+
+using RegistryEntryPtr = std::shared_ptr<const RegistryEntry>;
+using RegistryEntries = std::vector<RegistryEntryPtr>;
+
+// Receives the registry's events on the registry's own event thread, one at a
+// time, in the order the changes were committed. Each event carries the
+// entries that were installed or uninstalled together, never an empty array.
+class RegistryObserver {
+ public:
+  virtual ~RegistryObserver() = default;
+  virtual void pluginsDidInstall(const RegistryEntries& entries) = 0;
+  virtual void pluginsDidUninstall(const RegistryEntries& entries) = 0;
+};
+
+struct RegistryOptions {
+  // The database file. Its folder is created (0700) when missing; a new
+  // database file is made 0600.
+  std::string databasePath;
+  // Folders that make up the system volume: an entry's onSystemVolume tells
+  // whether its bundle lies at or below one of them.
+  std::vector<std::string> systemRoots{"/usr"};
+  // Reads the bundles' files; never null.
+  FileSystem* fileSystem = FileSystem::Default();
+  // How long to wait for a database held by another process before failing
+  // with kRegistryBusy.
+  std::chrono::milliseconds busyTimeout{5000};
+};
+
+// The options from the environment: DR_REGISTRY, else
+// $XDG_DATA_HOME/dromon/registry.sqlite3 (XDG_DATA_HOME defaulting to
+// $HOME/.local/share); DR_SYSTEM_ROOTS (colon-separated; unset or empty means
+// /usr). Relative folders are ignored, as XDG asks. Fails when no location can
+// be made (no HOME and no XDG_DATA_HOME).
+Result<RegistryOptions> RegistryOptionsFromEnvironment(
+    const std::function<const char*(const char*)>& getenv = nullptr);
+
+class Registry {
+ public:
+  virtual ~Registry() = default;
+
+  // Opens (creating when missing) the registry database at
+  // options.databasePath and loads its entries. A damaged file fails with
+  // kRegistryCorrupt, a held one with kRegistryBusy after the busy timeout.
+  static Result<std::unique_ptr<Registry>> Open(const RegistryOptions& options);
+
+  // Events after each committed change go to `observer` until it is removed
+  // or destroyed; a destroyed observer is never called.
+  virtual void addObserver(std::weak_ptr<RegistryObserver> observer) = 0;
+  // After this returns, `observer` receives no event that has not started.
+  virtual void removeObserver(const RegistryObserver* observer) = 0;
+
+  // Every entry, in registration order (a bundle's entries by identifier).
+  virtual RegistryEntries allEntries() const = 0;
+  // The entry named `uuid`, or null.
+  virtual RegistryEntryPtr entryForUuid(const Uuid& uuid) const = 0;
+  // The entries of the bundle at `url` (any spelling of the path that
+  // resolves to it), by identifier; empty when none.
+  virtual RegistryEntries entriesForUrl(const std::string& url) const = 0;
+  // The first of entriesForUrl(url), or null.
+  virtual RegistryEntryPtr entryForUrl(const std::string& url) const = 0;
+  // The entries whose containing application is the one at `appUrl`, in
+  // registration order; empty when none (also for no application at all).
+  // The application's name is on each entry's containingApplication().
+  virtual RegistryEntries entriesWithinApplication(const std::string& appUrl) const = 0;
+
+  // Registers the plug-in bundle at `url` (an absolute path). OK means the
+  // bundle's plug-ins are registered and will survive a crash. Unchanged
+  // files: OK, nothing changes, no event. Changed files: the old entries are
+  // replaced by new ones with new UUIDs (an uninstall event, then an install
+  // event). Errors: kRegistryRefused (nothing stored), kRegistryBusy,
+  // kRegistryStorage.
+  virtual Status registerBundle(const std::string& url) = 0;
+  // Removes every entry of the bundle at `url` (the bundle need not exist any
+  // more). Errors: kRegistryNotRegistered, kRegistryBusy, kRegistryStorage.
+  virtual Status unregisterBundle(const std::string& url) = 0;
+};
+
+}  // namespace dr

@@ -1,0 +1,70 @@
+// RegistryDatabase: the SQLite file behind the registry. Internal to the
+// registry (registry_*.cc). One connection, not thread-safe: the registry
+// calls it under its write lock only. Every change is one transaction, durable
+// when it returns OK (WAL, synchronous=FULL). Failures answer a Status of
+// kRegistryErrorDomain naming the database file; a file that is damaged or not
+// a registry is reported and never written.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/file_system.h"
+#include "platform/registry_scan.h"
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace dr::registry_internal {
+
+// One registered bundle as stored: the scan it was registered from, when, and
+// the UUIDs given to its plug-ins (uuids[i] names bundle.plugIns[i]).
+struct BundleRow {
+  int64_t id = 0;  // the database's key; set by load and by commit
+  ScannedBundle bundle;
+  Date registered;
+  std::vector<Uuid> uuids;
+};
+
+class RegistryDatabase {
+ public:
+  // Opens or creates the database at `path` (its folder made 0700 through
+  // `fs`, a new file 0600), checks it, and brings its schema up to date.
+  static Result<std::unique_ptr<RegistryDatabase>> Open(const std::string& path,
+                                                        std::chrono::milliseconds busyTimeout,
+                                                        FileSystem* fs);
+  ~RegistryDatabase();
+  RegistryDatabase(const RegistryDatabase&) = delete;
+  RegistryDatabase& operator=(const RegistryDatabase&) = delete;
+
+  // Every stored bundle, in registration order, plug-ins by identifier.
+  Result<std::vector<BundleRow>> loadAll();
+
+  // In one transaction: removes the bundle stored at `removePath` (when not
+  // empty) with its plug-ins, then stores `insert` (when not null) and sets
+  // its id. On failure nothing changed.
+  Status commit(const std::string& removePath, BundleRow* insert);
+
+ private:
+  class Statement;
+  RegistryDatabase(std::string path, sqlite3* db);
+  Error errorOf(int rc, const std::string& what) const;
+  Status exec(const char* sql, const std::string& what);
+  Status checkIntegrity();
+  Status checkVersion(int version, int objects) const;
+  Status migrate();
+  Status prepareAll();
+  Status runChange(const std::string& removePath, BundleRow* insert);
+
+  const std::string path_;
+  sqlite3* db_;
+  std::unique_ptr<Statement> begin_, commit_, rollback_, deletePlugIns_, deleteBundle_,
+      insertBundle_, insertPlugIn_;
+};
+
+}  // namespace dr::registry_internal

@@ -1,0 +1,717 @@
+#include "platform/registry.h"
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sqlite3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <condition_variable>
+#include <filesystem>
+#include <functional>
+#include <map>
+#include <thread>
+
+#include "core/format.h"
+#include "tests/support/registry_bundles.h"
+
+namespace dr {
+namespace {
+
+using namespace std::chrono_literals;
+using registry_test::MakeBundle;
+using registry_test::ModeOf;
+using registry_test::PlugInInfo;
+using registry_test::ReadBytes;
+using registry_test::TempFolder;
+using registry_test::WriteBytes;
+
+// Keeps every event with the thread it arrived on.
+class Recorder : public RegistryObserver {
+ public:
+  struct Event {
+    bool install;
+    std::vector<Uuid> uuids;
+    std::thread::id thread;
+  };
+  void pluginsDidInstall(const RegistryEntries& e) override { add(true, e); }
+  void pluginsDidUninstall(const RegistryEntries& e) override { add(false, e); }
+
+  // The events, once there are at least `n` (or after 5 s).
+  std::vector<Event> waitFor(size_t n) {
+    std::unique_lock<std::mutex> lock(mu_);
+    cv_.wait_for(lock, 5s, [&] { return events_.size() >= n; });
+    return events_;
+  }
+
+ private:
+  void add(bool install, const RegistryEntries& entries) {
+    Event e{install, {}, std::this_thread::get_id()};
+    for (const auto& entry : entries) e.uuids.push_back(entry->uuid());
+    std::lock_guard<std::mutex> lock(mu_);
+    events_.push_back(std::move(e));
+    cv_.notify_all();
+  }
+  std::mutex mu_;
+  std::condition_variable cv_;
+  std::vector<Event> events_;
+};
+
+std::vector<Uuid> UuidsOf(const RegistryEntries& entries) {
+  std::vector<Uuid> out;
+  for (const auto& e : entries) out.push_back(e->uuid());
+  return out;
+}
+
+std::vector<std::string> IdentifiersOf(const RegistryEntries& entries) {
+  std::vector<std::string> out;
+  for (const auto& e : entries) out.push_back(e->plugInIdentifier());
+  return out;
+}
+
+class RegistryTest : public ::testing::Test {
+ protected:
+  RegistryOptions Options() const {
+    RegistryOptions o;
+    o.databasePath = DatabasePath();
+    o.systemRoots = {dir_ / "sys"};
+    o.busyTimeout = 300ms;
+    return o;
+  }
+  std::string DatabasePath() const { return dir_ / "data/dromon/registry.sqlite3"; }
+
+  std::unique_ptr<Registry> Open() {
+    auto r = Registry::Open(Options());
+    if (!r) {
+      ADD_FAILURE() << r.error().description();
+      return nullptr;
+    }
+    return std::move(*r);
+  }
+
+  // `registry` with a new Recorder subscribed.
+  std::shared_ptr<Recorder> Observe(Registry& registry) {
+    auto recorder = std::make_shared<Recorder>();
+    registry.addObserver(recorder);
+    return recorder;
+  }
+
+  TempFolder dir_;
+};
+
+TEST_F(RegistryTest, RegistersOneEntryPerPlugInNamedAsDeclared) {
+  const Value section{{"UXExtensionAttributes", Value{{"UXExtensionIdentifier", "com.x.attr"}}}};
+  const Value a{{"Kind", "a"}};
+  const Value b{{"Kind", "b"}};
+  const Value old{{"Attributes", Value{{"com.corvel.identifier", "com.x.old"}}}};
+  const Value base{{"BNBundleIdentifier", "com.x.bundle"}, {"BNBundleVersion", "2.1"}};
+  struct Row {
+    const char* name;
+    Value info;
+    std::vector<std::string> identifiers;
+    std::vector<Value> sections;
+    bool multiple;
+  };
+  const Row rows[] = {
+      {"attributes name it", base.changing("UXExtension", section), {"com.x.attr"}, {section}, 0},
+      {"else the bundle identifier", base.changing("UXExtension", a), {"com.x.bundle"}, {a}, 0},
+      {"an identifier that is no string",
+       base.changing("UXExtension",
+                     Value{{"UXExtensionAttributes", Value{{"UXExtensionIdentifier", 7}}}}),
+       {"com.x.bundle"},
+       {Value{{"UXExtensionAttributes", Value{{"UXExtensionIdentifier", 7}}}}},
+       false},
+      {"one per key of Multiple, in order",
+       base.changing("UXExtension", Value{{"Multiple", Value{{"z.two", b}, {"a.one", a}}}}),
+       {"a.one", "z.two"},
+       {a, b},
+       true},
+      {"old style names it in its attributes",
+       base.changing("Dromon", old),
+       {"com.x.old"},
+       {old},
+       false},
+      {"old style without attributes", base.changing("Dromon", a), {"com.x.bundle"}, {a}, false},
+      {"old style Multiple",
+       base.changing("Dromon", Value{{"Multiple", Value{{"m.one", a}}}}),
+       {"m.one"},
+       {a},
+       true},
+      {"the new section wins over the old",
+       base.changing("UXExtension", section).changing("Dromon", old),
+       {"com.x.attr"},
+       {section},
+       false},
+  };
+  const Value entitlements{{"com.corvel.security.app-sandbox", true}};
+  auto registry = Open();
+  int n = 0;
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.name);
+    const std::string path = MakeBundle(dir_ / Format("b%d.appex", n++), row.info, entitlements);
+    const double before = static_cast<double>(time(nullptr));
+    ASSERT_TRUE(registry->registerBundle(path).ok());
+    RegistryEntries entries = registry->entriesForUrl(path);
+    EXPECT_EQ(IdentifiersOf(entries), row.identifiers);
+    ASSERT_EQ(entries.size(), row.sections.size());
+    for (size_t i = 0; i < entries.size(); ++i) {
+      const RegistryEntry& e = *entries[i];
+      EXPECT_EQ(e.plugInDictionary(), row.sections[i]);
+      EXPECT_EQ(e.multiple(), row.multiple);
+      EXPECT_EQ(e.url(), path);
+      EXPECT_EQ(e.infoDictionary(), row.info);
+      EXPECT_EQ(e.entitlements(), entitlements);
+      EXPECT_GE(e.registrationDate().seconds, before - 1);
+      EXPECT_LE(e.registrationDate().seconds, before + 60);
+      EXPECT_EQ(registry->entryForUuid(e.uuid()), entries[i]);
+    }
+    if (entries.size() == 2) {
+      EXPECT_NE(entries[0]->uuid(), entries[1]->uuid());
+    }
+  }
+  EXPECT_EQ(registry->allEntries().size(), 9u);
+}
+
+TEST_F(RegistryTest, RefusesWhatIsNoPlugInBundleAndStoresNothing) {
+  const std::string b = dir_ / "x.appex";
+  const std::string info = b + "/Contents/Info.pdoc";
+  auto bytes = [&](std::string_view text) {
+    return [&, text] {
+      WriteBytes(info, text);
+      return b;
+    };
+  };
+  auto value = [&](Value v) { return [&, v] { return MakeBundle(b, v); }; };
+  auto entitlements = [&](std::string_view text) {
+    return [&, text] {
+      MakeBundle(b, PlugInInfo("e"));
+      WriteBytes(b + "/Contents/Entitlements.pdoc", text);
+      return b;
+    };
+  };
+  const std::string noSection =
+      "Contents/Info.pdoc holds neither \"UXExtension\" nor \"Dromon\" as a dictionary";
+  struct Row {
+    const char* name;
+    std::function<std::string()> make;
+    std::string reason;
+    bool exact;  // else the reason is followed by a parser's or the system's text
+  };
+  const Row rows[] = {
+      {"missing", [&] { return dir_ / "missing.appex"; }, "resolve: No such file or directory",
+       true},
+      {"relative", [] { return std::string("x.appex"); }, "not an absolute path", true},
+      {"a file",
+       [&] {
+         WriteBytes(b, "x");
+         return b;
+       },
+       "not a plug-in bundle (not a folder)", true},
+      {"no Info.pdoc",
+       [&] {
+         std::filesystem::create_directories(b + "/Contents");
+         return b;
+       },
+       "not a plug-in bundle (no Contents/Info.pdoc)", true},
+      {"unreadable Info.pdoc",
+       [&] {
+         std::filesystem::create_directories(info);
+         return b;
+       },
+       "cannot read Contents/Info.pdoc: ", false},
+      {"garbage", bytes("\x01\x02 not a document"),
+       "Contents/Info.pdoc is not a valid pdoc document: ", false},
+      {"cut-off XML", bytes("<?xml version=\"1.0\"?><pdoc version=\"1.0\"><dict><key>a"),
+       "Contents/Info.pdoc is not a valid pdoc document: ", false},
+      {"an array", value(Value(Array{Value("a")})), "Contents/Info.pdoc does not hold a dictionary",
+       true},
+      {"no plug-in section", value(Value{{"BNBundleIdentifier", "a"}}), noSection, true},
+      {"a section that is a string", value(Value{{"UXExtension", "x"}, {"Dromon", 1}}), noSection,
+       true},
+      {"Multiple no dictionary", value(Value{{"UXExtension", Value{{"Multiple", "x"}}}}),
+       "\"Multiple\" is not a dictionary of plug-ins", true},
+      {"Multiple empty",
+       value(Value{{"UXExtension", Value{{"Multiple", Value::EmptyDictionary()}}}}),
+       "\"Multiple\" is not a dictionary of plug-ins", true},
+      {"a Multiple entry no dictionary",
+       value(Value{{"UXExtension", Value{{"Multiple", Value{{"a", Value{{"k", 1}}}, {"b", 2}}}}}}),
+       "plug-in \"b\" of \"Multiple\" is not a dictionary", true},
+      {"no identifier", value(Value{{"UXExtension", Value{{"UXExtensionAttributes", 1}}}}),
+       "the plug-in has no identifier (no \"UXExtensionIdentifier\" attribute and no "
+       "\"BNBundleIdentifier\")",
+       true},
+      {"garbage entitlements", entitlements("{ nope"),
+       "Contents/Entitlements.pdoc is not a valid pdoc document: ", false},
+      {"entitlements no dictionary", entitlements("[true]"),
+       "Contents/Entitlements.pdoc does not hold a dictionary", true},
+  };
+  auto registry = Open();
+  auto recorder = Observe(*registry);
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.name);
+    std::filesystem::remove_all(b);
+    const std::string url = row.make();
+    Status s = registry->registerBundle(url);
+    ASSERT_FALSE(s.ok());
+    EXPECT_EQ(s.error().domain(), kRegistryErrorDomain);
+    EXPECT_EQ(s.error().code(), kRegistryRefused);
+    const std::string expected = "cannot register \"" + url + "\": " + row.reason;
+    const std::string text = s.error().localizedDescription();
+    if (row.exact) {
+      EXPECT_EQ(text, expected);
+    } else {
+      EXPECT_TRUE(text.starts_with(expected) && text.size() > expected.size()) << text;
+    }
+  }
+  EXPECT_TRUE(registry->allEntries().empty());
+  // Events leave in commit order: if a refused bundle had produced one, it
+  // would come before this install.
+  ASSERT_TRUE(registry->registerBundle(MakeBundle(dir_ / "good.appex", PlugInInfo("g"))).ok());
+  auto events = recorder->waitFor(1);
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_TRUE(events[0].install);
+  registry.reset();
+  EXPECT_EQ(IdentifiersOf(Open()->allEntries()), std::vector<std::string>{"com.example.g.ext"});
+}
+
+TEST_F(RegistryTest, ReRegisteringKeepsUnchangedFilesAndReplacesChangedOnes) {
+  const Value info = PlugInInfo("r");
+  struct Row {
+    const char* name;
+    std::function<void(const std::string& bundle)> change;
+    bool replaced;
+  };
+  const Row rows[] = {
+      {"same files", [](const std::string&) {}, false},
+      {"same bytes written again",
+       [](const std::string& p) {
+         WriteBytes(p + "/Contents/Info.pdoc", ReadBytes(p + "/Contents/Info.pdoc"));
+       },
+       false},
+      {"information changed",
+       [&](const std::string& p) { MakeBundle(p, info.changing("BNBundleVersion", "2.0")); }, true},
+      {"entitlements changed",
+       [&](const std::string& p) {
+         MakeBundle(p, info, Value{{"b", 1}});
+       },
+       true},
+      {"entitlements removed",
+       [](const std::string& p) { std::filesystem::remove(p + "/Contents/Entitlements.pdoc"); },
+       true},
+  };
+  auto registry = Open();
+  auto recorder = Observe(*registry);
+  std::vector<std::pair<bool, std::vector<Uuid>>> expected;
+  int n = 0;
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.name);
+    const std::string path = MakeBundle(dir_ / Format("r%d.appex", n++), info, Value{{"a", 1}});
+    ASSERT_TRUE(registry->registerBundle(path).ok());
+    const RegistryEntries before = registry->entriesForUrl(path);
+    expected.push_back({true, UuidsOf(before)});
+    row.change(path);
+    ASSERT_TRUE(registry->registerBundle(path).ok());
+    const RegistryEntries after = registry->entriesForUrl(path);
+    ASSERT_EQ(after.size(), 1u);
+    if (row.replaced) {
+      EXPECT_NE(after[0]->uuid(), before[0]->uuid());
+      EXPECT_EQ(registry->entryForUuid(before[0]->uuid()), nullptr);
+      EXPECT_EQ(ReadBytes(path + "/Contents/Info.pdoc").empty(), false);
+      expected.push_back({false, UuidsOf(before)});
+      expected.push_back({true, UuidsOf(after)});
+    } else {
+      EXPECT_EQ(after[0], before[0]);  // the very entry, date and all
+    }
+  }
+  EXPECT_EQ(registry->entriesForUrl(dir_ / "r2.appex")[0]->bundleVersion(), "2.0");
+  EXPECT_EQ(registry->entriesForUrl(dir_ / "r4.appex")[0]->entitlements(),
+            Value::EmptyDictionary());
+  auto events = recorder->waitFor(expected.size());
+  ASSERT_EQ(events.size(), expected.size());
+  for (size_t i = 0; i < events.size(); ++i) {
+    EXPECT_EQ(events[i].install, expected[i].first) << i;
+    EXPECT_EQ(events[i].uuids, expected[i].second) << i;
+  }
+}
+
+TEST_F(RegistryTest, UnregisteringRemovesEveryEntryOfTheBundle) {
+  const Value multiple{{"UXExtension", Value{{"Multiple", Value{{"m.a", Value{{"k", 1}}},
+                                                                {"m.b", Value{{"k", 2}}},
+                                                                {"m.c", Value{{"k", 3}}}}}}}};
+  auto registry = Open();
+  auto recorder = Observe(*registry);
+  const std::string many = MakeBundle(dir_ / "many.appex", multiple);
+  const std::string other = MakeBundle(dir_ / "other.appex", PlugInInfo("o"));
+  const std::string gone = MakeBundle(dir_ / "gone.appex", PlugInInfo("g"));
+  std::filesystem::create_directory_symlink(many, dir_ / "link.appex");
+  for (const auto& p : {many, other, gone}) ASSERT_TRUE(registry->registerBundle(p).ok());
+  const std::vector<Uuid> manyUuids = UuidsOf(registry->entriesForUrl(many));
+  ASSERT_EQ(manyUuids.size(), 3u);
+
+  // Through a link to it; then a bundle already deleted from disk.
+  EXPECT_TRUE(registry->unregisterBundle(dir_ / "link.appex").ok());
+  std::filesystem::remove_all(gone);
+  EXPECT_TRUE(registry->unregisterBundle(gone).ok());
+  EXPECT_EQ(IdentifiersOf(registry->allEntries()), std::vector<std::string>{"com.example.o.ext"});
+  for (const Uuid& u : manyUuids) EXPECT_EQ(registry->entryForUuid(u), nullptr);
+
+  for (const std::string& url : {many, gone, dir_ / "never.appex", std::string("rel.appex")}) {
+    Status s = registry->unregisterBundle(url);
+    ASSERT_FALSE(s.ok()) << url;
+    EXPECT_EQ(s.error().code(), kRegistryNotRegistered);
+    EXPECT_EQ(s.error().localizedDescription(),
+              "cannot unregister \"" + url + "\": no plug-in is registered there");
+  }
+  auto events = recorder->waitFor(5);
+  ASSERT_EQ(events.size(), 5u);
+  EXPECT_FALSE(events[3].install);
+  EXPECT_EQ(events[3].uuids, manyUuids);
+  EXPECT_FALSE(events[4].install);
+  EXPECT_EQ(events[4].uuids.size(), 1u);
+  registry.reset();
+  EXPECT_EQ(Open()->allEntries().size(), 1u);
+}
+
+TEST_F(RegistryTest, RecordsContainingApplicationNamesAndSystemVolume) {
+  const Value both{{"BNBundleDisplayName", "Mail Pro"}, {"BNBundleName", "Mail"}};
+  const Value nameOnly{{"BNBundleName", "Mail"}, {"BNBundleDisplayName", 3}};
+  struct Row {
+    const char* bundle;  // below the temporary folder
+    const char* app;     // its expected application, "" for none
+    Value appInfo;       // absent: the application has no Info.pdoc
+    std::optional<std::string> appName;
+    bool system;
+  };
+  const Row rows[] = {
+      {"A.app/Contents/PlugIns/p.appex", "A.app", both, "Mail Pro", false},
+      {"B.app/Contents/PlugIns/p.appex", "B.app", nameOnly, "Mail", false},
+      {"C.app/Contents/PlugIns/deeper/p.appex", "C.app", Value(), std::nullopt, false},
+      {"D.app/Contents/Resources/p.appex", "", Value(), std::nullopt, false},
+      {"E.app/Contents/PlugIns/In.app/Contents/PlugIns/p.appex", "E.app/Contents/PlugIns/In.app",
+       both, "Mail Pro", false},
+      {"F.app/Contents/PlugIns/In.app/Contents/Resources/p.appex", "F.app", nameOnly, "Mail",
+       false},
+      {"free/p.appex", "", Value(), std::nullopt, false},
+      {"sys/lib/p.appex", "", Value(), std::nullopt, true},
+      {"sys/G.app/Contents/PlugIns/p.appex", "sys/G.app", both, "Mail Pro", true},
+      {"system/p.appex", "", Value(), std::nullopt, false},
+  };
+  auto registry = Open();
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.bundle);
+    const std::string app = dir_ / row.app;
+    if (row.appInfo.isPresent()) MakeBundle(app, row.appInfo);
+    const std::string path = MakeBundle(dir_ / row.bundle, PlugInInfo("c"));
+    ASSERT_TRUE(registry->registerBundle(path).ok());
+    RegistryEntryPtr e = registry->entryForUrl(path);
+    ASSERT_NE(e, nullptr);
+    EXPECT_EQ(e->onSystemVolume(), row.system);
+    if (*row.app == '\0') {
+      EXPECT_FALSE(e->containingApplication().has_value());
+      continue;
+    }
+    EXPECT_EQ(e->containingApplication(), (RegistryApplication{app, row.appName}));
+    EXPECT_EQ(UuidsOf(registry->entriesWithinApplication(app)), std::vector<Uuid>{e->uuid()});
+  }
+  EXPECT_TRUE(registry->entriesWithinApplication(dir_ / "D.app").empty());
+  EXPECT_TRUE(registry->entriesWithinApplication(dir_ / "nothing.app").empty());
+}
+
+TEST_F(RegistryTest, FindsEntriesByAnySpellingOfTheirPath) {
+  auto registry = Open();
+  const std::string a = MakeBundle(dir_ / "in/a.appex", PlugInInfo("a"));
+  const std::string b = MakeBundle(dir_ / "in/b.appex", PlugInInfo("b"));
+  std::filesystem::create_directory_symlink(dir_ / "in", dir_ / "alias");
+  ASSERT_TRUE(registry->registerBundle(dir_ / "alias/./b.appex/").ok());
+  ASSERT_TRUE(registry->registerBundle(a).ok());
+  EXPECT_EQ(registry->entryForUrl(b)->url(), b);  // stored under its canonical path
+  EXPECT_EQ(IdentifiersOf(registry->allEntries()),
+            (std::vector<std::string>{"com.example.b.ext", "com.example.a.ext"}));
+  for (const std::string& url : {a, dir_ / "alias/a.appex", dir_ / "in/../in/a.appex", a + "/",
+                                 dir_.path() + "//in/a.appex"}) {
+    ASSERT_NE(registry->entryForUrl(url), nullptr) << url;
+    EXPECT_EQ(registry->entryForUrl(url)->plugInIdentifier(), "com.example.a.ext") << url;
+  }
+  for (const std::string& url : {dir_ / "in", std::string("in/a.appex"), std::string()}) {
+    EXPECT_EQ(registry->entryForUrl(url), nullptr) << url;
+    EXPECT_TRUE(registry->entriesForUrl(url).empty()) << url;
+  }
+  EXPECT_EQ(registry->entryForUuid(Uuid::random()), nullptr);
+}
+
+TEST_F(RegistryTest, DeliversEventsInCommitOrderOnItsOwnThreadToLiveObservers) {
+  auto registry = Open();
+  auto recorder = Observe(*registry);
+  auto removed = Observe(*registry);
+  auto destroyed = Observe(*registry);
+  registry->removeObserver(removed.get());
+  std::weak_ptr<Recorder> destroyedWeak = destroyed;
+  destroyed.reset();
+  EXPECT_TRUE(destroyedWeak.expired());  // the registry does not keep it alive
+
+  const std::string a = MakeBundle(dir_ / "a.appex", PlugInInfo("a"));
+  const std::string b = MakeBundle(dir_ / "b.appex", PlugInInfo("b"));
+  ASSERT_TRUE(registry->registerBundle(a).ok());
+  const Uuid a1 = registry->entryForUrl(a)->uuid();
+  ASSERT_TRUE(registry->registerBundle(b).ok());
+  const Uuid b1 = registry->entryForUrl(b)->uuid();
+  MakeBundle(a, PlugInInfo("a").changing("BNBundleVersion", "9"));
+  ASSERT_TRUE(registry->registerBundle(a).ok());
+  const Uuid a2 = registry->entryForUrl(a)->uuid();
+  ASSERT_TRUE(registry->unregisterBundle(b).ok());
+
+  const std::vector<std::pair<bool, Uuid>> expected = {
+      {true, a1}, {true, b1}, {false, a1}, {true, a2}, {false, b1}};
+  auto events = recorder->waitFor(expected.size());
+  ASSERT_EQ(events.size(), expected.size());
+  for (size_t i = 0; i < events.size(); ++i) {
+    EXPECT_EQ(events[i].install, expected[i].first) << i;
+    EXPECT_EQ(events[i].uuids, std::vector<Uuid>{expected[i].second}) << i;
+    EXPECT_NE(events[i].thread, std::this_thread::get_id());
+    EXPECT_EQ(events[i].thread, events[0].thread);
+  }
+  registry.reset();  // delivers anything still queued
+  EXPECT_TRUE(removed->waitFor(0).empty());
+}
+
+TEST_F(RegistryTest, KeepsEverythingAcrossReopeningInPrivateFiles) {
+  const std::string app = MakeBundle(dir_ / "A.app", Value{{"BNBundleName", "App"}});
+  const Value info = PlugInInfo("p")
+                         .changing("BNBundleName", "N")
+                         .changing("BNBundleShortName", "S")
+                         .changing("BNBundleVersion", 7);  // a number reads as its text
+  const std::string path = MakeBundle(app + "/Contents/PlugIns/p.appex", info, Value{{"e", 1}});
+  auto registry = Open();
+  ASSERT_TRUE(registry->registerBundle(path).ok());
+  const RegistryEntryPtr before = registry->entryForUrl(path);
+  registry.reset();
+  EXPECT_EQ(ModeOf(DatabasePath()), 0600u);
+  EXPECT_EQ(ModeOf(dir_ / "data/dromon"), 0700u);
+  EXPECT_EQ(ModeOf(dir_ / "data"), 0700u);
+
+  registry = Open();
+  RegistryEntries all = registry->allEntries();
+  ASSERT_EQ(all.size(), 1u);
+  const RegistryEntry& e = *all[0];
+  EXPECT_EQ(e.uuid(), before->uuid());
+  EXPECT_EQ(e.url(), path);
+  EXPECT_EQ(e.plugInIdentifier(), "com.example.p.ext");
+  EXPECT_EQ(e.bundleIdentifier(), "com.example.p");
+  EXPECT_EQ(e.bundleVersion(), "7");
+  EXPECT_EQ(e.registrationDate(), before->registrationDate());
+  EXPECT_EQ(e.containingApplication(), (RegistryApplication{app, "App"}));
+  EXPECT_EQ(e.displayName(), "N");
+  EXPECT_EQ(e.shortName(), "S");
+  EXPECT_EQ(e.infoDictionary(), info);
+  EXPECT_EQ(e.plugInDictionary(), info["UXExtension"]);
+  EXPECT_EQ(e.entitlements(), (Value{{"e", 1}}));
+  EXPECT_EQ(registry->entryForUuid(e.uuid()), all[0]);
+  // Unchanged files: still the same registration after reopening.
+  ASSERT_TRUE(registry->registerBundle(path).ok());
+  EXPECT_EQ(registry->entryForUrl(path), all[0]);
+}
+
+TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
+  const std::string path = MakeBundle(dir_ / "k.appex", PlugInInfo("k"));
+  Open().reset();  // the database exists before the child writes to it
+  int fds[2];
+  ASSERT_EQ(pipe(fds), 0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    close(fds[0]);
+    auto registry = Registry::Open(Options());
+    if (registry && (*registry)->registerBundle(path).ok()) {
+      char yes = 'y';
+      if (write(fds[1], &yes, 1) != 1) _exit(2);
+    }
+    for (;;) pause();
+  }
+  close(fds[1]);
+  char reply = 0;
+  ASSERT_EQ(read(fds[0], &reply, 1), 1);
+  close(fds[0]);
+  kill(child, SIGKILL);
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFSIGNALED(status));
+  auto registry = Open();
+  ASSERT_NE(registry, nullptr);
+  EXPECT_EQ(IdentifiersOf(registry->entriesForUrl(path)),
+            std::vector<std::string>{"com.example.k.ext"});
+}
+
+// Runs `sql` on its own connection to `path`; answers sqlite3_exec's code.
+int RunSql(const std::string& path, const char* sql) {
+  sqlite3* db = nullptr;
+  int rc = sqlite3_open(path.c_str(), &db);
+  if (rc == SQLITE_OK) rc = sqlite3_exec(db, sql, nullptr, nullptr, nullptr);
+  sqlite3_close(db);
+  return rc;
+}
+
+TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
+  {
+    auto registry = Open();
+    const Value big = PlugInInfo("x").changing("Padding", std::string(3000, 'p'));
+    for (int i = 0; i < 30; ++i) {
+      ASSERT_TRUE(registry->registerBundle(MakeBundle(dir_ / Format("x%d.appex", i), big)).ok());
+    }
+  }
+  const std::string good = ReadBytes(DatabasePath());
+  ASSERT_GT(good.size(), 100000u);
+  ASSERT_FALSE(std::filesystem::exists(DatabasePath() + "-wal"));
+  struct Row {
+    const char* name;
+    std::function<void(const std::string& path)> damage;
+    int64_t code;
+    std::string text;  // part of the error's text
+  };
+  const std::string leftAlone = "; it was left as it is";
+  const Row rows[] = {
+      {"not a database", [](const std::string& p) { WriteBytes(p, std::string(8192, 'g')); },
+       kRegistryCorrupt,
+       "file is not a database (the file is damaged or is not a registry "
+       "database; it was left as it is)"},
+      {"cut to 50 bytes", [&](const std::string& p) { WriteBytes(p, good.substr(0, 50)); },
+       kRegistryCorrupt, ""},
+      {"cut in half", [&](const std::string& p) { WriteBytes(p, good.substr(0, good.size() / 2)); },
+       kRegistryCorrupt, leftAlone},
+      {"a page overwritten",
+       [&](const std::string& p) {
+         WriteBytes(p, good.substr(0, 8192) + std::string(4096, '\xff') + good.substr(12288));
+       },
+       kRegistryCorrupt, leftAlone},
+      {"another program's database",
+       [](const std::string& p) {
+         std::filesystem::remove(p);
+         ASSERT_EQ(RunSql(p, "CREATE TABLE notes (text TEXT)"), SQLITE_OK);
+       },
+       kRegistryCorrupt, "the file holds another kind of database; it was left as it is"},
+      {"a newer schema",
+       [&](const std::string& p) {
+         WriteBytes(p, good);
+         ASSERT_EQ(RunSql(p, "PRAGMA user_version = 99"), SQLITE_OK);
+       },
+       kRegistryStorage,
+       "schema version 99 is newer than this program knows (1); it was left as it is"},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.name);
+    row.damage(DatabasePath());
+    const std::string damaged = ReadBytes(DatabasePath());
+    auto registry = Registry::Open(Options());
+    ASSERT_FALSE(registry.ok());
+    EXPECT_EQ(registry.error().code(), row.code) << registry.error().description();
+    const std::string text = registry.error().localizedDescription();
+    EXPECT_TRUE(text.starts_with("registry database \"" + DatabasePath() + "\": ")) << text;
+    EXPECT_NE(text.find(row.text), std::string::npos) << text;
+    EXPECT_EQ(ReadBytes(DatabasePath()), damaged);
+  }
+}
+
+TEST_F(RegistryTest, DatabaseHeldByAnotherConnectionFailsClearlyAfterTheTimeout) {
+  Open().reset();
+  sqlite3* other = nullptr;
+  ASSERT_EQ(sqlite3_open(DatabasePath().c_str(), &other), SQLITE_OK);
+  std::unique_ptr<sqlite3, decltype(&sqlite3_close)> closer(other, &sqlite3_close);
+  ASSERT_EQ(sqlite3_exec(other, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
+  auto registry = Open();
+  ASSERT_NE(registry, nullptr);
+  const std::string path = MakeBundle(dir_ / "h.appex", PlugInInfo("h"));
+  Status s = registry->registerBundle(path);
+  ASSERT_FALSE(s.ok());
+  EXPECT_EQ(s.error().code(), kRegistryBusy);
+  EXPECT_EQ(s.error().localizedDescription(),
+            "cannot register \"" + path + "\": registry database \"" + DatabasePath() +
+                "\": cannot begin a change: database is locked (the file is in use by another "
+                "process)");
+  EXPECT_TRUE(registry->allEntries().empty());
+  ASSERT_EQ(sqlite3_exec(other, "ROLLBACK", nullptr, nullptr, nullptr), SQLITE_OK);
+  EXPECT_TRUE(registry->registerBundle(path).ok());
+  registry.reset();
+
+  // A connection that keeps the file to itself blocks even opening.
+  ASSERT_EQ(sqlite3_exec(other, "PRAGMA locking_mode=EXCLUSIVE; BEGIN EXCLUSIVE;", nullptr, nullptr,
+                         nullptr),
+            SQLITE_OK);
+  auto blocked = Registry::Open(Options());
+  ASSERT_FALSE(blocked.ok());
+  EXPECT_EQ(blocked.error().code(), kRegistryBusy) << blocked.error().description();
+}
+
+TEST_F(RegistryTest, LookupsStayConsistentWhileRegistering) {
+  const Value multiple{{"BNBundleIdentifier", "com.x.m"},
+                       {"UXExtension", Value{{"Multiple", Value{{"p.a", Value{{"k", 1}}},
+                                                                {"p.b", Value{{"k", 2}}},
+                                                                {"p.c", Value{{"k", 3}}}}}}}};
+  std::vector<std::string> paths;
+  for (int i = 0; i < 8; ++i) paths.push_back(MakeBundle(dir_ / Format("m%d.appex", i), multiple));
+  auto registry = Open();
+  std::atomic<bool> done{false};
+  std::atomic<int> faults{0};
+  std::vector<std::thread> readers;
+  for (int t = 0; t < 4; ++t) {
+    readers.emplace_back([&, t] {
+      while (!done) {
+        for (const RegistryEntryPtr& e : registry->allEntries()) {
+          // The dictionaries are parsed on first use, from whichever thread.
+          if (e->plugInDictionary()["k"].intValue() < 1 || !e->infoDictionary().isDictionary() ||
+              !e->entitlements().isDictionary()) {
+            ++faults;
+          }
+          RegistryEntryPtr same = registry->entryForUuid(e->uuid());
+          if (same && same != e) ++faults;
+        }
+        size_t n = registry->entriesForUrl(paths[t]).size();
+        if (n != 0 && n != 3) ++faults;  // never half a bundle
+      }
+    });
+  }
+  for (int round = 0; round < 5; ++round) {
+    for (size_t i = 0; i < paths.size(); ++i) {
+      MakeBundle(paths[i], multiple.changing("BNBundleVersion", Format("%d", round)));
+      EXPECT_TRUE(registry->registerBundle(paths[i]).ok());
+      if ((i + round) % 3 == 0) {
+        EXPECT_TRUE(registry->unregisterBundle(paths[i]).ok());
+      }
+    }
+  }
+  done = true;
+  for (auto& r : readers) r.join();
+  EXPECT_EQ(faults.load(), 0);
+  size_t expected = 0;
+  for (size_t i = 0; i < paths.size(); ++i) expected += (i + 4) % 3 == 0 ? 0 : 3;
+  EXPECT_EQ(registry->allEntries().size(), expected);
+}
+
+TEST(RegistryOptionsTest, ComeFromTheEnvironment) {
+  struct Row {
+    std::map<std::string, std::string> env;
+    std::string path;
+    std::vector<std::string> roots;
+  };
+  const Row rows[] = {
+      {{{"DR_REGISTRY", "/r/db"}, {"XDG_DATA_HOME", "/x"}, {"HOME", "/h"}}, "/r/db", {"/usr"}},
+      {{{"XDG_DATA_HOME", "/x"}, {"HOME", "/h"}}, "/x/dromon/registry.sqlite3", {"/usr"}},
+      {{{"XDG_DATA_HOME", "rel"}, {"HOME", "/h"}, {"DR_SYSTEM_ROOTS", ""}},
+       "/h/.local/share/dromon/registry.sqlite3",
+       {"/usr"}},
+      {{{"HOME", "/h"}, {"DR_SYSTEM_ROOTS", "/a::rel:/b/"}},
+       "/h/.local/share/dromon/registry.sqlite3",
+       {"/a", "/b/"}},
+  };
+  for (const Row& row : rows) {
+    auto options = RegistryOptionsFromEnvironment([&](const char* name) -> const char* {
+      auto it = row.env.find(name);
+      return it == row.env.end() ? nullptr : it->second.c_str();
+    });
+    ASSERT_TRUE(options.ok());
+    EXPECT_EQ(options->databasePath, row.path);
+    EXPECT_EQ(options->systemRoots, row.roots);
+  }
+}
+
+}  // namespace
+}  // namespace dr
