@@ -1,0 +1,54 @@
+// Policy: the administrator's deny list of plug-ins (the configuration
+// profile), from one pdoc dictionary file:
+//
+//   DeniedPlugIns         array of plug-in identifiers no host may use
+//   DeniedPlugInsByHost   dictionary: host bundle identifier -> such an array
+//
+// A plug-in may be used unless the policy denies its identifier. No file:
+// nothing is denied. The file is looked at (stat) on every question and read
+// again when it changed. A broken file is logged once per version and the
+// last policy read well stays in force (nothing denied if there was none).
+// Thread-safe.
+#pragma once
+
+#include <sys/types.h>
+
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/file_system.h"
+#include "platform/locations.h"
+#include "platform/process_info.h"
+
+namespace dr {
+
+struct PolicyOptions {
+  std::string path;
+};
+
+// DR_POLICY, else /etc/dromon/policy.pdoc.
+PolicyOptions PolicyOptionsFromEnvironment(const EnvironmentLookup& getenv = nullptr);
+
+class Policy {
+ public:
+  virtual ~Policy() = default;
+
+  // Whether the host whose bundle identifier is `hostBundleIdentifier`
+  // (empty for a host that lies in no bundle) may use the plug-in
+  // `plugInIdentifier`.
+  virtual bool mayHostUsePlugIn(std::string_view hostBundleIdentifier,
+                                std::string_view plugInIdentifier) = 0;
+
+  // The same for the process `pid`: its host identifier is the
+  // "BNBundleIdentifier" of the bundle its executable lies in. A process
+  // whose executable cannot be found is judged by the list for every host.
+  virtual bool mayProcessUsePlugIn(pid_t pid, std::string_view plugInIdentifier) = 0;
+};
+
+// `processes` and `fs` must outlive the policy.
+std::unique_ptr<Policy> MakeFilePolicy(PolicyOptions options,
+                                       ProcessInfo* processes = ProcessInfo::Default(),
+                                       FileSystem* fs = FileSystem::Default());
+
+}  // namespace dr

@@ -1,0 +1,98 @@
+// The user's exclusions, read from the current host's preferences file.
+#include "daemon/user_prefs.h"
+
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "core/log.h"
+#include "platform/pdoc.h"
+#include "tests/support/process_fixtures.h"
+
+namespace dr {
+namespace {
+
+using testing::TempFolder;
+using testing::WriteTestFile;
+
+class UserPrefsTest : public ::testing::Test {
+ protected:
+  UserPrefsTest()
+      : options_{folder_ / "config/dromon", "0123abcd"},
+        preferences_(MakeFilePreferences(options_)),
+        prefs_(preferences_.get()) {
+    EXPECT_TRUE(FileSystem::Default()->makeDirectories(options_.directory + "/ByHost").ok());
+  }
+
+  std::string hostFile() const {
+    return options_.directory + "/ByHost/com.corvel.dromon.userprefs.0123abcd.pdoc";
+  }
+
+  TempFolder folder_;
+  PreferencesOptions options_;
+  std::unique_ptr<Preferences> preferences_;
+  DRDUserPrefs prefs_;
+};
+
+const Value kRules = Value(Array{Value{{"UXExtensionIdentifier", Value("com.example.hidden")}}});
+
+TEST_F(UserPrefsTest, ValueWrittenByAnotherProcessIsSeenAtTheNextRead) {
+  EXPECT_TRUE(prefs_.exclusions().isAbsent());  // no file yet
+  pid_t pid = ::fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    bool ok = pdoc::WriteFile(hostFile(), Value{{"exclusions", kRules}}).ok();
+    ::_exit(ok ? 0 : 1);
+  }
+  int status;
+  ASSERT_EQ(::waitpid(pid, &status, 0), pid);
+  ASSERT_EQ(WEXITSTATUS(status), 0);
+  EXPECT_EQ(prefs_.exclusions(), kRules);
+
+  // Replaced by something that is not an array: answered as it is.
+  ASSERT_TRUE(pdoc::WriteFile(hostFile(), Value{{"exclusions", Value("odd")}}).ok());
+  EXPECT_EQ(prefs_.exclusions(), Value("odd"));
+}
+
+TEST_F(UserPrefsTest, PreferencesForAnyHostOrAnotherHostAreNotRead) {
+  ASSERT_TRUE(pdoc::WriteFile(options_.directory + "/com.corvel.dromon.userprefs.pdoc",
+                              Value{{"exclusions", kRules}})
+                  .ok());
+  ASSERT_TRUE(pdoc::WriteFile(options_.directory + "/ByHost/com.corvel.dromon.userprefs.ffff.pdoc",
+                              Value{{"exclusions", kRules}})
+                  .ok());
+  EXPECT_TRUE(prefs_.exclusions().isAbsent());
+}
+
+TEST_F(UserPrefsTest, BrokenFileReadsAsNoExclusionsAndIsLoggedOnce) {
+  ScopedLogCapture log;
+  for (const char* bytes : {"<pdoc><dict><key>exclusions", "[1, 2]"}) {
+    SCOPED_TRACE(bytes);
+    log.clear();
+    ASSERT_TRUE(WriteTestFile(hostFile(), bytes));
+    EXPECT_TRUE(prefs_.exclusions().isAbsent());
+    EXPECT_TRUE(prefs_.exclusions().isAbsent());
+    EXPECT_EQ(log.lines().size(), 1u);
+    EXPECT_TRUE(log.contains(hostFile()));
+  }
+}
+
+TEST(PreferencesOptionsTest, LocationsComeFromTheEnvironment) {
+  auto env = [](const char* name) -> const char* {
+    std::string n = name;
+    if (n == "XDG_CONFIG_HOME") return "/cfg";
+    if (n == "HOME") return "/home/u";
+    return nullptr;
+  };
+  PreferencesOptions options = PreferencesOptionsFromEnvironment(env);
+  EXPECT_EQ(options.directory, "/cfg/dromon");
+  EXPECT_FALSE(options.hostId.empty());
+  EXPECT_EQ(options.hostId.find_first_of(" \n/"), std::string::npos);
+  auto noXdg = [](const char* name) -> const char* {
+    return std::string(name) == "HOME" ? "/home/u" : nullptr;
+  };
+  EXPECT_EQ(PreferencesOptionsFromEnvironment(noXdg).directory, "/home/u/.config/dromon");
+}
+
+}  // namespace
+}  // namespace dr

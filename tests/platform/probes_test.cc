@@ -1,0 +1,104 @@
+// The trace probes as a tracer sees them: the notes of the built program,
+// read with readelf, list all ten probes of provider drd with their
+// semaphores and argument sizes.
+#include "platform/probes.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <map>
+#include <regex>
+#include <string>
+
+namespace dr {
+namespace {
+
+struct NoteProbe {
+  std::string semaphore;
+  std::string arguments;
+};
+
+// Provider-drd probes of the running test program, by name.
+std::map<std::string, NoteProbe> ReadProbeNotes() {
+  char exe[4096];
+  ssize_t n = ::readlink("/proc/self/exe", exe, sizeof exe - 1);
+  if (n <= 0) return {};
+  exe[n] = '\0';
+  std::string command = "readelf -n '" + std::string(exe) + "' 2>&1";
+  FILE* pipe = ::popen(command.c_str(), "r");
+  if (pipe == nullptr) return {};
+  std::map<std::string, NoteProbe> probes;
+  std::string provider, name;
+  char line[4096];
+  static const std::regex kField(R"(^\s*(Provider|Name|Location|Arguments):\s*(.*?)\s*$)");
+  static const std::regex kSemaphore(R"(Semaphore:\s*(0x[0-9a-f]+))");
+  while (std::fgets(line, sizeof line, pipe) != nullptr) {
+    std::smatch m;
+    std::string text = line;
+    if (!std::regex_match(text, m, kField)) continue;
+    if (m[1] == "Provider") provider = m[2];
+    if (m[1] == "Name") name = m[2];
+    if (provider != "drd") continue;
+    if (std::smatch s; m[1] == "Location" && std::regex_search(text, s, kSemaphore)) {
+      probes[name].semaphore = s[1];
+    }
+    if (m[1] == "Arguments") probes[name].arguments = m[2];
+  }
+  ::pclose(pipe);
+  return probes;
+}
+
+// Argument sizes as the notes state them ("-4@%edi 8@%rsi" -> "-4 8").
+std::string Sizes(const std::string& arguments) {
+  static const std::regex kSize(R"((-?\d+)@\S+)");
+  std::string out;
+  for (std::sregex_iterator it(arguments.begin(), arguments.end(), kSize), end; it != end; ++it) {
+    if (!out.empty()) out += ' ';
+    out += (*it)[1];
+  }
+  return out;
+}
+
+TEST(ProbesTest, ReadelfListsAllTenProbesWithSemaphoresAndArgumentSizes) {
+  // Every probe is used here, so its note is part of this program.
+  int pid = static_cast<int>(::getpid());
+  probes::ClientNew(pid);
+  probes::ClientDone(pid);
+  probes::Request(pid, nullptr);
+  if (probes::RequestInputEnabled()) probes::RequestInput(pid, "{ }");
+  if (probes::RequestOutputEnabled()) probes::RequestOutput(pid, "{ }");
+  probes::RequestInput(pid, "in");
+  probes::RequestOutput(pid, "out");
+  probes::DbLoad("Dromon", 7);
+  probes::DiscoverRaw(3u);
+  probes::PluginAdd("/p");
+  probes::PluginRemove("/p", true);
+  probes::PluginReady("1B4E28BA-2FA1-11D2-883F-0016D3CCA427");
+  // No tracer is attached.
+  EXPECT_FALSE(probes::RequestInputEnabled());
+  EXPECT_FALSE(probes::RequestOutputEnabled());
+
+  std::map<std::string, NoteProbe> notes = ReadProbeNotes();
+  struct Expected {
+    const char* name;
+    const char* sizes;  // signed int -4, pointer 8, uint64 8, unsigned 4, bool 1
+  } expected[] = {
+      {"client-new", "-4"},      {"client-done", "-4"},      {"request", "-4 8"},
+      {"request-input", "-4 8"}, {"request-output", "-4 8"}, {"db-load", "8 8"},
+      {"discover-raw", "4"},     {"plugin-add", "8"},        {"plugin-remove", "8 1"},
+      {"plugin-ready", "8"},
+  };
+  for (const Expected& e : expected) {
+    SCOPED_TRACE(e.name);
+    auto it = notes.find(e.name);
+    ASSERT_NE(it, notes.end()) << "no note for drd:" << e.name;
+    EXPECT_NE(it->second.semaphore, "");
+    EXPECT_NE(it->second.semaphore, "0x0000000000000000");
+    EXPECT_EQ(Sizes(it->second.arguments), e.sizes) << it->second.arguments;
+  }
+  EXPECT_EQ(notes.size(), std::size(expected));
+}
+
+}  // namespace
+}  // namespace dr

@@ -1,0 +1,197 @@
+// File extension tokens: issued, consumed, and refused when tampered with;
+// the key file made safely by racing processes.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <string>
+#include <vector>
+
+#include "platform/sandbox.h"
+#include "tests/support/fake_services.h"
+#include "tests/support/process_fixtures.h"
+
+namespace dr {
+namespace {
+
+using testing::FakeCodeSigning;
+using testing::TempFolder;
+using testing::WriteTestFile;
+
+class SandboxTokenTest : public ::testing::Test {
+ protected:
+  SandboxTokenTest() {
+    options_.keyPath = folder_ / "run/dromon/sandbox.key";
+    sandbox_ = MakeLinuxSandbox(options_, &signing_);
+  }
+
+  std::string issue(const std::string& path, std::string_view cls = kReadOnlyFileExtensionClass) {
+    Result<std::string> token = sandbox_->issueFileExtension(cls, path, kExtensionCanonicalPath);
+    EXPECT_TRUE(token.ok()) << token.error().description();
+    return token.value_or("");
+  }
+
+  TempFolder folder_;
+  SandboxOptions options_;
+  FakeCodeSigning signing_;
+  std::unique_ptr<Sandbox> sandbox_;
+};
+
+TEST_F(SandboxTokenTest, TokenGrantsTheCanonicalPathEvenWhenNotAscii) {
+  std::string file = folder_ / "Plüg-ins ☃/Wïdget;1.appex";
+  ASSERT_TRUE(WriteTestFile(file + "/Contents/Info.pdoc", "{}"));
+  ASSERT_EQ(::symlink((folder_ / "Plüg-ins ☃").c_str(), (folder_ / "link").c_str()), 0);
+  std::string canonical = folder_.path() + "/Plüg-ins ☃/Wïdget;1.appex";
+  char* real = ::realpath(canonical.c_str(), nullptr);
+  ASSERT_NE(real, nullptr);
+  canonical = real;
+  ::free(real);
+
+  std::string token = issue(folder_ / "link/./Wïdget;1.appex");
+  for (unsigned char c : token) EXPECT_TRUE(c >= 0x20 && c < 0x7f) << token;
+  Result<std::string> granted = consumeExtension(token, options_);
+  ASSERT_TRUE(granted.ok()) << granted.error().description();
+  EXPECT_EQ(*granted, canonical);
+}
+
+TEST_F(SandboxTokenTest, AlteredTokensAreRefused) {
+  ASSERT_TRUE(WriteTestFile(folder_ / "a/file", "x"));
+  ASSERT_TRUE(WriteTestFile(folder_ / "b/other", "x"));
+  std::string token = issue(folder_ / "a/file");
+  std::string other = issue(folder_ / "b/other");
+  ASSERT_TRUE(consumeExtension(token, options_).ok());
+
+  std::vector<std::string> refused;
+  // Every single byte changed, to a hex digit and to a separator.
+  for (size_t i = 0; i < token.size(); ++i) {
+    for (char replacement : {'0', 'f', ';', 'A'}) {
+      std::string t = token;
+      if (t[i] == replacement) continue;
+      t[i] = replacement;
+      refused.push_back(t);
+    }
+  }
+  // Every shortened form.
+  for (size_t n = 0; n < token.size(); ++n) refused.push_back(token.substr(0, n));
+  // One token's path with the other's signature.
+  size_t tokenMac = token.rfind(';'), otherMac = other.rfind(';');
+  refused.push_back(other.substr(0, otherMac) + token.substr(tokenMac));
+  // Appended bytes, and things that are no token at all.
+  refused.push_back(token + ";");
+  refused.push_back(token + "00");
+  refused.push_back("");
+  refused.push_back("drx1;;;");
+  refused.push_back(std::string(100000, 'a'));
+
+  for (const std::string& t : refused) {
+    EXPECT_FALSE(consumeExtension(t, options_).ok()) << "accepted: " << t;
+  }
+}
+
+TEST_F(SandboxTokenTest, OnlyReadOnlyTokensAreConsumed) {
+  ASSERT_TRUE(WriteTestFile(folder_ / "file", "x"));
+  Result<std::string> granted =
+      consumeExtension(issue(folder_ / "file", "file.read-write"), options_);
+  ASSERT_FALSE(granted.ok());
+  EXPECT_EQ(granted.error().domain(), kSandboxErrorDomain);
+  EXPECT_EQ(granted.error().code(), kExtensionWrongClass);
+}
+
+TEST_F(SandboxTokenTest, IssuingFailsWithTheErrnoOfResolvingThePath) {
+  struct Case {
+    std::string path;
+    std::string_view cls;
+    uint32_t flags;
+    int error;
+  } cases[] = {
+      {folder_ / "missing", kReadOnlyFileExtensionClass, kExtensionCanonicalPath, ENOENT},
+      {"", kReadOnlyFileExtensionClass, kExtensionCanonicalPath, ENOENT},
+      {"relative/path", kReadOnlyFileExtensionClass, 0, EINVAL},
+      {folder_.path(), "bad;class", kExtensionCanonicalPath, EINVAL},
+      {folder_.path(), "", kExtensionCanonicalPath, EINVAL},
+  };
+  for (const Case& c : cases) {
+    Result<std::string> token = sandbox_->issueFileExtension(c.cls, c.path, c.flags);
+    ASSERT_FALSE(token.ok()) << c.path;
+    EXPECT_EQ(token.error().domain(), kPosixErrorDomain);
+    EXPECT_EQ(token.error().code(), c.error) << c.path;
+  }
+}
+
+TEST_F(SandboxTokenTest, KeyFileIsPrivateAndTokensOutliveTheIssuer) {
+  std::string token = issue(folder_.path());
+  struct stat st;
+  ASSERT_EQ(::stat(options_.keyPath.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0600u);
+  EXPECT_EQ(st.st_size, 32);
+  ASSERT_EQ(::stat((folder_ / "run/dromon").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0700u);
+  // A new issuer (drd restarted) reads the same key.
+  auto again = MakeLinuxSandbox(options_, &signing_);
+  EXPECT_EQ(
+      again
+          ->issueFileExtension(kReadOnlyFileExtensionClass, folder_.path(), kExtensionCanonicalPath)
+          .value_or(""),
+      token);
+}
+
+TEST_F(SandboxTokenTest, KeyThatOthersCouldReadOrIsMissingIsNotUsed) {
+  std::string token = issue(folder_.path());
+  ASSERT_EQ(::chmod(options_.keyPath.c_str(), 0644), 0);
+  EXPECT_FALSE(consumeExtension(token, options_).ok());
+  auto fresh = MakeLinuxSandbox(options_, &signing_);
+  EXPECT_FALSE(
+      fresh
+          ->issueFileExtension(kReadOnlyFileExtensionClass, folder_.path(), kExtensionCanonicalPath)
+          .ok());
+  ASSERT_EQ(::unlink(options_.keyPath.c_str()), 0);
+  EXPECT_FALSE(consumeExtension(token, options_).ok());
+}
+
+TEST_F(SandboxTokenTest, ProcessesMakingTheKeyAtOnceAgreeOnIt) {
+  constexpr int kProcesses = 8;
+  int start[2], results[2];
+  ASSERT_EQ(::pipe(start), 0);
+  ASSERT_EQ(::pipe(results), 0);
+  std::vector<pid_t> children;
+  for (int i = 0; i < kProcesses; ++i) {
+    pid_t pid = ::fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      ::close(start[1]);
+      char go;
+      if (::read(start[0], &go, 1) != 0) ::_exit(2);  // wait until the parent lets all go
+      auto sandbox = MakeLinuxSandbox(options_, &signing_);
+      Result<std::string> token = sandbox->issueFileExtension(
+          kReadOnlyFileExtensionClass, folder_.path(), kExtensionCanonicalPath);
+      if (!token.ok()) ::_exit(1);
+      std::string line = *token + "\n";
+      ::_exit(::write(results[1], line.data(), line.size()) == static_cast<ssize_t>(line.size())
+                  ? 0
+                  : 1);
+    }
+    children.push_back(pid);
+  }
+  ::close(start[0]);
+  ::close(start[1]);  // releases every child at once
+  ::close(results[1]);
+  for (pid_t pid : children) {
+    int status;
+    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
+  std::string all;
+  char buf[4096];
+  for (ssize_t n; (n = ::read(results[0], buf, sizeof buf)) > 0;) all.append(buf, n);
+  ::close(results[0]);
+  std::string first = all.substr(0, all.find('\n'));
+  std::string expected;
+  for (int i = 0; i < kProcesses; ++i) expected += first + "\n";
+  EXPECT_EQ(all, expected);
+  EXPECT_TRUE(consumeExtension(first, options_).ok());
+}
+
+}  // namespace
+}  // namespace dr

@@ -1,0 +1,82 @@
+#include "tests/support/fake_services.h"
+
+#include <cerrno>
+
+namespace dr::testing {
+namespace {
+
+class FakeTask final : public SigningTask {
+ public:
+  FakeTask(pid_t pid, Result<Value> entitlements)
+      : pid_(pid), entitlements_(std::move(entitlements)) {}
+  pid_t pid() const override { return pid_; }
+  Result<Value> entitlementValue(std::string_view key) const override {
+    if (!entitlements_.ok()) return entitlements_.error();
+    return (*entitlements_)[key];
+  }
+
+ private:
+  pid_t pid_;
+  Result<Value> entitlements_;
+};
+
+}  // namespace
+
+std::shared_ptr<const SigningTask> FakeCodeSigning::taskForPid(pid_t pid) {
+  if (failingPids.contains(pid)) {
+    return std::make_shared<FakeTask>(pid, PosixError(ESRCH, "fake entitlements"));
+  }
+  auto it = entitlements.find(pid);
+  return std::make_shared<FakeTask>(
+      pid, it == entitlements.end() ? Value::EmptyDictionary() : it->second);
+}
+
+Result<Value> FakeCodeSigning::entitlementsForExecutable(const std::string&) {
+  return Value::EmptyDictionary();
+}
+
+Result<std::string> FakeSandbox::issueFileExtension(std::string_view extensionClass,
+                                                    const std::string& path, uint32_t) {
+  if (failingPaths.contains(path)) return PosixError(ENOENT, "fake realpath " + path);
+  issuedPaths.push_back(path);
+  return "token:" + std::string(extensionClass) + ":" + path;
+}
+
+Value FakePreferences::copyCurrentHostValue(std::string_view key, std::string_view domain) {
+  auto it = values.find({std::string(domain), std::string(key)});
+  return it == values.end() ? Value() : it->second;
+}
+
+Status FakeNotificationCenter::post(std::string_view name) {
+  if (!IsValidNotificationName(name)) return PosixError(EINVAL, "notification name");
+  std::lock_guard<std::mutex> lock(mu_);
+  posted_.emplace_back(name);
+  return Status::OK();
+}
+
+std::vector<std::string> FakeNotificationCenter::posted() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return posted_;
+}
+
+void FakeUsageReports::sendReport(std::string_view domain, int level, const UsageReportKeys& keys) {
+  std::lock_guard<std::mutex> lock(mu_);
+  reports_.push_back({std::string(domain), level, keys});
+}
+
+std::vector<SentUsageReport> FakeUsageReports::reports() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return reports_;
+}
+
+bool FakePolicy::mayHostUsePlugIn(std::string_view host, std::string_view plugIn) {
+  return !denied.contains({"", std::string(plugIn)}) &&
+         !denied.contains({std::string(host), std::string(plugIn)});
+}
+
+bool FakePolicy::mayProcessUsePlugIn(pid_t pid, std::string_view plugIn) {
+  auto it = hostsByPid.find(pid);
+  return mayHostUsePlugIn(it == hostsByPid.end() ? "" : it->second, plugIn);
+}
+
+}  // namespace dr::testing

@@ -1,0 +1,70 @@
+#include "tests/support/process_fixtures.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <stdlib.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <vector>
+
+extern char** environ;
+
+namespace dr::testing {
+
+TempFolder::TempFolder() {
+  const char* tmp = std::getenv("TMPDIR");
+  std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/drd-test-XXXXXX";
+  std::vector<char> buf(tmpl.begin(), tmpl.end());
+  buf.push_back('\0');
+  if (::mkdtemp(buf.data()) == nullptr) {
+    std::perror("mkdtemp");
+    std::abort();
+  }
+  path_ = buf.data();
+}
+
+TempFolder::~TempFolder() {
+  std::error_code ec;
+  std::filesystem::remove_all(path_, ec);
+}
+
+bool WriteTestFile(const std::string& path, const std::string& bytes, mode_t mode) {
+  std::error_code ec;
+  std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
+  int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
+  if (fd < 0) return false;
+  bool ok = ::write(fd, bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size());
+  return ::close(fd) == 0 && ok;
+}
+
+RunningProgram::RunningProgram(const std::string& executablePath) {
+  std::error_code ec;
+  std::filesystem::create_directories(std::filesystem::path(executablePath).parent_path(), ec);
+  std::filesystem::copy_file("/bin/sleep", executablePath,
+                             std::filesystem::copy_options::overwrite_existing, ec);
+  if (ec) return;
+  std::filesystem::permissions(executablePath, std::filesystem::perms::owner_all, ec);
+  std::string arg0 = executablePath, arg1 = "60";
+  char* argv[] = {arg0.data(), arg1.data(), nullptr};
+  pid_t pid;
+  // posix_spawn returns once the child has run exec, so /proc/<pid>/exe
+  // already names the copy.
+  if (::posix_spawn(&pid, executablePath.c_str(), nullptr, nullptr, argv, environ) == 0) {
+    pid_ = pid;
+  }
+}
+
+RunningProgram::~RunningProgram() {
+  if (pid_ <= 0) return;
+  ::kill(pid_, SIGKILL);
+  int status;
+  ::waitpid(pid_, &status, 0);
+}
+
+}  // namespace dr::testing

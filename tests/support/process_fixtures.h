@@ -1,0 +1,46 @@
+// Test fixtures over real files and processes: a temporary folder removed
+// with everything in it, and a running program (a copy of sleep) placed
+// wherever a test needs its executable to lie.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+
+namespace dr::testing {
+
+class TempFolder {
+ public:
+  TempFolder();  // under $TMPDIR (else /tmp); aborts the test binary if it cannot
+  ~TempFolder();
+  TempFolder(const TempFolder&) = delete;
+  TempFolder& operator=(const TempFolder&) = delete;
+
+  const std::string& path() const { return path_; }
+  // path() + "/" + relative
+  std::string operator/(const std::string& relative) const { return path_ + "/" + relative; }
+
+ private:
+  std::string path_;
+};
+
+// Writes `bytes` to `path`, making missing folders (0700); false on failure.
+bool WriteTestFile(const std::string& path, const std::string& bytes, mode_t mode = 0600);
+
+// A copy of the system's sleep program at `executablePath` (folders made),
+// started and sleeping; killed and reaped when destroyed. pid() is -1 when
+// it could not be started.
+class RunningProgram {
+ public:
+  explicit RunningProgram(const std::string& executablePath);
+  ~RunningProgram();
+  RunningProgram(const RunningProgram&) = delete;
+  RunningProgram& operator=(const RunningProgram&) = delete;
+
+  pid_t pid() const { return pid_; }
+
+ private:
+  pid_t pid_ = -1;
+};
+
+}  // namespace dr::testing
