@@ -11,6 +11,8 @@
 // checking every string against what XML 1.0 can carry.
 #include "platform/pdoc.h"
 
+#include "core/utf8.h"
+
 #include <expat.h>
 #include <sodium.h>
 #include <time.h>
@@ -47,38 +49,6 @@ void InitSodium() {
 }
 
 // --- UTF-8 ---------------------------------------------------------------
-
-// Decodes the UTF-8 sequence at text[i], advancing i past it; nothing when the
-// bytes there are not well-formed UTF-8 (overlong forms, surrogates and code
-// points above U+10FFFF included).
-std::optional<char32_t> DecodeUtf8(std::string_view text, size_t& i) {
-  const auto byte = [&](size_t k) { return static_cast<unsigned char>(text[k]); };
-  unsigned char b0 = byte(i);
-  if (b0 < 0x80) {
-    ++i;
-    return b0;
-  }
-  size_t length;
-  char32_t cp;
-  char32_t min;
-  if ((b0 & 0xE0) == 0xC0) {
-    length = 2, cp = b0 & 0x1F, min = 0x80;
-  } else if ((b0 & 0xF0) == 0xE0) {
-    length = 3, cp = b0 & 0x0F, min = 0x800;
-  } else if ((b0 & 0xF8) == 0xF0) {
-    length = 4, cp = b0 & 0x07, min = 0x10000;
-  } else {
-    return std::nullopt;
-  }
-  if (text.size() - i < length) return std::nullopt;
-  for (size_t k = 1; k < length; ++k) {
-    if ((byte(i + k) & 0xC0) != 0x80) return std::nullopt;
-    cp = (cp << 6) | (byte(i + k) & 0x3F);
-  }
-  if (cp < min || cp > 0x10FFFF || (cp >= 0xD800 && cp <= 0xDFFF)) return std::nullopt;
-  i += length;
-  return cp;
-}
 
 // `text` with every byte that is not part of well-formed UTF-8 replaced by
 // '?', cut to about `limit` bytes at a character boundary. Messages quote

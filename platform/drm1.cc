@@ -1,0 +1,314 @@
+#include "platform/drm1.h"
+
+#include <bit>
+#include <cstring>
+#include <string>
+
+#include "core/utf8.h"
+
+namespace dr::drm1 {
+namespace {
+
+static_assert(std::endian::native == std::endian::little,
+              "the DRM1 codec copies integers as they are in memory");
+
+Error ProtocolError(const std::string& what) {
+  return Error(kDrm1ErrorDomain, kProtocolError, what);
+}
+Error Unencodable(const std::string& what) { return Error(kDrm1ErrorDomain, kUnencodable, what); }
+
+template <typename T>
+T Load(const char* p) {
+  T v;
+  std::memcpy(&v, p, sizeof v);
+  return v;
+}
+
+template <typename T>
+void Store(std::string& out, T v) {
+  char buf[sizeof v];
+  std::memcpy(buf, &v, sizeof v);
+  out.append(buf, sizeof v);
+}
+
+// Reads one value from `in` at `pos`. Every length and count is checked
+// against the bytes left before anything is reserved or copied.
+class BodyReader {
+ public:
+  explicit BodyReader(std::string_view in) : in_(in) {}
+
+  Result<Value> readTop() {
+    if (in_.empty()) return ProtocolError("empty body");
+    if (static_cast<uint8_t>(in_[0]) != kTagDictionary) {
+      return ProtocolError("the body is not a dictionary");
+    }
+    Result<Value> v = read(1);
+    if (!v) return v;
+    if (pos_ != in_.size()) {
+      return ProtocolError(std::to_string(in_.size() - pos_) + " trailing bytes after the body");
+    }
+    return v;
+  }
+
+ private:
+  size_t left() const { return in_.size() - pos_; }
+
+  bool take(size_t n, const char** p) {
+    if (left() < n) return false;
+    *p = in_.data() + pos_;
+    pos_ += n;
+    return true;
+  }
+
+  std::optional<uint32_t> u32() {
+    const char* p;
+    if (!take(4, &p)) return std::nullopt;
+    return Load<uint32_t>(p);
+  }
+
+  Result<std::string> text(const char* what) {
+    std::optional<uint32_t> n = u32();
+    if (!n) return ProtocolError(std::string("truncated ") + what + " length");
+    const char* p;
+    if (!take(*n, &p)) {
+      return ProtocolError(std::string(what) + " of " + std::to_string(*n) +
+                           " bytes exceeds the body");
+    }
+    std::string_view s(p, *n);
+    if (s.find('\0') != std::string_view::npos) {
+      return ProtocolError(std::string(what) + " holds NUL");
+    }
+    if (!IsValidUtf8(s)) return ProtocolError(std::string(what) + " is not UTF-8");
+    return std::string(s);
+  }
+
+  Result<Value> read(int depth) {
+    const char* p;
+    if (!take(1, &p)) return ProtocolError("truncated value tag");
+    const auto tag = static_cast<uint8_t>(*p);
+    switch (tag) {
+      case kTagNull:
+        return Value();
+      case kTagFalse:
+        return Value(false);
+      case kTagTrue:
+        return Value(true);
+      case kTagInt:
+      case kTagUInt:
+      case kTagDouble:
+      case kTagDate:
+        if (!take(8, &p)) return ProtocolError("truncated number");
+        if (tag == kTagInt) return Value(Load<int64_t>(p));
+        if (tag == kTagUInt) return Value(Load<uint64_t>(p));
+        if (tag == kTagDouble) return Value(Load<double>(p));
+        return Value(Date{Load<double>(p)});
+      case kTagString: {
+        Result<std::string> s = text("string");
+        if (!s) return s.error();
+        return Value(std::move(*s));
+      }
+      case kTagData: {
+        std::optional<uint32_t> n = u32();
+        if (!n) return ProtocolError("truncated data length");
+        if (!take(*n, &p)) {
+          return ProtocolError("data of " + std::to_string(*n) + " bytes exceeds the body");
+        }
+        return Value(Data(p, p + *n));
+      }
+      case kTagUuid: {
+        if (!take(16, &p)) return ProtocolError("truncated UUID");
+        Uuid u;
+        std::memcpy(u.bytes.data(), p, 16);
+        return Value(u);
+      }
+      case kTagArray:
+      case kTagDictionary: {
+        if (depth > kMaxDepth) {
+          return ProtocolError("nesting deeper than " + std::to_string(kMaxDepth) + " levels");
+        }
+        std::optional<uint32_t> n = u32();
+        if (!n) return ProtocolError("truncated element count");
+        // Every element takes at least one byte (two with its key), so a
+        // count beyond the bytes left is a lie told before any allocation.
+        const size_t least = tag == kTagArray ? 1 : 5;
+        if (*n > left() / least) {
+          return ProtocolError("count of " + std::to_string(*n) + " exceeds the body");
+        }
+        if (tag == kTagArray) {
+          Array a;
+          a.reserve(*n);
+          for (uint32_t i = 0; i < *n; ++i) {
+            Result<Value> v = read(depth + 1);
+            if (!v) return v;
+            a.push_back(std::move(*v));
+          }
+          return Value(std::move(a));
+        }
+        Dictionary d;
+        for (uint32_t i = 0; i < *n; ++i) {
+          Result<std::string> key = text("key");
+          if (!key) return key.error();
+          Result<Value> v = read(depth + 1);
+          if (!v) return v;
+          if (!d.try_emplace(std::move(*key), std::move(*v)).second) {
+            return ProtocolError("duplicate key");
+          }
+        }
+        return Value(std::move(d));
+      }
+      default:
+        return ProtocolError("unknown tag " + std::to_string(tag));
+    }
+  }
+
+  std::string_view in_;
+  size_t pos_ = 0;
+};
+
+Status AppendText(std::string& out, std::string_view s, const char* what) {
+  if (s.size() > kMaxBodySize) return Unencodable(std::string(what) + " too long");
+  if (s.find('\0') != std::string_view::npos) return Unencodable(std::string(what) + " holds NUL");
+  if (!IsValidUtf8(s)) return Unencodable(std::string(what) + " is not UTF-8");
+  Store(out, static_cast<uint32_t>(s.size()));
+  out.append(s);
+  return Status::OK();
+}
+
+Status Append(std::string& out, const Value& v, int depth) {
+  if (out.size() > kMaxBodySize) return Unencodable("body larger than 16 MiB");
+  switch (v.type()) {
+    case Value::Type::kAbsent:
+      out += static_cast<char>(kTagNull);
+      return Status::OK();
+    case Value::Type::kBool:
+      out += static_cast<char>(v.boolValue() ? kTagTrue : kTagFalse);
+      return Status::OK();
+    case Value::Type::kInt:
+      out += static_cast<char>(kTagInt);
+      Store(out, v.intValue());
+      return Status::OK();
+    case Value::Type::kUInt:
+      out += static_cast<char>(kTagUInt);
+      Store(out, v.uintValue());
+      return Status::OK();
+    case Value::Type::kDouble:
+      out += static_cast<char>(kTagDouble);
+      Store(out, v.doubleValue());
+      return Status::OK();
+    case Value::Type::kDate:
+      out += static_cast<char>(kTagDate);
+      Store(out, v.date()->seconds);
+      return Status::OK();
+    case Value::Type::kString:
+      out += static_cast<char>(kTagString);
+      return AppendText(out, v.stringValue(), "string");
+    case Value::Type::kData: {
+      const Data& d = v.dataValue();
+      if (d.size() > kMaxBodySize) return Unencodable("data too long");
+      out += static_cast<char>(kTagData);
+      Store(out, static_cast<uint32_t>(d.size()));
+      out.append(reinterpret_cast<const char*>(d.data()), d.size());
+      return Status::OK();
+    }
+    case Value::Type::kUuid:
+      out += static_cast<char>(kTagUuid);
+      out.append(reinterpret_cast<const char*>(v.uuid()->bytes.data()), 16);
+      return Status::OK();
+    case Value::Type::kArray:
+    case Value::Type::kDictionary:
+      if (depth > kMaxDepth) {
+        return Unencodable("nesting deeper than " + std::to_string(kMaxDepth) + " levels");
+      }
+      if (v.isArray()) {
+        out += static_cast<char>(kTagArray);
+        Store(out, static_cast<uint32_t>(v.array().size()));
+        for (const Value& e : v.array()) {
+          if (Status s = Append(out, e, depth + 1); !s.ok()) return s;
+        }
+      } else {
+        out += static_cast<char>(kTagDictionary);
+        Store(out, static_cast<uint32_t>(v.dictionary().size()));
+        for (const auto& [k, e] : v.dictionary()) {
+          if (Status s = AppendText(out, k, "key"); !s.ok()) return s;
+          if (Status s = Append(out, e, depth + 1); !s.ok()) return s;
+        }
+      }
+      return Status::OK();
+  }
+  return Unencodable("unknown value type");
+}
+
+}  // namespace
+
+Result<Header> DecodeHeader(std::string_view bytes) {
+  const char* p = bytes.data();
+  if (std::memcmp(p, kMagic, sizeof kMagic) != 0) return ProtocolError("bad magic");
+  Header h;
+  h.bodyLength = Load<uint32_t>(p + 4);
+  h.serial = Load<uint64_t>(p + 8);
+  h.replyTo = Load<uint64_t>(p + 16);
+  h.flags = Load<uint32_t>(p + 24);
+  const uint32_t reserved = Load<uint32_t>(p + 28);
+  if (h.bodyLength > kMaxBodySize) {
+    return ProtocolError("body length " + std::to_string(h.bodyLength) + " above 16 MiB");
+  }
+  if (h.serial == 0) return ProtocolError("serial 0");
+  if ((h.flags & ~(kFlagWantsReply | kFlagIsReply)) != 0) return ProtocolError("unknown flags");
+  if (h.isReply() != (h.replyTo != 0)) {
+    return ProtocolError("reply-to does not match the reply flag");
+  }
+  if (reserved != 0) return ProtocolError("reserved field not 0");
+  return h;
+}
+
+Result<Value> DecodeBody(std::string_view body) { return BodyReader(body).readTop(); }
+
+Result<std::string> EncodeValue(const Value& value) {
+  std::string out;
+  if (Status s = Append(out, value, 1); !s.ok()) return s.error();
+  return out;
+}
+
+Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
+                                const Value& body) {
+  if (!body.isDictionary()) return Unencodable("the body is not a dictionary");
+  std::string out(kHeaderSize, '\0');
+  if (Status s = Append(out, body, 1); !s.ok()) return s.error();
+  const size_t length = out.size() - kHeaderSize;
+  if (length > kMaxBodySize) return Unencodable("body larger than 16 MiB");
+  std::memcpy(out.data(), kMagic, sizeof kMagic);
+  const uint32_t length32 = static_cast<uint32_t>(length), reserved = 0;
+  std::memcpy(out.data() + 4, &length32, 4);
+  std::memcpy(out.data() + 8, &serial, 8);
+  std::memcpy(out.data() + 16, &replyTo, 8);
+  std::memcpy(out.data() + 24, &flags, 4);
+  std::memcpy(out.data() + 28, &reserved, 4);
+  return out;
+}
+
+Result<std::optional<Frame>> FrameDecoder::next() {
+  if (error_) return *error_;
+  std::string_view pending = std::string_view(buffer_).substr(consumed_);
+  if (pending.size() < kHeaderSize) return std::optional<Frame>();
+  Result<Header> header = DecodeHeader(pending);
+  if (!header) {
+    error_ = header.error();
+    return *error_;
+  }
+  if (pending.size() - kHeaderSize < header->bodyLength) return std::optional<Frame>();
+  Result<Value> body = DecodeBody(pending.substr(kHeaderSize, header->bodyLength));
+  if (!body) {
+    error_ = body.error();
+    return *error_;
+  }
+  consumed_ += kHeaderSize + header->bodyLength;
+  // Drop consumed bytes once they dominate, so a long-lived connection's
+  // buffer stays the size of what is in flight.
+  if (consumed_ > 65536 && consumed_ * 2 > buffer_.size()) {
+    buffer_.erase(0, consumed_);
+    consumed_ = 0;
+  }
+  return std::optional<Frame>(Frame{*header, std::move(*body)});
+}
+
+}  // namespace dr::drm1

@@ -1,0 +1,115 @@
+// DRM1: the framing and value encoding of drd's message socket.
+//
+// Every message in either direction is one frame, a 32-byte header and a
+// body; all integers are little-endian:
+//
+//   frame  := magic "DRM1" | u32 body-length (<= 16 MiB) | u64 serial (!= 0)
+//             | u64 reply-to | u32 flags | u32 reserved (0) | body
+//   flags  := bit 0: the sender wants a reply; bit 1: this is a reply
+//             (reply-to is the request's serial; 0 for anything else)
+//   body   := value, a dictionary at the top level
+//   value  := 0x00 null | 0x01 false | 0x02 true | 0x03 i64 | 0x04 u64
+//           | 0x05 f64 | 0x06 date (f64 seconds since 1970) | 0x07 string
+//           | 0x08 data | 0x09 uuid (16 bytes) | 0x0A array | 0x0B dictionary
+//   string := u32 byte count, UTF-8 without NUL
+//   data   := u32 byte count, bytes
+//   array  := u32 element count, values
+//   dictionary := u32 entry count, (key: string, value)*; keys unique
+//
+// Nesting is at most 64 levels (the top dictionary is level 1). A frame that
+// breaks any rule is refused with kDrm1ErrorDomain and a message naming the
+// field at fault; the decoder never trusts a length or count. Null decodes
+// to an absent value (and so vanishes from a dictionary).
+//
+// Stateless functions, and a FrameDecoder owned by one connection; neither
+// is shared between threads.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "core/status.h"
+#include "core/value.h"
+
+namespace dr::drm1 {
+
+inline constexpr const char* kDrm1ErrorDomain = "drm1";
+inline constexpr int64_t kProtocolError = 1;  // the bytes break the frame rules
+inline constexpr int64_t kUnencodable = 2;    // the value cannot be sent
+
+inline constexpr char kMagic[4] = {'D', 'R', 'M', '1'};
+inline constexpr size_t kHeaderSize = 32;
+inline constexpr uint32_t kMaxBodySize = uint32_t{16} << 20;
+inline constexpr int kMaxDepth = 64;
+inline constexpr uint32_t kFlagWantsReply = 1u << 0;
+inline constexpr uint32_t kFlagIsReply = 1u << 1;
+
+enum Tag : uint8_t {
+  kTagNull = 0x00,
+  kTagFalse = 0x01,
+  kTagTrue = 0x02,
+  kTagInt = 0x03,
+  kTagUInt = 0x04,
+  kTagDouble = 0x05,
+  kTagDate = 0x06,
+  kTagString = 0x07,
+  kTagData = 0x08,
+  kTagUuid = 0x09,
+  kTagArray = 0x0A,
+  kTagDictionary = 0x0B,
+};
+
+struct Header {
+  uint32_t bodyLength = 0;
+  uint64_t serial = 0;
+  uint64_t replyTo = 0;
+  uint32_t flags = 0;
+
+  bool wantsReply() const { return (flags & kFlagWantsReply) != 0; }
+  bool isReply() const { return (flags & kFlagIsReply) != 0; }
+};
+
+struct Frame {
+  Header header;
+  Value body;  // always a dictionary
+};
+
+// The header in the first kHeaderSize bytes of `bytes`, checked.
+// REQUIRES: bytes.size() >= kHeaderSize.
+Result<Header> DecodeHeader(std::string_view bytes);
+
+// The value of a body, checked; the top level must be a dictionary.
+Result<Value> DecodeBody(std::string_view body);
+
+// The encoding of one value (any type; absent is written as null).
+// Fails with kUnencodable for text that is not UTF-8 or holds NUL.
+Result<std::string> EncodeValue(const Value& value);
+
+// A whole frame: `body` must be a dictionary and encode to at most
+// kMaxBodySize bytes; the header's bodyLength is filled in. Fails with
+// kUnencodable otherwise.
+Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
+                                const Value& body);
+
+// Splits a byte stream into frames. Feed it what the socket delivers; take
+// frames while next() answers one. After an error the stream is unusable
+// (the connection must be closed) and next() keeps answering that error.
+class FrameDecoder {
+ public:
+  void feed(std::string_view bytes) { buffer_.append(bytes); }
+  // A frame, nothing when more bytes are needed, or the protocol error.
+  Result<std::optional<Frame>> next();
+  // Bytes received and not yet consumed by a frame.
+  size_t buffered() const { return buffer_.size() - consumed_; }
+
+ private:
+  std::string buffer_;
+  size_t consumed_ = 0;
+  std::optional<Error> error_;
+};
+
+}  // namespace dr::drm1
