@@ -1,22 +1,42 @@
+#include <dirent.h>
 #include <pwd.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cerrno>
+#include <climits>
 #include <cstdlib>
+#include <map>
+#include <mutex>
+#include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
+#include "core/log.h"
+#include "platform/bundle_reader.h"
 #include "platform/pdoc.h"
+#include "platform/process_info.h"
+#include "platform/registry.h"
 #include "platform/service_manager.h"
 
 namespace dr {
 namespace {
+
+static_assert(kNoInstanceRunning == ESRCH, "the no-instance answer is the ESRCH error number");
 
 constexpr const char* kSdkPathVariable = "DR_SDK_PATH";
 constexpr const char* kSystemSdkFolder = "/usr/share/dromon/SDKs";
 constexpr const char* kSdkFileSuffix = ".pdoc";
 // An SDK file, like every other pdoc file drd reads, is small.
 constexpr size_t kMaxSdkFileBytes = size_t{16} << 20;
+constexpr const char* kProcFolder = "/proc";
+// What the kernel appends to /proc/<pid>/exe once the executable is deleted.
+constexpr std::string_view kDeletedSuffix = " (deleted)";
+constexpr const char* kBundleIdentifierKey = "BNBundleIdentifier";
+constexpr const char* kBundleVersionKey = "BNBundleVersion";
 
 std::string NonEmptyEnv(const char* name) {
   const char* v = std::getenv(name);
@@ -48,8 +68,78 @@ std::vector<std::string> SdkFolders() {
   return folders;
 }
 
+// The pids of the user's own processes, in ascending order. drd serves one
+// user: another user's process is never reported busy nor signalled, even
+// when it runs a registered plug-in (and even when drd runs as root).
+Result<std::vector<pid_t>> RunningPids() {
+  DIR* dir = ::opendir(kProcFolder);  // glibc opens it O_CLOEXEC
+  if (dir == nullptr) return PosixError(errno, std::string("opendir ") + kProcFolder);
+  std::vector<pid_t> pids;
+  while (struct dirent* e = ::readdir(dir)) {
+    const char* name = e->d_name;
+    if (*name < '1' || *name > '9') continue;
+    char* end = nullptr;
+    long pid = std::strtol(name, &end, 10);
+    struct stat st;
+    if (*end == '\0' && pid > 0 && pid <= INT_MAX && ::fstatat(::dirfd(dir), name, &st, 0) == 0 &&
+        st.st_uid == ::geteuid()) {
+      pids.push_back(static_cast<pid_t>(pid));
+    }
+  }
+  ::closedir(dir);
+  std::sort(pids.begin(), pids.end());
+  return pids;
+}
+
+// The registered bundle (of `bundles`, keyed by canonical path) that holds
+// `path` most closely: a bundle nested in another bundle's folder owns what
+// lies inside it. Null when none holds it.
+template <typename Map>
+const typename Map::value_type* InnermostBundle(const Map& bundles, std::string path) {
+  for (size_t slash = path.rfind('/'); slash != std::string::npos && slash > 0;
+       slash = path.rfind('/')) {
+    path.resize(slash);
+    auto it = bundles.find(path);
+    if (it != bundles.end()) return &*it;
+  }
+  return nullptr;
+}
+
+// The error number of a grant whose executable cannot be run: only "missing"
+// and "not executable" are answered.
+int ExecutableError(int errnum) {
+  switch (errnum) {
+    case ENOENT:
+    case ENOTDIR:
+    case ELOOP:
+    case ENAMETOOLONG:
+      return ENOENT;
+    default:
+      return EACCES;
+  }
+}
+
+// The identifier and version of one registered bundle's plug-ins (all
+// entries of a bundle share them).
+struct BundleRecord {
+  std::optional<std::string> identifier;
+  std::optional<std::string> version;
+};
+using BundleRecords = std::map<std::string, BundleRecord>;
+// A plug-in's identity as removal names it; a record without a version has "".
+using PlugInVersion = std::pair<std::string, std::string>;
+
 class LinuxServiceManager final : public ServiceManager {
  public:
+  explicit LinuxServiceManager(const ServiceManagerOptions& options)
+      : registry_(options.registry),
+        processInfo_(options.processInfo ? options.processInfo : ProcessInfo::Default()),
+        bundleReader_(options.bundleReader ? options.bundleReader : BundleReader::Default()) {
+    BundleRecords registered = registeredBundles();
+    std::lock_guard lock(mu_);
+    remember(registered);
+  }
+
   Result<Value> sdkDictionary(const std::string& identifier) override {
     // An identifier names one file inside a folder, never a path elsewhere.
     if (identifier.empty() || identifier.find('/') != std::string::npos ||
@@ -73,12 +163,177 @@ class LinuxServiceManager final : public ServiceManager {
     }
     return Value();
   }
+
+  int addExternalService(pid_t hostPid, const std::string& executablePath,
+                         const Value& overlay) override {
+    if (hostPid < 1) return ESRCH;
+    if (executablePath.empty() || executablePath.find('\0') != std::string::npos) return ENOENT;
+    struct stat st;
+    if (::stat(executablePath.c_str(), &st) != 0) return ExecutableError(errno);
+    // access(X_OK) passes a folder, and for root any file with one x bit.
+    if (!S_ISREG(st.st_mode)) return EACCES;
+    if (::access(executablePath.c_str(), X_OK) != 0) return ExecutableError(errno);
+
+    ExternalServiceGrant grant;
+    grant.hostPid = hostPid;
+    char* real = ::realpath(executablePath.c_str(), nullptr);
+    grant.executablePath = real ? std::string(real) : executablePath;
+    std::free(real);
+    grant.overlay = overlay;
+    identify(grant);
+
+    std::lock_guard lock(mu_);
+    // A grant to a process that has exited serves nobody.
+    std::erase_if(grants_, [&](const ExternalServiceGrant& g) {
+      return (g.hostPid == hostPid && g.executablePath == grant.executablePath) ||
+             (::kill(g.hostPid, 0) != 0 && errno == ESRCH);
+    });
+    if (grant.bundlePath) {
+      auto& versions = known_[*grant.bundlePath];
+      if (grant.bundleIdentifier)
+        versions.emplace(*grant.bundleIdentifier, grant.bundleVersion.value_or(""));
+    }
+    grants_.push_back(std::move(grant));
+    return 0;
+  }
+
+  Result<std::vector<BusyExtensionInstance>> busyExtensionInstances(
+      const std::vector<std::string>& bundleIdentifiers) override {
+    BundleRecords registered = registeredBundles();
+    {
+      std::lock_guard lock(mu_);
+      remember(registered);
+    }
+    std::vector<BusyExtensionInstance> busy;
+    if (registered.empty() || bundleIdentifiers.empty()) return busy;
+    const std::set<std::string> wanted(bundleIdentifiers.begin(), bundleIdentifiers.end());
+    Result<std::vector<pid_t>> pids = RunningPids();
+    if (!pids.ok()) return pids.error();
+    for (pid_t pid : *pids) {
+      std::optional<std::string> exe = executableOf(pid);
+      if (!exe) continue;
+      const BundleRecords::value_type* bundle = InnermostBundle(registered, *exe);
+      if (!bundle || !bundle->second.identifier || !wanted.count(*bundle->second.identifier))
+        continue;
+      busy.push_back({pid, bundle->first, bundle->second.identifier, bundle->second.version});
+    }
+    return busy;
+  }
+
+  int removeExternalServiceInstance(const std::string& bundleIdentifier,
+                                    const std::string& bundleVersion) override {
+    const PlugInVersion target(bundleIdentifier, bundleVersion);
+    BundleRecords registered = registeredBundles();
+    std::map<std::string, std::set<PlugInVersion>> known;
+    {
+      std::lock_guard lock(mu_);
+      remember(registered);
+      std::erase_if(grants_, [&](const ExternalServiceGrant& g) {
+        return g.bundleIdentifier == bundleIdentifier &&
+               g.bundleVersion.value_or("") == bundleVersion;
+      });
+      known = known_;
+    }
+    // A bundle counts as this plug-in's when it was registered as it at any
+    // time the manager looked, or a grant named it so: after an update the
+    // old version's instances must stop although the path now holds the new.
+    bool signalled = false;
+    int refused = 0;
+    Result<std::vector<pid_t>> pids = RunningPids();
+    if (!pids.ok()) return pids.error().code() > 0 ? static_cast<int>(pids.error().code()) : EIO;
+    for (pid_t pid : *pids) {
+      if (pid == ::getpid()) continue;
+      std::optional<std::string> exe = executableOf(pid);
+      if (!exe) continue;
+      const auto* bundle = InnermostBundle(known, *exe);
+      if (!bundle || !bundle->second.count(target)) continue;
+      if (::kill(pid, SIGTERM) == 0) {
+        signalled = true;
+        SystemLog("stopped pid %d, an instance of %@ %@ at %@", pid, bundleIdentifier,
+                  bundleVersion, bundle->first);
+      } else if (errno != ESRCH && refused == 0) {
+        refused = errno;
+      }
+    }
+    if (signalled) return 0;
+    return refused != 0 ? refused : kNoInstanceRunning;
+  }
+
+  std::vector<ExternalServiceGrant> externalServiceGrants() const override {
+    std::lock_guard lock(mu_);
+    return grants_;
+  }
+
+ private:
+  // The registry's bundles now, by canonical path.
+  BundleRecords registeredBundles() const {
+    BundleRecords bundles;
+    if (!registry_) return bundles;
+    for (const RegistryEntryPtr& entry : registry_->allEntries()) {
+      bundles.emplace(entry->url(),
+                      BundleRecord{entry->bundleIdentifier(), entry->bundleVersion()});
+    }
+    return bundles;
+  }
+
+  // REQUIRES: mu_ held.
+  void remember(const BundleRecords& registered) {
+    for (const auto& [path, record] : registered) {
+      auto& versions = known_[path];
+      if (record.identifier) versions.emplace(*record.identifier, record.version.value_or(""));
+    }
+  }
+
+  // The bundle that holds a granted executable, and its identifier and
+  // version: the registry's record when the bundle is registered, else what
+  // its Info.pdoc says.
+  void identify(ExternalServiceGrant& grant) const {
+    std::shared_ptr<const BundleHandle> bundle =
+        bundleReader_->bundleAtPath(grant.executablePath, BundleReader::Mode::kExecutablePath);
+    grant.bundlePath = bundle->stringProperty(kBundlePathProperty);
+    if (!grant.bundlePath) return;
+    if (RegistryEntryPtr entry = registry_ ? registry_->entryForUrl(*grant.bundlePath) : nullptr) {
+      grant.bundleIdentifier = entry->bundleIdentifier();
+      grant.bundleVersion = entry->bundleVersion();
+      return;
+    }
+    Value info = bundle->infoDictionary();
+    if (auto id = info[kBundleIdentifierKey].string()) grant.bundleIdentifier = std::string(*id);
+    if (auto v = info[kBundleVersionKey].string()) grant.bundleVersion = std::string(*v);
+  }
+
+  // The executable `pid` runs, or nothing when it cannot be read (the process
+  // exited or is a zombie, a kernel thread, or not ours to inspect). A deleted
+  // executable keeps its old path: the program it started from still runs.
+  std::optional<std::string> executableOf(pid_t pid) const {
+    Result<std::string> exe = processInfo_->executablePath(pid);
+    if (!exe.ok() || exe->empty()) return std::nullopt;
+    std::string path = std::move(*exe);
+    if (path.ends_with(kDeletedSuffix) && ::access(path.c_str(), F_OK) != 0)
+      path.resize(path.size() - kDeletedSuffix.size());
+    return path;
+  }
+
+  const Registry* const registry_;
+  ProcessInfo* const processInfo_;
+  BundleReader* const bundleReader_;
+
+  mutable std::mutex mu_;
+  std::vector<ExternalServiceGrant> grants_;  // guarded by mu_
+  // Every bundle path seen registered or granted, with each plug-in version
+  // it was seen as. Guarded by mu_; never shrinks, and holds one entry per
+  // bundle ever installed while the daemon runs.
+  std::map<std::string, std::set<PlugInVersion>> known_;
 };
 
 }  // namespace
 
+std::unique_ptr<ServiceManager> NewServiceManager(const ServiceManagerOptions& options) {
+  return std::make_unique<LinuxServiceManager>(options);
+}
+
 ServiceManager* ServiceManager::Default() {
-  static LinuxServiceManager* manager = new LinuxServiceManager();
+  static LinuxServiceManager* manager = new LinuxServiceManager(ServiceManagerOptions{});
   return manager;
 }
 

@@ -1,9 +1,15 @@
-// A service manager whose SDK registry is a table in memory, for tests of
-// the plug-in model. It counts the lookups it answers.
+// A service manager whose SDK registry, busy instances and removal answers
+// are tables in memory, for tests of the plug-in model and the daemon. It
+// counts the lookups it answers and records every call it gets.
 #pragma once
 
+#include <sys/types.h>
+
 #include <map>
+#include <optional>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "core/status.h"
 #include "core/value.h"
@@ -17,11 +23,63 @@ class FakeServiceManager : public ServiceManager {
   std::map<std::string, Result<Value>> sdks;
   int lookups = 0;
 
+  // What addExternalService answers; a grant is recorded only on 0.
+  int addResult = 0;
+  std::vector<ExternalServiceGrant> grants;
+
+  // What busyExtensionInstances answers: the instances whose identifier was
+  // asked for, in this order, or this error.
+  std::vector<BusyExtensionInstance> instances;
+  std::optional<Error> busyError;
+  std::vector<std::vector<std::string>> busyQueries;
+
+  // (identifier, version) → what removeExternalServiceInstance answers;
+  // kNoInstanceRunning for anything not listed.
+  std::map<std::pair<std::string, std::string>, int> removeResults;
+  std::vector<std::pair<std::string, std::string>> removals;
+
   Result<Value> sdkDictionary(const std::string& identifier) override {
     ++lookups;
     auto it = sdks.find(identifier);
     return it == sdks.end() ? Result<Value>(Value()) : it->second;
   }
+
+  int addExternalService(pid_t hostPid, const std::string& executablePath,
+                         const Value& overlay) override {
+    if (addResult == 0) {
+      ExternalServiceGrant g;
+      g.hostPid = hostPid;
+      g.executablePath = executablePath;
+      g.overlay = overlay;
+      grants.push_back(std::move(g));
+    }
+    return addResult;
+  }
+
+  Result<std::vector<BusyExtensionInstance>> busyExtensionInstances(
+      const std::vector<std::string>& bundleIdentifiers) override {
+    busyQueries.push_back(bundleIdentifiers);
+    if (busyError) return *busyError;
+    std::vector<BusyExtensionInstance> out;
+    for (const BusyExtensionInstance& i : instances) {
+      for (const std::string& id : bundleIdentifiers) {
+        if (i.bundleIdentifier == id) {
+          out.push_back(i);
+          break;
+        }
+      }
+    }
+    return out;
+  }
+
+  int removeExternalServiceInstance(const std::string& bundleIdentifier,
+                                    const std::string& bundleVersion) override {
+    removals.emplace_back(bundleIdentifier, bundleVersion);
+    auto it = removeResults.find({bundleIdentifier, bundleVersion});
+    return it == removeResults.end() ? kNoInstanceRunning : it->second;
+  }
+
+  std::vector<ExternalServiceGrant> externalServiceGrants() const override { return grants; }
 };
 
 }  // namespace dr::test
