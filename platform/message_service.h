@@ -1,0 +1,154 @@
+// The message service: drd's listening socket and its peer connections.
+//
+// A Listener accepts on a Unix stream socket ($DR_SOCKET_DIR/<service name>,
+// or the socket systemd passed) and hands each new peer of the daemon's own
+// uid to its handler on the event queue it was given; peers of another uid
+// are closed at once with a log line. Each PeerConnection reads DRM1 frames
+// on a thread of its own and delivers its events to its handler one at a
+// time, in order: a message per frame, and a final kConnectionInvalid when
+// the peer hangs up, breaks the protocol (logged, and only that connection
+// closes) or is cancelled. Replies are queued per connection and written by
+// that connection's thread, so sending never blocks the caller; a peer whose
+// queue passes kMaxQueuedReplyBytes is closed.
+//
+// Ownership: a connection keeps itself alive while its thread runs, and
+// holds its context object until its last event has been delivered; callers
+// keep weak references. All members are safe to call from any thread.
+#pragma once
+
+#include <sys/types.h>
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+
+#include "core/queue.h"
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/drm1.h"
+
+namespace dr {
+
+// Who is at the other end, as the kernel told it at accept time.
+struct AuditToken {
+  pid_t pid = 0;
+  uid_t uid = 0;
+  gid_t gid = 0;
+  int pidfd = -1;  // -1 where the kernel cannot give one
+};
+
+struct PeerMessage {
+  uint64_t serial = 0;
+  bool wantsReply = false;
+  Value body;  // a dictionary
+};
+
+struct ConnectionEvent {
+  enum class Kind { kMessage, kConnectionInvalid };
+  Kind kind = Kind::kMessage;
+  PeerMessage message;  // for kMessage
+};
+
+class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
+ public:
+  static constexpr size_t kMaxQueuedReplyBytes = size_t{64} << 20;
+
+  ~PeerConnection();
+  PeerConnection(const PeerConnection&) = delete;
+  PeerConnection& operator=(const PeerConnection&) = delete;
+
+  const AuditToken& auditToken() const { return token_; }
+  pid_t pid() const { return token_.pid; }
+  // "<connection fd=%d pid=%d>", for logs.
+  std::string description() const;
+
+  // The object the connection keeps alive until its last event was handled.
+  void setContext(std::shared_ptr<void> context);
+  // REQUIRES: called once, before resume().
+  void setEventHandler(std::function<void(const ConnectionEvent&)> handler);
+  // Starts reading and delivering events.
+  void resume();
+
+  // Queues the reply bound to the request with serial `requestSerial`.
+  // Fails when the body cannot be encoded (nothing is sent) or when the
+  // connection is closed; a queue past its limit closes the connection.
+  Status sendReply(uint64_t requestSerial, const Value& body);
+  // Closes the connection; the handler then gets kConnectionInvalid.
+  void cancel();
+  bool isOpen() const { return !closed_.load(); }
+
+  // Waits up to `timeoutMs` for the queued replies to be written; true when
+  // none is left.
+  bool flush(int timeoutMs);
+
+ private:
+  friend class Listener;
+  PeerConnection(int fd, AuditToken token);
+  void run();
+  bool writeSome();  // false when the peer is gone
+  void wake();
+
+  const int fd_;
+  const int wakeFd_;
+  const AuditToken token_;
+  std::atomic<bool> closed_{false};
+  std::atomic<bool> resumed_{false};
+
+  mutable std::mutex mu_;
+  std::string outbox_;             // guarded by mu_: encoded frames not yet written
+  size_t outboxSent_ = 0;          // guarded by mu_
+  uint64_t nextSerial_ = 1;        // guarded by mu_
+  std::shared_ptr<void> context_;  // guarded by mu_
+  std::function<void(const ConnectionEvent&)> handler_;  // set before resume
+};
+
+struct ListenerOptions {
+  // The folder of the socket (made 0700 when missing) and the service name;
+  // the socket is <socketDirectory>/<serviceName>.
+  std::string socketDirectory;
+  std::string serviceName;
+  // Take a socket passed by systemd (LISTEN_FDS) when there is one.
+  bool useSocketActivation = true;
+};
+
+class Listener {
+ public:
+  // Opens the listening socket, suspended until resume(). A stale socket file
+  // (nobody accepts on it) is replaced; a live one means the name is taken,
+  // and anything else at that path is left alone: both are errors.
+  static Result<std::unique_ptr<Listener>> Create(const ListenerOptions& options,
+                                                  SerialQueue* eventQueue);
+  ~Listener();
+
+  // Each new peer connection goes to `handler` on the event queue.
+  void setEventHandler(std::function<void(std::shared_ptr<PeerConnection>)> handler);
+  void resume();
+  // Stops accepting; connections already made carry on.
+  void stop();
+  const std::string& path() const { return path_; }
+
+ private:
+  Listener(int fd, std::string path, bool ownsPath, SerialQueue* queue);
+  void acceptLoop();
+
+  const int fd_;
+  const int wakeFd_;
+  const std::string path_;
+  const bool ownsPath_;
+  SerialQueue* const queue_;
+  std::function<void(std::shared_ptr<PeerConnection>)> handler_;
+  std::thread thread_;
+  std::atomic<bool> stopping_{false};
+};
+
+// Keep-alive transactions: while the count is above zero the daemon is busy
+// and must not exit for idleness (under systemd the status says so).
+void KeepAliveBegin();
+void KeepAliveEnd();
+int KeepAliveCount();
+
+}  // namespace dr

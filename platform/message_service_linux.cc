@@ -1,0 +1,350 @@
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+
+#include "core/log.h"
+#include "platform/file_system.h"
+#include "platform/message_service.h"
+
+namespace dr {
+namespace {
+
+// Linux 6.5 and later hand out a pidfd for the peer; older kernels refuse
+// the option, and the audit token then carries none.
+#ifndef SO_PEERPIDFD
+#define SO_PEERPIDFD 77
+#endif
+
+constexpr size_t kReadChunk = 65536;
+
+int MakeWakeFd() { return ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); }
+
+void DrainWakeFd(int fd) {
+  uint64_t n;
+  while (::read(fd, &n, sizeof n) > 0) {
+  }
+}
+
+std::atomic<int> gKeepAlive{0};
+
+void NotifyKeepAlive(int count) {
+  // Only meaningful under systemd; sd_notify does nothing elsewhere.
+  if (count > 0) {
+    sd_notifyf(0, "STATUS=busy: %d keep-alive transaction(s)", count);
+  } else {
+    sd_notify(0, "STATUS=idle");
+  }
+}
+
+}  // namespace
+
+void KeepAliveBegin() { NotifyKeepAlive(++gKeepAlive); }
+void KeepAliveEnd() { NotifyKeepAlive(--gKeepAlive); }
+int KeepAliveCount() { return gKeepAlive.load(); }
+
+// ---- PeerConnection ---------------------------------------------------------
+
+PeerConnection::PeerConnection(int fd, AuditToken token)
+    : fd_(fd), wakeFd_(MakeWakeFd()), token_(token) {}
+
+PeerConnection::~PeerConnection() {
+  ::close(fd_);
+  if (wakeFd_ >= 0) ::close(wakeFd_);
+  if (token_.pidfd >= 0) ::close(token_.pidfd);
+}
+
+std::string PeerConnection::description() const {
+  return "<connection fd=" + std::to_string(fd_) + " pid=" + std::to_string(token_.pid) + ">";
+}
+
+void PeerConnection::setContext(std::shared_ptr<void> context) {
+  std::lock_guard<std::mutex> lock(mu_);
+  context_ = std::move(context);
+}
+
+void PeerConnection::setEventHandler(std::function<void(const ConnectionEvent&)> handler) {
+  handler_ = std::move(handler);
+}
+
+void PeerConnection::resume() {
+  if (resumed_.exchange(true)) return;
+  // The thread owns a reference, so the connection lives while it reads.
+  std::thread([self = shared_from_this()] { self->run(); }).detach();
+}
+
+void PeerConnection::wake() {
+  uint64_t one = 1;
+  [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
+}
+
+Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
+  std::lock_guard<std::mutex> lock(mu_);
+  if (closed_) return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "connection closed");
+  Result<std::string> frame =
+      drm1::EncodeFrame(nextSerial_, requestSerial, drm1::kFlagIsReply, body);
+  if (!frame) return frame.error();
+  ++nextSerial_;
+  if (outbox_.size() - outboxSent_ + frame->size() > kMaxQueuedReplyBytes) {
+    SystemLog("closing %@: more than 64 MiB of replies unread", description());
+    closed_ = true;
+    wake();
+    return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "reply queue full");
+  }
+  outbox_ += *frame;
+  wake();
+  return Status::OK();
+}
+
+void PeerConnection::cancel() {
+  closed_ = true;
+  wake();
+}
+
+bool PeerConnection::flush(int timeoutMs) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+  for (;;) {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      if (outboxSent_ == outbox_.size()) return true;
+    }
+    if (closed_ || std::chrono::steady_clock::now() >= deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+}
+
+bool PeerConnection::writeSome() {
+  std::lock_guard<std::mutex> lock(mu_);
+  while (outboxSent_ < outbox_.size()) {
+    ssize_t n = ::send(fd_, outbox_.data() + outboxSent_, outbox_.size() - outboxSent_,
+                       MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return errno == EAGAIN || errno == EWOULDBLOCK;
+    }
+    outboxSent_ += static_cast<size_t>(n);
+  }
+  outbox_.clear();
+  outboxSent_ = 0;
+  return true;
+}
+
+void PeerConnection::run() {
+  drm1::FrameDecoder decoder;
+  std::string buf(kReadChunk, '\0');
+  bool peerOpen = true;
+  while (peerOpen && !closed_) {
+    bool pendingOut;
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      pendingOut = outboxSent_ < outbox_.size();
+    }
+    struct pollfd fds[2] = {{fd_, static_cast<short>(POLLIN | (pendingOut ? POLLOUT : 0)), 0},
+                            {wakeFd_, POLLIN, 0}};
+    if (::poll(fds, 2, -1) < 0) {
+      if (errno == EINTR) continue;
+      break;
+    }
+    if (fds[1].revents & POLLIN) DrainWakeFd(wakeFd_);
+    if ((fds[0].revents & POLLOUT) && !writeSome()) break;
+    if (fds[0].revents & (POLLIN | POLLHUP | POLLERR)) {
+      ssize_t n = ::recv(fd_, buf.data(), buf.size(), MSG_DONTWAIT);
+      if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
+      if (n <= 0) {
+        peerOpen = false;
+        break;
+      }
+      decoder.feed(std::string_view(buf.data(), static_cast<size_t>(n)));
+      for (;;) {
+        Result<std::optional<drm1::Frame>> frame = decoder.next();
+        if (!frame) {
+          SystemLog("protocol error on %@: %@", description(), frame.error());
+          peerOpen = false;
+          break;
+        }
+        if (!frame->has_value()) break;
+        drm1::Frame& f = **frame;
+        if (f.header.isReply()) {
+          SystemLog("protocol error on %@: a peer sent a reply", description());
+          peerOpen = false;
+          break;
+        }
+        ConnectionEvent event;
+        event.message = PeerMessage{f.header.serial, f.header.wantsReply(), std::move(f.body)};
+        if (handler_) handler_(event);
+      }
+    }
+    // Write what the handler just queued without waiting for the next poll.
+    if (!writeSome()) break;
+  }
+  closed_ = true;
+  ::shutdown(fd_, SHUT_RDWR);
+  ConnectionEvent invalid;
+  invalid.kind = ConnectionEvent::Kind::kConnectionInvalid;
+  if (handler_) handler_(invalid);
+  handler_ = nullptr;
+  // The finalizer: the context goes once the last event was delivered.
+  std::shared_ptr<void> context;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    context = std::move(context_);
+  }
+}
+
+// ---- Listener ---------------------------------------------------------------
+
+namespace {
+
+// A listening socket passed by systemd, or -1. Descriptors that are not a
+// listening Unix stream socket are closed, with a log line.
+int TakeActivatedSocket() {
+  int n = sd_listen_fds(1);
+  if (n <= 0) return -1;
+  int chosen = -1;
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n; ++fd) {
+    if (chosen < 0 && sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) > 0) {
+      chosen = fd;
+      ::fcntl(fd, F_SETFD, FD_CLOEXEC);
+    } else {
+      SystemLog("closing passed descriptor %d: not the one listening Unix stream socket", fd);
+      ::close(fd);
+    }
+  }
+  return chosen;
+}
+
+}  // namespace
+
+Result<std::unique_ptr<Listener>> Listener::Create(const ListenerOptions& options,
+                                                   SerialQueue* eventQueue) {
+  if (options.useSocketActivation) {
+    int fd = TakeActivatedSocket();
+    if (fd >= 0) return std::unique_ptr<Listener>(new Listener(fd, "", false, eventQueue));
+  }
+  const std::string& name = options.serviceName;
+  if (name.empty() || name == "." || name == ".." || name.find('/') != std::string::npos) {
+    return Error(kPosixErrorDomain, EINVAL, "invalid service name \"" + name + "\"");
+  }
+  const std::string path = options.socketDirectory + "/" + name;
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  if (path.size() >= sizeof addr.sun_path) {
+    return Error(kPosixErrorDomain, ENAMETOOLONG, "socket path too long: " + path);
+  }
+  std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  if (Status s = FileSystem::Default()->makeDirectories(options.socketDirectory, 0700); !s.ok()) {
+    return s.error();
+  }
+
+  struct stat st;
+  if (::lstat(path.c_str(), &st) == 0) {
+    if (!S_ISSOCK(st.st_mode)) {
+      return Error(kPosixErrorDomain, EEXIST, path + " exists and is not a socket");
+    }
+    // Somebody accepting on it means the name is taken; a refusal means the
+    // socket was left behind by a daemon that is gone.
+    int probe = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (probe < 0) return PosixError(errno, "socket");
+    int rc = ::connect(probe, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
+    int err = errno;
+    ::close(probe);
+    if (rc == 0) {
+      return Error(kPosixErrorDomain, EADDRINUSE, "service \"" + name + "\" is already served");
+    }
+    if (err != ECONNREFUSED && err != ENOENT) return PosixError(err, "connect " + path);
+    ::unlink(path.c_str());
+  }
+
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return PosixError(errno, "socket");
+  // The folder is private already; the socket itself is the user's alone too.
+  mode_t old = ::umask(0077);
+  int rc = ::bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
+  int err = errno;
+  ::umask(old);
+  if (rc != 0 || ::listen(fd, SOMAXCONN) != 0) {
+    if (rc == 0) err = errno;
+    ::close(fd);
+    return PosixError(err, "listen on " + path);
+  }
+  return std::unique_ptr<Listener>(new Listener(fd, path, true, eventQueue));
+}
+
+Listener::Listener(int fd, std::string path, bool ownsPath, SerialQueue* queue)
+    : fd_(fd), wakeFd_(MakeWakeFd()), path_(std::move(path)), ownsPath_(ownsPath), queue_(queue) {}
+
+Listener::~Listener() {
+  stop();
+  ::close(fd_);
+  if (wakeFd_ >= 0) ::close(wakeFd_);
+  if (ownsPath_) ::unlink(path_.c_str());
+}
+
+void Listener::setEventHandler(std::function<void(std::shared_ptr<PeerConnection>)> handler) {
+  handler_ = std::move(handler);
+}
+
+void Listener::resume() {
+  if (thread_.joinable()) return;
+  thread_ = std::thread([this] { acceptLoop(); });
+}
+
+void Listener::stop() {
+  stopping_ = true;
+  uint64_t one = 1;
+  [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
+  if (thread_.joinable()) thread_.join();
+}
+
+void Listener::acceptLoop() {
+  while (!stopping_) {
+    struct pollfd fds[2] = {{fd_, POLLIN, 0}, {wakeFd_, POLLIN, 0}};
+    if (::poll(fds, 2, -1) < 0) {
+      if (errno == EINTR) continue;
+      SystemLog("listener poll failed: %@", PosixError(errno, "poll"));
+      return;
+    }
+    if (stopping_) return;
+    if (!(fds[0].revents & POLLIN)) continue;
+    int fd = ::accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC);
+    if (fd < 0) {
+      if (errno != EINTR && errno != EAGAIN && errno != ECONNABORTED) {
+        SystemLog("accept failed: %@", PosixError(errno, "accept"));
+        // Out of descriptors or memory: pause instead of spinning.
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+      }
+      continue;
+    }
+    struct ucred cred;
+    socklen_t len = sizeof cred;
+    if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
+      SystemLog("closing a peer without credentials: %@", PosixError(errno, "SO_PEERCRED"));
+      ::close(fd);
+      continue;
+    }
+    if (cred.uid != ::geteuid()) {
+      SystemLog("refusing peer pid %d of uid %d: drd serves uid %d only", cred.pid, cred.uid,
+                ::geteuid());
+      ::close(fd);
+      continue;
+    }
+    AuditToken token{cred.pid, cred.uid, cred.gid, -1};
+    int pidfd = -1;
+    len = sizeof pidfd;
+    if (::getsockopt(fd, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &len) == 0) token.pidfd = pidfd;
+    std::shared_ptr<PeerConnection> connection(new PeerConnection(fd, token));
+    if (handler_) {
+      queue_->async([handler = handler_, connection] { handler(connection); });
+    }
+  }
+}
+
+}  // namespace dr

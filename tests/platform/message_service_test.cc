@@ -1,0 +1,271 @@
+#include "platform/message_service.h"
+
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstring>
+#include <fstream>
+#include <thread>
+
+#include "core/log.h"
+#include "tests/support/process_fixtures.h"
+
+namespace dr {
+namespace {
+
+using namespace std::chrono_literals;
+
+// A blocking test peer speaking DRM1 on a real socket.
+class Peer {
+ public:
+  explicit Peer(const std::string& path) {
+    fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    struct sockaddr_un addr = {};
+    addr.sun_family = AF_UNIX;
+    std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+    connected_ = ::connect(fd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) == 0;
+  }
+  ~Peer() { ::close(fd_); }
+  bool connected() const { return connected_; }
+  int fd() const { return fd_; }
+
+  void sendRaw(const std::string& bytes) {
+    ASSERT_EQ(::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL),
+              static_cast<ssize_t>(bytes.size()));
+  }
+  void sendRequest(uint64_t serial, const Value& body) {
+    sendRaw(*drm1::EncodeFrame(serial, 0, drm1::kFlagWantsReply, body));
+  }
+  // The next frame, or nothing on EOF, error or timeout.
+  std::optional<drm1::Frame> receive(std::chrono::milliseconds timeout = 5s) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+      Result<std::optional<drm1::Frame>> f = decoder_.next();
+      if (!f) return std::nullopt;
+      if (f->has_value()) return std::move(**f);
+      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - std::chrono::steady_clock::now());
+      struct pollfd p = {fd_, POLLIN, 0};
+      if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
+        return std::nullopt;
+      }
+      char buf[65536];
+      ssize_t n = ::recv(fd_, buf, sizeof buf, 0);
+      if (n <= 0) {
+        eof_ = true;
+        return std::nullopt;
+      }
+      decoder_.feed(std::string_view(buf, static_cast<size_t>(n)));
+    }
+  }
+  bool sawEof() {
+    while (!eof_ && receive(2s)) {
+    }
+    return eof_;
+  }
+
+ private:
+  int fd_ = -1;
+  bool connected_ = false;
+  bool eof_ = false;
+  drm1::FrameDecoder decoder_;
+};
+
+class MessageServiceTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    options_.socketDirectory = folder_.path() + "/sockets";
+    options_.serviceName = "com.example.test";
+    options_.useSocketActivation = false;
+  }
+
+  // A listener whose connections answer each request with its own body plus
+  // "echo": true, and count their connection-invalid events.
+  std::unique_ptr<Listener> EchoListener() {
+    Result<std::unique_ptr<Listener>> listener = Listener::Create(options_, &queue_);
+    EXPECT_TRUE(listener) << listener.error().description();
+    if (!listener) return nullptr;
+    (*listener)->setEventHandler([this](std::shared_ptr<PeerConnection> c) {
+      std::weak_ptr<PeerConnection> weak = c;
+      c->setContext(context_);
+      c->setEventHandler([this, weak](const ConnectionEvent& e) {
+        auto conn = weak.lock();
+        if (e.kind == ConnectionEvent::Kind::kConnectionInvalid) {
+          invalid_++;
+          return;
+        }
+        if (conn && e.message.wantsReply) {
+          conn->sendReply(e.message.serial, e.message.body.changing("echo", true));
+        }
+      });
+      c->resume();
+    });
+    (*listener)->resume();
+    return std::move(*listener);
+  }
+
+  testing::TempFolder folder_;
+  ListenerOptions options_;
+  SerialQueue queue_{"ipc"};
+  std::shared_ptr<int> context_ = std::make_shared<int>(7);
+  std::atomic<int> invalid_{0};
+};
+
+TEST_F(MessageServiceTest, AnswersEachRequestWithOneBoundReplyInOrder) {
+  auto listener = EchoListener();
+  ASSERT_TRUE(listener);
+  struct stat st;
+  ASSERT_EQ(::stat(options_.socketDirectory.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0700u);
+
+  Peer peer(listener->path());
+  ASSERT_TRUE(peer.connected());
+  for (uint64_t serial : {5, 6, 9}) peer.sendRequest(serial, Value{{"n", serial}});
+  // A message that wants no reply gets none.
+  peer.sendRaw(*drm1::EncodeFrame(10, 0, 0, Value{{"n", 10}}));
+  peer.sendRequest(11, Value{{"n", 11}});
+  uint64_t lastSerial = 0;
+  for (uint64_t expected : {5, 6, 9, 11}) {
+    std::optional<drm1::Frame> reply = peer.receive();
+    ASSERT_TRUE(reply) << expected;
+    EXPECT_TRUE(reply->header.isReply());
+    EXPECT_EQ(reply->header.replyTo, expected);
+    EXPECT_GT(reply->header.serial, lastSerial);
+    lastSerial = reply->header.serial;
+    EXPECT_EQ(reply->body, (Value{{"n", expected}, {"echo", true}}));
+  }
+}
+
+TEST_F(MessageServiceTest, ProtocolErrorClosesOnlyThatConnectionAndReleasesItsContext) {
+  auto listener = EchoListener();
+  ASSERT_TRUE(listener);
+  ScopedLogCapture log;
+  Peer good(listener->path()), bad(listener->path());
+  good.sendRequest(1, Value{{"a", 1}});
+  ASSERT_TRUE(good.receive());
+  bad.sendRaw("DRM2" + std::string(28, '\0'));
+  EXPECT_TRUE(bad.sawEof());
+  good.sendRequest(2, Value{{"a", 2}});
+  std::optional<drm1::Frame> reply = good.receive();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->header.replyTo, 2u);
+  EXPECT_TRUE(log.contains("protocol error on <connection"));
+  EXPECT_TRUE(log.contains("bad magic"));
+
+  // Each connection that ends delivers one connection-invalid event and then
+  // lets go of its context; the good connection still holds its own.
+  for (int i = 0; i < 200 && (invalid_ < 1 || context_.use_count() > 2); ++i) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_EQ(invalid_, 1);
+  EXPECT_EQ(context_.use_count(), 2);
+}
+
+TEST_F(MessageServiceTest, ReplacesAStaleSocketButNeverALiveOneOrAnotherFile) {
+  // A live listener holds the name.
+  auto live = EchoListener();
+  ASSERT_TRUE(live);
+  Result<std::unique_ptr<Listener>> second = Listener::Create(options_, &queue_);
+  ASSERT_FALSE(second);
+  EXPECT_EQ(second.error().code(), EADDRINUSE);
+
+  // A socket file nobody accepts on is left over from a daemon that died.
+  const std::string path = live->path();
+  int stale = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  live.reset();
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+  ASSERT_EQ(::bind(stale, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr), 0);
+  ::close(stale);
+  auto replaced = EchoListener();
+  ASSERT_TRUE(replaced);
+  Peer peer(path);
+  peer.sendRequest(1, Value{{"x", 1}});
+  EXPECT_TRUE(peer.receive());
+  replaced.reset();
+
+  // Anything else at the path is left alone.
+  { std::ofstream(path) << "precious"; }
+  Result<std::unique_ptr<Listener>> onFile = Listener::Create(options_, &queue_);
+  ASSERT_FALSE(onFile);
+  std::ifstream in(path);
+  std::string content((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  EXPECT_EQ(content, "precious");
+
+  for (const char* bad : {"", "a/b", ".."}) {
+    options_.serviceName = bad;
+    EXPECT_FALSE(Listener::Create(options_, &queue_)) << bad;
+  }
+}
+
+TEST_F(MessageServiceTest, APeerThatNeverReadsNeitherBlocksTheSenderNorGrowsWithoutBound) {
+  auto listener = Listener::Create(options_, &queue_);
+  ASSERT_TRUE(listener);
+  std::shared_ptr<PeerConnection> connection;
+  std::mutex mu;
+  std::condition_variable cv;
+  (*listener)->setEventHandler([&](std::shared_ptr<PeerConnection> c) {
+    c->setEventHandler([](const ConnectionEvent&) {});
+    c->resume();
+    std::lock_guard<std::mutex> lock(mu);
+    connection = c;
+    cv.notify_all();
+  });
+  (*listener)->resume();
+  Peer peer((*listener)->path());
+  {
+    std::unique_lock<std::mutex> lock(mu);
+    ASSERT_TRUE(cv.wait_for(lock, 5s, [&] { return connection != nullptr; }));
+  }
+  ScopedLogCapture log;
+  const Value big = Value{{"blob", Value(Data(1 << 20, 0x5A))}};
+  const auto start = std::chrono::steady_clock::now();
+  int accepted = 0;
+  for (int i = 0; i < 80; ++i) {
+    if (connection->sendReply(static_cast<uint64_t>(i + 1), big).ok()) ++accepted;
+  }
+  // Queuing never waited for the peer, which read nothing.
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 5s);
+  EXPECT_GE(accepted, 60);
+  EXPECT_LT(accepted, 80);
+  EXPECT_FALSE(connection->isOpen());
+  EXPECT_TRUE(log.contains("more than 64 MiB of replies unread"));
+}
+
+TEST_F(MessageServiceTest, RefusesPeersOfAnotherUser) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
+  auto listener = EchoListener();
+  ASSERT_TRUE(listener);
+  // Open the way for the other user, so that only drd's own check stands.
+  ::chmod(options_.socketDirectory.c_str(), 0755);
+  ::chmod(listener->path().c_str(), 0777);
+  ::chmod(folder_.path().c_str(), 0755);
+  ScopedLogCapture log;
+  pid_t child = ::fork();
+  if (child == 0) {
+    if (::setgid(65534) != 0 || ::setuid(65534) != 0) ::_exit(3);
+    Peer peer(listener->path());
+    if (!peer.connected()) ::_exit(4);
+    // The daemon may already have closed the socket; no reply may come.
+    std::string frame = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Value{{"x", 1}});
+    [[maybe_unused]] ssize_t sent = ::send(peer.fd(), frame.data(), frame.size(), MSG_NOSIGNAL);
+    ::_exit(peer.receive(3s) ? 1 : 0);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+  EXPECT_TRUE(log.contains("refusing peer pid"));
+}
+
+}  // namespace
+}  // namespace dr
