@@ -1,0 +1,114 @@
+// DRDAnnotationStore: the user's annotations of plug-ins (an election and a
+// settings dictionary per annotation key), kept in memory as one table and
+// written back whole to the annotation file after every change.
+//
+// Owned by the plug-in database, which calls it only from its "DRDatabase"
+// serial queue; the store has no lock of its own and must not be used from
+// two threads at once. The file is read once, at construction; from then on
+// memory is the truth. Failures never reach the caller: a file that cannot be
+// loaded leaves an empty table (logged unless the file is simply missing), a
+// save that fails is logged and the table in memory keeps the change. Only
+// the start-up errors of the default location (no user state folder, the
+// annotation folder cannot be made) stop the process.
+//
+// File layout (XML pdoc, written through the atomic, durable file write, 0600):
+//   <dict> "version" → 16, "data" → { annotation key → annotation dictionary }
+// Writing the whole file on each change was chosen over an append log: the
+// table holds one small entry per annotated plug-in identifier and changes
+// only on user action, and a whole file replaced by rename is never half
+// written.
+#pragma once
+
+#include <sys/types.h>
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/file_system.h"
+#include "platform/locations.h"
+#include "platform/usage_reports.h"
+
+namespace dr {
+
+class DRDPlugIn;
+
+struct AnnotationStoreOptions {
+  // Reads and writes the annotation file and makes its folder; never null.
+  FileSystem* fileSystem = FileSystem::Default();
+  // Receives election reports; null sends none.
+  UsageReports* usageReports = nullptr;
+  // Looks up XDG_STATE_HOME and HOME for the default location; null reads the
+  // process environment.
+  EnvironmentLookup getenv = nullptr;
+  // Called with the message of a fatal start-up error after it has been
+  // logged, in place of std::abort(). Must not return; if it does, the
+  // process is aborted all the same.
+  std::function<void(std::string_view message)> onFatal;
+};
+
+class DRDAnnotationStore {
+ public:
+  // The version of the file layout this store reads and writes.
+  static constexpr int64_t kDatabaseVersion = 16;
+  // Permissions of the folder made for the default location and of the file.
+  static constexpr mode_t kFolderMode = 0700;
+  static constexpr mode_t kFileMode = 0600;
+
+  static constexpr const char* kElectionKey = "election";
+  static constexpr const char* kExtensionKey = "extension";
+
+  // A store over the annotation file at `path` (taken as a file; no folder is
+  // made for it), or at defaultDatabaseURL() when no path is given, loaded
+  // from that file at once. A file that cannot be loaded gives an empty
+  // table; it is not rewritten until the next change. Never empty.
+  static std::unique_ptr<DRDAnnotationStore> initWithDatabase(
+      const std::optional<std::string>& path, AnnotationStoreOptions options = {});
+
+  // The default annotation file: "Annotations" in "com.corvel.dromon/" of the
+  // user's state folder ($XDG_STATE_HOME, else $HOME/.local/state). The
+  // folder is made with its missing parents, 0700. Stops the process with
+  // "unable to locate user directory: errno %d" when there is no state folder
+  // (or its path is too long), and with "unable to create plugin annotations
+  // directory:%@ error:%@" when the folder cannot be made.
+  static std::string defaultDatabaseURL(const AnnotationStoreOptions& options);
+
+  DRDAnnotationStore(const DRDAnnotationStore&) = delete;
+  DRDAnnotationStore& operator=(const DRDAnnotationStore&) = delete;
+
+  // The stored annotation of `plugIn`'s annotation key, or absent.
+  Value annotationForPlugIn(const DRDPlugIn& plugIn) const;
+
+  // Merges `annotation` into the stored annotation of `plugIn`'s annotation
+  // key (its keys replace stored keys of the same name; the others stay),
+  // or erases that annotation when `annotation` is absent, then saves the
+  // whole table. A changed "election" is reported as "Enabled" (1) or
+  // "Disabled" (any other value) when the plug-in names its extension point.
+  // A failed save is logged; the change stays in memory either way.
+  void setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& plugIn);
+
+  // Replaces the table with the contents of the annotation file. On failure
+  // the table is unchanged and the "db-load" probe fires with the error.
+  Status loadDb();
+  // Writes the whole table to the annotation file, atomically.
+  Status saveDb();
+
+  const std::string& annotationsURL() const { return annotationsURL_; }
+  void setAnnotationsURL(std::string url) { annotationsURL_ = std::move(url); }
+  // The table: annotation key → annotation dictionary.
+  const Dictionary& annotations() const { return annotations_; }
+  void setAnnotations(Dictionary table) { annotations_ = std::move(table); }
+
+ private:
+  explicit DRDAnnotationStore(AnnotationStoreOptions options);
+
+  AnnotationStoreOptions options_;
+  std::string annotationsURL_;
+  Dictionary annotations_;
+};
+
+}  // namespace dr
