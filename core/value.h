@@ -95,6 +95,9 @@ class Value {
   Value(const char* s) : v_(std::string(s)) {}
   Value(Data d) : v_(std::move(d)) {}
   Value(Uuid u) : v_(u) {}
+  // An empty optional is absent.
+  template <typename T>
+  Value(const std::optional<T>& o) : Value(o ? Value(*o) : Value()) {}
   Value(Array a);
   // Absent entries of `d` are dropped.
   Value(Dictionary d);

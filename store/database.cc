@@ -1,0 +1,177 @@
+#include "store/database.h"
+
+#include "core/format.h"
+#include "core/log.h"
+#include "model/plugin_keys.h"
+#include "store/usage_report.h"
+
+namespace dr {
+namespace {
+
+constexpr const char* kAutoElectEntitlement = "com.corvel.developer.auto-elect-plugin";
+
+}  // namespace
+
+std::shared_ptr<DRDatabase> DRDatabase::initWithDatabase(const std::optional<std::string>& path,
+                                                         DatabaseOptions options) {
+  std::shared_ptr<DRDatabase> db(new DRDatabase(path, std::move(options)));
+  db->subscribe();
+  return db;
+}
+
+DRDatabase::DRDatabase(const std::optional<std::string>& path, DatabaseOptions options)
+    : options_(std::move(options)) {
+  options_.annotationStore.usageReports = options_.usageReports;
+  annotations_ = DRDAnnotationStore::initWithDatabase(path, options_.annotationStore);
+}
+
+DRDatabase::~DRDatabase() {
+  if (options_.registry) options_.registry->removeObserver(this);
+}
+
+void DRDatabase::subscribe() { options_.registry->addObserver(weak_from_this()); }
+
+void DRDatabase::setDelegate(std::weak_ptr<DRDatabaseDelegate> delegate) {
+  std::lock_guard<std::mutex> lock(delegateMu_);
+  delegate_ = std::move(delegate);
+}
+
+DRDPlugInPtr DRDatabase::plugInForProxy(const RegistryEntryPtr& entry) {
+  return sync_.syncResult([&]() -> DRDPlugInPtr {
+    auto it = cache_.find(entry->uuid());
+    return it != cache_.end() ? it->second : createPlugInForProxy(entry);
+  });
+}
+
+DRDPlugInPtr DRDatabase::createPlugInForProxy(const RegistryEntryPtr& entry) {
+  sync_.assertCurrent("createPlugInForProxy");
+  DRDPlugInPtr record = DRDPlugIn::initWithRGData(entry, options_.plugInServices);
+  if (!record) return nullptr;
+  if (record->hasEntitlement(kAutoElectEntitlement)) autoElect(*record);
+  cache_[*record->uuid()] = record;
+  return record;
+}
+
+void DRDatabase::autoElect(const DRDPlugIn& record) {
+  sync_.assertCurrent("autoElect");
+  Value annotation = annotations_->annotationForPlugIn(record);
+  if (!annotation.isDictionary()) annotation = Value::EmptyDictionary();
+  const Value& election = annotation[DRDAnnotationStore::kElectionKey];
+  if (election.isAbsent() || election.intValue() == 0) {
+    // Straight to the store: the database's own setter would enter the queue
+    // again. So an automatic election posts no change notification.
+    annotations_->setAnnotationForPlugIn(
+        annotation.changing(DRDAnnotationStore::kElectionKey, Value(1)), record);
+  }
+}
+
+std::optional<std::vector<DRDPlugInPtr>> DRDatabase::findPlugIns(const Value& /*rules*/) {
+  std::vector<DRDPlugInPtr> result;
+  for (const RegistryEntryPtr& entry : options_.registry->allEntries()) {
+    if (entry->url().empty()) continue;
+    if (DRDPlugInPtr record = plugInForProxy(entry)) result.push_back(std::move(record));
+  }
+  return result;
+}
+
+DRDPlugInPtr DRDatabase::findPlugIn(const Uuid& uuid) {
+  return sync_.syncResult([&]() -> DRDPlugInPtr {
+    auto it = cache_.find(uuid);
+    if (it != cache_.end()) return it->second;
+    if (RegistryEntryPtr entry = options_.registry->entryForUuid(uuid)) {
+      return createPlugInForProxy(entry);
+    }
+    SystemLog("Registrar cannot find plug-in with UUID:%@", uuid.string());
+    return nullptr;
+  });
+}
+
+DRDPlugInPtr DRDatabase::findPlugInAtPath(const std::string& url) {
+  if (RegistryEntryPtr entry = options_.registry->entryForUrl(url)) {
+    return findPlugIn(entry->uuid());
+  }
+  SystemLog("Registrar cannot find plug-in at path:%@", url);
+  return nullptr;
+}
+
+std::optional<std::vector<DRDPlugInPtr>> DRDatabase::plugInsWithinApplication(
+    const std::string& url) {
+  RegistryEntries entries = options_.registry->entriesWithinApplication(url);
+  if (entries.empty()) return std::nullopt;
+  std::vector<DRDPlugInPtr> result;
+  result.reserve(entries.size());
+  for (const RegistryEntryPtr& entry : entries) {
+    if (DRDPlugInPtr record = plugInForProxy(entry)) result.push_back(std::move(record));
+  }
+  return result;
+}
+
+std::optional<Error> DRDatabase::addPlugIn(const std::string& url) {
+  if (options_.registry->registerBundle(url).ok()) return std::nullopt;
+  return DRMakeError(kDRErrorRegistrar, "Registrar failed to register the plug-in");
+}
+
+std::optional<Error> DRDatabase::removePlugIn(const std::string& url) {
+  if (options_.registry->unregisterBundle(url).ok()) return std::nullopt;
+  return DRMakeError(kDRErrorRegistrar, "Registrar failed to deregister the plug-in");
+}
+
+Value DRDatabase::annotationForPlugIn(const DRDPlugIn& record) {
+  return sync_.syncResult([&] { return annotations_->annotationForPlugIn(record); });
+}
+
+std::optional<Error> DRDatabase::setAnnotationForPlugIn(const Value& annotation,
+                                                        const DRDPlugIn& record) {
+  sync_.sync([&] { annotations_->setAnnotationForPlugIn(annotation, record); });
+  if (options_.notifications) {
+    if (Status s = options_.notifications->post(kAnnotationChangeNotification); !s.ok()) {
+      SystemLog("unable to post %@: %@", kAnnotationChangeNotification, s);
+    }
+  }
+  return std::nullopt;
+}
+
+DRDPlugInPtr DRDatabase::cachedPlugIn(const Uuid& uuid) {
+  return sync_.syncResult([&]() -> DRDPlugInPtr {
+    auto it = cache_.find(uuid);
+    return it == cache_.end() ? nullptr : it->second;
+  });
+}
+
+void DRDatabase::pluginsDidInstall(const RegistryEntries& entries) {
+  for (const RegistryEntryPtr& entry : entries) {
+    SystemLog("INSTALLED:%@ %@(%@) %@ %@", entry->bundleIdentifier(), entry->plugInIdentifier(),
+              entry->bundleVersion(), Value(entry->uuid()), entry->url());
+    if (IsDevelopmentBuildPath(entry->url())) continue;
+    sendUsageReport(options_.usageReports, Value(entry->plugInIdentifier()),
+                    entry->infoDictionary()[kBNBundleVersionKey],
+                    entry->plugInDictionary()[kUXExtensionPointIdentifierKey], kUsageInstalled);
+  }
+}
+
+void DRDatabase::pluginsDidUninstall(const RegistryEntries& entries) {
+  sync_.sync([&] {
+    for (const RegistryEntryPtr& entry : entries) {
+      auto it = cache_.find(entry->uuid());
+      if (it != cache_.end()) {
+        const DRDPlugIn& record = *it->second;
+        if (!IsDevelopmentBuildPath(record.path().value_or(""))) {
+          sendUsageReport(options_.usageReports, Value(record.identifier()),
+                          Value(record.version()), record.attributes()[kUXExtensionPointNameKey],
+                          kUsageUninstalled);
+        }
+      }
+      SystemLog("UNINSTALLED:%@ %@(%@) %@ %@", entry->bundleIdentifier(), entry->plugInIdentifier(),
+                entry->bundleVersion(), entry->uuid().string(), entry->url());
+      if (it != cache_.end()) cache_.erase(it);
+    }
+  });
+  std::shared_ptr<DRDatabaseDelegate> delegate;
+  {
+    std::lock_guard<std::mutex> lock(delegateMu_);
+    delegate = delegate_.lock();
+  }
+  if (delegate) delegate->removedPlugIns(entries);
+}
+
+}  // namespace dr

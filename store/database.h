@@ -1,0 +1,119 @@
+// DRDatabase: the daemon's one view of the installed plug-ins.
+//
+// The registry is the store of record; the database turns its entries into
+// DRDPlugIn records, caches every record it built by UUID for the life of the
+// process (one record per UUID, shared by all callers), registers and
+// unregisters bundles, follows the registry's install and uninstall events,
+// and fronts the annotation store. The cache and the store are touched only
+// on the "DRDatabase" serial queue; lookups enter it synchronously, one entry
+// at a time, and registry calls that may be slow are made off it.
+//
+// Held by std::shared_ptr (the registry holds its observer weakly); the
+// delegate is held weakly. Failures are answered (none, or an error record),
+// with the system-log lines the daemon defines; nothing throws.
+#pragma once
+
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "core/queue.h"
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/notifications.h"
+#include "platform/registry.h"
+#include "platform/usage_reports.h"
+#include "plugin/plugin.h"
+#include "store/annotation_store.h"
+
+namespace dr {
+
+// Told which plug-ins were uninstalled (registry entries, not records).
+class DRDatabaseDelegate {
+ public:
+  virtual ~DRDatabaseDelegate() = default;
+  virtual void removedPlugIns(const RegistryEntries& entries) = 0;
+};
+
+struct DatabaseOptions {
+  // The registry; required, and must outlive the database.
+  Registry* registry = nullptr;
+  // Where annotation changes are posted; null: nothing is posted.
+  NotificationCenter* notifications = nullptr;
+  // Install, uninstall and election reports; null: none are sent.
+  UsageReports* usageReports = nullptr;
+  // The services records are built with.
+  PlugInServices plugInServices;
+  // The annotation store's options (its usage reports are this one's).
+  AnnotationStoreOptions annotationStore;
+};
+
+class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<DRDatabase> {
+ public:
+  static constexpr const char* kAnnotationChangeNotification =
+      "com.corvel.dromon.annotation-change";
+
+  // The database over options.registry, with the annotation file at `path`
+  // (none: the default location), subscribed to the registry's events.
+  // REQUIRES: options.registry is set.
+  static std::shared_ptr<DRDatabase> initWithDatabase(const std::optional<std::string>& path,
+                                                      DatabaseOptions options);
+  ~DRDatabase() override;
+
+  // The record of `entry`: the cached one, else a new one (none when the
+  // entry cannot make one; nothing is cached then, so the next lookup tries
+  // again). Enters the queue.
+  DRDPlugInPtr plugInForProxy(const RegistryEntryPtr& entry);
+  // REQUIRES: on the "DRDatabase" queue.
+  DRDPlugInPtr createPlugInForProxy(const RegistryEntryPtr& entry);
+  // Elects the plug-in unless the user already chose. REQUIRES: on the queue.
+  void autoElect(const DRDPlugIn& record);
+
+  // Every installed plug-in that makes a record; none when the registry gives
+  // no list. `rules` is not used: the caller filters.
+  std::optional<std::vector<DRDPlugInPtr>> findPlugIns(const Value& rules);
+  // The plug-in named `uuid`, or none (logged).
+  DRDPlugInPtr findPlugIn(const Uuid& uuid);
+  // The plug-in whose bundle is at `url`, or none (logged).
+  DRDPlugInPtr findPlugInAtPath(const std::string& url);
+  // The plug-ins of the application at `url`; none when it has none.
+  std::optional<std::vector<DRDPlugInPtr>> plugInsWithinApplication(const std::string& url);
+
+  // Registers / unregisters the bundle at `url`; an error record (code 2)
+  // when the registry refuses. The registry's events then update the cache.
+  std::optional<Error> addPlugIn(const std::string& url);
+  std::optional<Error> removePlugIn(const std::string& url);
+
+  Value annotationForPlugIn(const DRDPlugIn& record);
+  // Stores (merges) or erases (absent) the annotation, then posts the change
+  // notification, every time. Always answers none.
+  std::optional<Error> setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& record);
+
+  // Registry events.
+  void pluginsDidInstall(const RegistryEntries& entries) override;
+  void pluginsDidUninstall(const RegistryEntries& entries) override;
+
+  void setDelegate(std::weak_ptr<DRDatabaseDelegate> delegate);
+  Registry* workspace() const { return options_.registry; }
+  SerialQueue& sync() { return sync_; }
+  // The cached record of `uuid`, without building one. Enters the queue.
+  DRDPlugInPtr cachedPlugIn(const Uuid& uuid);
+
+ protected:
+  DRDatabase(const std::optional<std::string>& path, DatabaseOptions options);
+  // Subscribes to the registry; the factories call it once the object is
+  // owned by a shared_ptr.
+  void subscribe();
+
+ private:
+  DatabaseOptions options_;
+  std::unique_ptr<DRDAnnotationStore> annotations_;  // on sync_ only
+  std::map<Uuid, DRDPlugInPtr> cache_;               // on sync_ only
+  std::mutex delegateMu_;
+  std::weak_ptr<DRDatabaseDelegate> delegate_;  // guarded by delegateMu_
+  SerialQueue sync_{"DRDatabase"};
+};
+
+}  // namespace dr

@@ -1,0 +1,239 @@
+#include "store/database.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <thread>
+
+#include "core/log.h"
+#include "tests/support/fake_service_manager.h"
+#include "tests/support/fake_services.h"
+#include "tests/support/registry_bundles.h"
+#include "tests/support/test_registry.h"
+
+namespace dr {
+namespace {
+
+using registry_test::MakeBundle;
+using namespace std::chrono_literals;
+
+const Value kSandboxed = Value{{"com.corvel.security.app-sandbox", true}};
+
+Value Info(const std::string& id) {
+  return Value{
+      {"BNBundleIdentifier", id},
+      {"BNBundleVersion", "3"},
+      {"UXExtension", Value{{"UXExtensionPointIdentifier", "com.example.point"},
+                            {"UXExtensionAttributes", Value{{"UXExtensionIdentifier", id},
+                                                            {"UXExtensionPointName", "Point"}}}}}};
+}
+
+class Delegate : public DRDatabaseDelegate {
+ public:
+  void removedPlugIns(const RegistryEntries& entries) override {
+    for (const auto& e : entries) removed.push_back(e->plugInIdentifier());
+  }
+  std::vector<std::string> removed;  // written on the registry's event thread
+};
+
+class DatabaseTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    registry_ = test::OpenTestRegistry(folder_.path());
+    ASSERT_TRUE(registry_);
+    DatabaseOptions options;
+    options.registry = registry_.get();
+    options.notifications = &notifications_;
+    options.usageReports = &reports_;
+    services_.serviceManager = &serviceManager_;
+    options.plugInServices = services_;
+    db_ = DRDatabase::initWithDatabase(folder_ / "Annotations", options);
+    db_->setDelegate(delegate_);
+  }
+
+  // Registers a bundle and answers its one entry.
+  RegistryEntryPtr Add(const std::string& name, const Value& info,
+                       const Value& entitlements = kSandboxed) {
+    std::string path = MakeBundle(folder_ / (name + ".appex"), info, entitlements);
+    EXPECT_FALSE(db_->addPlugIn(path).has_value());
+    return registry_->entryForUrl(path);
+  }
+
+  // Waits for the registry's event thread to have logged `fragment`.
+  static bool WaitFor(const ScopedLogCapture& log, const std::string& fragment) {
+    for (int i = 0; i < 300; ++i) {
+      if (log.contains(fragment)) return true;
+      std::this_thread::sleep_for(10ms);
+    }
+    return false;
+  }
+
+  std::vector<std::string> ReportActions() const {
+    std::vector<std::string> actions;
+    for (const auto& r : reports_.reports()) actions.push_back(r.keys.front().second);
+    return actions;
+  }
+
+  // Install reports arrive from the registry's thread at any time; only the
+  // election reports are counted here.
+  size_t ElectionReports() const {
+    size_t n = 0;
+    for (const std::string& a : ReportActions()) n += a == "Enabled" || a == "Disabled";
+    return n;
+  }
+
+  registry_test::TempFolder folder_;
+  std::unique_ptr<Registry> registry_;
+  testing::FakeNotificationCenter notifications_;
+  testing::FakeUsageReports reports_;
+  test::FakeServiceManager serviceManager_;
+  PlugInServices services_;
+  std::shared_ptr<Delegate> delegate_ = std::make_shared<Delegate>();
+  std::shared_ptr<DRDatabase> db_;
+};
+
+TEST_F(DatabaseTest, LooksUpEachPlugInOnceAndRetriesWhatCannotBeBuilt) {
+  RegistryEntryPtr good = Add("good", Info("com.example.good"));
+  RegistryEntryPtr unsandboxed = Add("open", Info("com.example.open"), Value());
+  ASSERT_TRUE(good && unsandboxed);
+  ScopedLogCapture log;
+
+  DRDPlugInPtr first = db_->findPlugIn(good->uuid());
+  ASSERT_TRUE(first);
+  EXPECT_EQ(db_->findPlugIn(good->uuid()), first);
+  EXPECT_EQ(db_->findPlugInAtPath(good->url()), first);
+  EXPECT_EQ(db_->plugInForProxy(good), first);
+
+  // A plug-in the daemon refuses is never cached: each lookup tries again.
+  EXPECT_FALSE(db_->findPlugIn(unsandboxed->uuid()));
+  EXPECT_FALSE(db_->findPlugIn(unsandboxed->uuid()));
+  EXPECT_FALSE(db_->cachedPlugIn(unsandboxed->uuid()));
+
+  auto all = db_->findPlugIns(Value());
+  ASSERT_TRUE(all.has_value());
+  ASSERT_EQ(all->size(), 1u);
+  EXPECT_EQ(all->front(), first);
+
+  const Uuid unknown = Uuid::random();
+  log.clear();
+  EXPECT_FALSE(db_->findPlugIn(unknown));
+  EXPECT_FALSE(db_->findPlugIn(unknown));
+  EXPECT_FALSE(db_->findPlugInAtPath(folder_ / "nowhere.appex"));
+  const auto lines = log.lines();
+  ASSERT_EQ(lines.size(), 3u);
+  EXPECT_EQ(lines[0], "Registrar cannot find plug-in with UUID:" + unknown.string());
+  EXPECT_EQ(lines[1], lines[0]);
+  EXPECT_EQ(lines[2], "Registrar cannot find plug-in at path:" + (folder_ / "nowhere.appex"));
+}
+
+TEST_F(DatabaseTest, RegistryRefusalsAreErrorsOfCodeTwo) {
+  std::optional<Error> add = db_->addPlugIn(folder_ / "missing.appex");
+  ASSERT_TRUE(add);
+  EXPECT_EQ(add->domain(), "Dromon");
+  EXPECT_EQ(add->code(), 2);
+  EXPECT_EQ(add->localizedDescription(), "Registrar failed to register the plug-in");
+  std::optional<Error> remove = db_->removePlugIn(folder_ / "missing.appex");
+  ASSERT_TRUE(remove);
+  EXPECT_EQ(remove->localizedDescription(), "Registrar failed to deregister the plug-in");
+}
+
+TEST_F(DatabaseTest, AutoElectsAtFirstLookupUnlessTheUserChose) {
+  const Value autoElect = Value{{"com.corvel.security.app-sandbox", true},
+                                {"com.corvel.developer.auto-elect-plugin", true}};
+  const struct {
+    const char* name;
+    Value stored;  // the annotation before the first lookup
+    int64_t election;
+    bool reported;
+  } rows[] = {
+      {"fresh", Value(), 1, true},
+      {"zero", Value{{"election", 0}, {"extension", Value{{"k", "v"}}}}, 1, true},
+      {"declined", Value{{"election", -1}}, -1, false},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    RegistryEntryPtr entry = Add(row.name, Info(std::string("com.example.") + row.name), autoElect);
+    ASSERT_TRUE(entry);
+    if (row.stored.isPresent()) {
+      // Store through a record of the same identifier that is not cached.
+      DRDPlugInPtr probe = DRDPlugIn::initWithRGData(entry, services_);
+      ASSERT_TRUE(probe);
+      db_->setAnnotationForPlugIn(row.stored, *probe);
+    }
+    const size_t posted = notifications_.posted().size();
+    const size_t elections = ElectionReports();
+    DRDPlugInPtr record = db_->findPlugIn(entry->uuid());
+    ASSERT_TRUE(record);
+    Value annotation = db_->annotationForPlugIn(*record);
+    EXPECT_EQ(annotation["election"].intValue(), row.election);
+    if (row.stored.has("extension")) {
+      EXPECT_EQ(annotation["extension"], row.stored["extension"]);
+    }
+    // An automatic election posts no change notification.
+    EXPECT_EQ(notifications_.posted().size(), posted);
+    EXPECT_EQ(ElectionReports(), elections + (row.reported ? 1 : 0));
+  }
+}
+
+TEST_F(DatabaseTest, EveryAnnotationWritePostsTheChangeNotification) {
+  RegistryEntryPtr entry = Add("a", Info("com.example.a"));
+  DRDPlugInPtr record = db_->findPlugIn(entry->uuid());
+  ASSERT_TRUE(record);
+  const Value annotation = Value{{"extension", Value{{"x", 1}}}};
+  EXPECT_FALSE(db_->setAnnotationForPlugIn(annotation, *record));
+  EXPECT_FALSE(db_->setAnnotationForPlugIn(annotation, *record));  // unchanged: posted anyway
+  EXPECT_EQ(notifications_.posted(),
+            (std::vector<std::string>(2, "com.corvel.dromon.annotation-change")));
+  EXPECT_EQ(db_->annotationForPlugIn(*record), annotation);
+
+  // The table survives a new database over the same file.
+  DatabaseOptions options;
+  options.registry = registry_.get();
+  options.plugInServices.serviceManager = &serviceManager_;
+  auto reopened = DRDatabase::initWithDatabase(folder_ / "Annotations", options);
+  EXPECT_EQ(reopened->annotationForPlugIn(*record), annotation);
+}
+
+TEST_F(DatabaseTest, InstallAndUninstallEventsLogReportAndEvict) {
+  ScopedLogCapture log;
+  RegistryEntryPtr entry = Add("ev", Info("com.example.ev"));
+  ASSERT_TRUE(entry);
+  ASSERT_TRUE(WaitFor(log, "INSTALLED:com.example.ev com.example.ev(3) " + entry->uuid().string() +
+                               " " + entry->url()));
+  DRDPlugInPtr record = db_->findPlugIn(entry->uuid());
+  ASSERT_TRUE(record);
+
+  // A development build is logged but not reported.
+  std::string devPath =
+      MakeBundle(folder_ / "Build/Products/dev.appex", Info("com.example.dev"), kSandboxed);
+  ASSERT_FALSE(db_->addPlugIn(devPath));
+  ASSERT_TRUE(WaitFor(log, "INSTALLED:com.example.dev"));
+
+  ASSERT_FALSE(db_->removePlugIn(entry->url()));
+  ASSERT_TRUE(WaitFor(log, "UNINSTALLED:com.example.ev com.example.ev(3) " +
+                               entry->uuid().string() + " " + entry->url()));
+  for (int i = 0; i < 300 && delegate_->removed.empty(); ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_EQ(delegate_->removed, std::vector<std::string>{"com.example.ev"});
+  EXPECT_FALSE(db_->cachedPlugIn(entry->uuid()));
+  EXPECT_EQ(ReportActions(), (std::vector<std::string>{"Installed", "Uninstalled"}));
+  EXPECT_EQ(reports_.reports().front().keys[1].second, "com.example.ev-3");
+  EXPECT_EQ(reports_.reports().back().keys[4].second, "Point");
+}
+
+TEST_F(DatabaseTest, ApplicationsAnswerTheirPlugInsOrNone) {
+  const std::string app = folder_ / "Host.app";
+  MakeBundle(app, Value{{"BNBundleIdentifier", "com.example.host"}});
+  for (const char* name : {"one", "two"}) {
+    std::string path = MakeBundle(app + "/Contents/PlugIns/" + name + ".appex",
+                                  Info(std::string("com.example.") + name), kSandboxed);
+    ASSERT_FALSE(db_->addPlugIn(path));
+  }
+  auto within = db_->plugInsWithinApplication(app);
+  ASSERT_TRUE(within.has_value());
+  ASSERT_EQ(within->size(), 2u);
+  EXPECT_EQ((*within)[0]->containingPath(), app);
+  EXPECT_FALSE(db_->plugInsWithinApplication(folder_ / "Other.app").has_value());
+}
+
+}  // namespace
+}  // namespace dr
