@@ -54,6 +54,9 @@ inline constexpr const char* kHybridFormat = "hybrid";
 inline constexpr const char* kLastResortVersion = "1";
 inline constexpr const char* kDataProtocol = "#Data";
 inline constexpr const char* kAppExtensionSuffix = ".appex";
+// Names a folder searched for SDK dictionaries before the registered ones;
+// passed on to every plug-in service the daemon enables.
+inline constexpr const char* kTestSdkEnvironmentVariable = "DRTEST_SDK";
 
 // The form of a plug-in record.
 inline constexpr const char* kFormHubProtocolVersionKey = "hubProtocolVersion";

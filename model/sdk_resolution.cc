@@ -10,12 +10,6 @@
 #include "platform/pdoc.h"
 
 namespace dr {
-namespace {
-
-constexpr const char* kTestSdkVariable = "DRTEST_SDK";
-
-}  // namespace
-
 void DRPlugInCore::resolveSDK(ServiceManager* serviceManager) {
   Value sdk = sdkSpec();
   if (sdk.isPresent()) {
@@ -34,7 +28,7 @@ void DRPlugInCore::resolveSDK(ServiceManager* serviceManager) {
 }
 
 Value DRPlugInCore::readSDKDictionary(const std::string& sdk, ServiceManager* serviceManager) {
-  const char* testFolder = std::getenv(kTestSdkVariable);
+  const char* testFolder = std::getenv(kTestSdkEnvironmentVariable);
   // The file is named exactly as the identifier; an identifier that is not a
   // plain file name cannot name one in that folder. An empty value counts as
   // unset rather than as the root folder.

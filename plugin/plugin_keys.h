@@ -25,7 +25,5 @@ inline constexpr const char* kIPCServiceKey = "IPCService";
 inline constexpr const char* kEnvironmentVariablesKey = "EnvironmentVariables";
 inline constexpr const char* kBNBundlePackageTypeKey = "BNBundlePackageType";
 inline constexpr const char* kIPCServicePackageType = "IPC!";
-// Passed on from the daemon's environment to every enabled plug-in service.
-inline constexpr const char* kTestSdkEnvironmentVariable = "DRTEST_SDK";
 
 }  // namespace dr
