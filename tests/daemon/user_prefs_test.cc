@@ -36,32 +36,23 @@ class UserPrefsTest : public ::testing::Test {
 
 const Value kRules = Value(Array{Value{{"UXExtensionIdentifier", Value("com.example.hidden")}}});
 
-TEST_F(UserPrefsTest, ValueWrittenByAnotherProcessIsSeenAtTheNextRead) {
-  EXPECT_TRUE(prefs_.exclusions().isAbsent());  // no file yet
+TEST_F(UserPrefsTest, OnlyThisHostsFileIsReadAndChangesAreSeenAtTheNextRead) {
+  // Preferences for any host, or for another host, are not this host's.
+  for (const char* name :
+       {"/com.corvel.dromon.userprefs.pdoc", "/ByHost/com.corvel.dromon.userprefs.ffff.pdoc"}) {
+    ASSERT_TRUE(pdoc::WriteFile(options_.directory + name, Value{{"exclusions", kRules}}).ok());
+  }
+  EXPECT_TRUE(prefs_.exclusions().isAbsent());
   pid_t pid = ::fork();
   ASSERT_GE(pid, 0);
-  if (pid == 0) {
-    bool ok = pdoc::WriteFile(hostFile(), Value{{"exclusions", kRules}}).ok();
-    ::_exit(ok ? 0 : 1);
-  }
+  if (pid == 0) ::_exit(pdoc::WriteFile(hostFile(), Value{{"exclusions", kRules}}).ok() ? 0 : 1);
   int status;
   ASSERT_EQ(::waitpid(pid, &status, 0), pid);
   ASSERT_EQ(WEXITSTATUS(status), 0);
   EXPECT_EQ(prefs_.exclusions(), kRules);
-
   // Replaced by something that is not an array: answered as it is.
   ASSERT_TRUE(pdoc::WriteFile(hostFile(), Value{{"exclusions", Value("odd")}}).ok());
   EXPECT_EQ(prefs_.exclusions(), Value("odd"));
-}
-
-TEST_F(UserPrefsTest, PreferencesForAnyHostOrAnotherHostAreNotRead) {
-  ASSERT_TRUE(pdoc::WriteFile(options_.directory + "/com.corvel.dromon.userprefs.pdoc",
-                              Value{{"exclusions", kRules}})
-                  .ok());
-  ASSERT_TRUE(pdoc::WriteFile(options_.directory + "/ByHost/com.corvel.dromon.userprefs.ffff.pdoc",
-                              Value{{"exclusions", kRules}})
-                  .ok());
-  EXPECT_TRUE(prefs_.exclusions().isAbsent());
 }
 
 TEST_F(UserPrefsTest, BrokenFileReadsAsNoExclusionsAndIsLoggedOnce) {
@@ -78,20 +69,18 @@ TEST_F(UserPrefsTest, BrokenFileReadsAsNoExclusionsAndIsLoggedOnce) {
 }
 
 TEST(PreferencesOptionsTest, LocationsComeFromTheEnvironment) {
-  auto env = [](const char* name) -> const char* {
-    std::string n = name;
-    if (n == "XDG_CONFIG_HOME") return "/cfg";
-    if (n == "HOME") return "/home/u";
-    return nullptr;
+  const char* xdg = "/cfg";
+  auto env = [&](const char* name) -> const char* {
+    return std::string(name) == "HOME"              ? "/home/u"
+           : std::string(name) == "XDG_CONFIG_HOME" ? xdg
+                                                    : nullptr;
   };
   PreferencesOptions options = PreferencesOptionsFromEnvironment(env);
   EXPECT_EQ(options.directory, "/cfg/dromon");
   EXPECT_FALSE(options.hostId.empty());
   EXPECT_EQ(options.hostId.find_first_of(" \n/"), std::string::npos);
-  auto noXdg = [](const char* name) -> const char* {
-    return std::string(name) == "HOME" ? "/home/u" : nullptr;
-  };
-  EXPECT_EQ(PreferencesOptionsFromEnvironment(noXdg).directory, "/home/u/.config/dromon");
+  xdg = nullptr;
+  EXPECT_EQ(PreferencesOptionsFromEnvironment(env).directory, "/home/u/.config/dromon");
 }
 
 }  // namespace

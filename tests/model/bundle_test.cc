@@ -34,26 +34,26 @@ TEST(BundleTest, PathsOfBundlesOnDisk) {
     Opt path, executable, identifier, plugIns;
     bool hasInfo;
   };
+  const Opt exe = app + "/Contents/Exec/Host", id = "com.example.host";
+  const Opt plugIns = app + "/Contents/PlugIns";
+  auto self = [](const std::string& p) { return p + "/PlugIns"; };
   const Row rows[] = {
-      {"app by path", DRBundle::initWithPath(app), app, app + "/Contents/Exec/Host",
-       "com.example.host", app + "/Contents/PlugIns", true},
-      {"app by path with a trailing slash", DRBundle::initWithURL(app + "/"), app,
-       app + "/Contents/Exec/Host", "com.example.host", app + "/Contents/PlugIns", true},
-      {"app by executable", DRBundle::initWithExecutablePath(app + "/Contents/Exec/Host"), app,
-       app + "/Contents/Exec/Host", "com.example.host", app + "/Contents/PlugIns", true},
+      {"app by path", DRBundle::initWithPath(app), app, exe, id, plugIns, true},
+      {"app by path with a trailing slash", DRBundle::initWithURL(app + "/"), app, exe, id, plugIns,
+       true},
+      {"app by executable", DRBundle::initWithExecutablePath(*exe), app, exe, id, plugIns, true},
       // Without an executable the bundle stands for it, and is its own support folder.
-      {"bundle without executable", DRBundle::initWithPath(bare), bare, bare, nullopt,
-       bare + "/PlugIns", true},
-      {"bundle without information", DRBundle::initWithPath(noInfo), noInfo, noInfo, nullopt,
-       noInfo + "/PlugIns", false},
+      {"no executable", DRBundle::initWithPath(bare), bare, bare, nullopt, self(bare), true},
+      {"no information", DRBundle::initWithPath(noInfo), noInfo, noInfo, nullopt, self(noInfo),
+       false},
       {"unreadable information", DRBundle::initWithPath(broken), broken, broken, nullopt,
-       broken + "/PlugIns", false},
+       self(broken), false},
       {"information not a dictionary", DRBundle::initWithPath(listInfo), listInfo, listInfo,
-       nullopt, listInfo + "/PlugIns", false},
+       nullopt, self(listInfo), false},
       {"executable name leaving Exec", DRBundle::initWithPath(escape), escape, escape, nullopt,
-       escape + "/PlugIns", true},
+       self(escape), true},
       {"free-standing executable", DRBundle::initWithExecutableURL(tool), tool, tool, nullopt,
-       tool + "/PlugIns", false},
+       self(tool), false},
       {"nothing there", DRBundle::initWithPath(dir.path("missing")), nullopt, nullopt, nullopt,
        nullopt, false},
       {"executable that does not exist", DRBundle::initWithExecutablePath(dir.path("nope")),

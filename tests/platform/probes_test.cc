@@ -66,8 +66,6 @@ TEST(ProbesTest, ReadelfListsAllTenProbesWithSemaphoresAndArgumentSizes) {
   probes::ClientNew(pid);
   probes::ClientDone(pid);
   probes::Request(pid, nullptr);
-  if (probes::RequestInputEnabled()) probes::RequestInput(pid, "{ }");
-  if (probes::RequestOutputEnabled()) probes::RequestOutput(pid, "{ }");
   probes::RequestInput(pid, "in");
   probes::RequestOutput(pid, "out");
   probes::DbLoad("Dromon", 7);
@@ -93,8 +91,7 @@ TEST(ProbesTest, ReadelfListsAllTenProbesWithSemaphoresAndArgumentSizes) {
     SCOPED_TRACE(e.name);
     auto it = notes.find(e.name);
     ASSERT_NE(it, notes.end()) << "no note for drd:" << e.name;
-    EXPECT_NE(it->second.semaphore, "");
-    EXPECT_NE(it->second.semaphore, "0x0000000000000000");
+    EXPECT_NE(it->second.semaphore.find_first_of("123456789abcdef", 2), std::string::npos);
     EXPECT_EQ(Sizes(it->second.arguments), e.sizes) << it->second.arguments;
   }
   EXPECT_EQ(notes.size(), std::size(expected));

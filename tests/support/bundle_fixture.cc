@@ -5,9 +5,9 @@
 #include <sys/stat.h>
 
 #include <filesystem>
-#include <fstream>
 
 #include "platform/pdoc.h"
+#include "tests/support/registry_bundles.h"
 
 namespace dr::test {
 
@@ -28,22 +28,19 @@ std::string BundleFixture::path(const std::string& relative) const {
 }
 
 std::string BundleFixture::makeFolder(const std::string& relative) {
-  std::string p = path(relative);
-  std::filesystem::create_directories(p);
-  return p;
+  std::filesystem::create_directories(path(relative));
+  return path(relative);
 }
 
 std::string BundleFixture::writeFile(const std::string& relative, const std::string& bytes) {
-  std::string p = path(relative);
-  std::filesystem::create_directories(std::filesystem::path(p).parent_path());
-  std::ofstream(p, std::ios::binary | std::ios::trunc) << bytes;
-  return p;
+  registry_test::WriteBytes(path(relative), bytes);
+  return path(relative);
 }
 
 std::string BundleFixture::writePdoc(const std::string& relative, const Value& value) {
   Result<std::string> xml = pdoc::WriteXml(value);
   EXPECT_TRUE(xml.ok()) << relative;
-  return writeFile(relative, xml.ok() ? *xml : std::string());
+  return writeFile(relative, xml.value_or(""));
 }
 
 std::string BundleFixture::makeBundle(const std::string& relative, const Value& info,
@@ -51,8 +48,7 @@ std::string BundleFixture::makeBundle(const std::string& relative, const Value& 
   std::string bundle = makeFolder(relative);
   if (info.isPresent()) writePdoc(relative + "/Contents/Info.pdoc", info);
   if (executable) {
-    std::string exe = writeFile(relative + "/Contents/Exec/" + *executable, "#!/bin/sh\n");
-    ::chmod(exe.c_str(), 0755);
+    ::chmod(writeFile(relative + "/Contents/Exec/" + *executable, "#!/bin/sh\n").c_str(), 0755);
   }
   return bundle;
 }

@@ -1,10 +1,5 @@
-// Real bundles in a temporary folder, for tests of the plug-in model.
-//
-// A BundleFixture makes a fresh folder with mkdtemp and removes it with
-// everything in it when destroyed. makeBundle lays out
-// <folder>/<relative>/Contents/Info.pdoc and, when asked, an executable in
-// Contents/Exec/. ScopedEnv sets or clears an environment variable for the
-// life of the object and restores it afterwards.
+// Real bundles in a fresh temporary folder (removed when destroyed), and
+// environment variables set for the life of a test, for the plug-in model.
 #pragma once
 
 #include <optional>

@@ -10,8 +10,6 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <vector>
 
 extern char** environ;
 
@@ -19,14 +17,11 @@ namespace dr::testing {
 
 TempFolder::TempFolder() {
   const char* tmp = std::getenv("TMPDIR");
-  std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/drd-test-XXXXXX";
-  std::vector<char> buf(tmpl.begin(), tmpl.end());
-  buf.push_back('\0');
-  if (::mkdtemp(buf.data()) == nullptr) {
+  path_ = std::string(tmp && *tmp ? tmp : "/tmp") + "/drd-test-XXXXXX";
+  if (::mkdtemp(path_.data()) == nullptr) {
     std::perror("mkdtemp");
     std::abort();
   }
-  path_ = buf.data();
 }
 
 TempFolder::~TempFolder() {

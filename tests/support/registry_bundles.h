@@ -18,9 +18,7 @@ class TempFolder {
   ~TempFolder();
   TempFolder(const TempFolder&) = delete;
   TempFolder& operator=(const TempFolder&) = delete;
-  // The folder's canonical path.
-  const std::string& path() const { return path_; }
-  // `relative` below the folder.
+  const std::string& path() const { return path_; }  // canonical
   std::string operator/(std::string_view relative) const;
 
  private:
