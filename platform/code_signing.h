@@ -16,6 +16,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "core/status.h"
 #include "core/value.h"
@@ -35,6 +36,23 @@ class SigningTask {
   // does not have it. An error when the entitlements could not be read; the
   // caller logs it and treats the entitlement as absent.
   virtual Result<Value> entitlementValue(std::string_view key) const = 0;
+};
+
+// A task over entitlements read once, when it is made (or the error that
+// reading them gave).
+class ReadSigningTask final : public SigningTask {
+ public:
+  ReadSigningTask(pid_t pid, Result<Value> entitlements)
+      : pid_(pid), entitlements_(std::move(entitlements)) {}
+  pid_t pid() const override { return pid_; }
+  Result<Value> entitlementValue(std::string_view key) const override {
+    if (!entitlements_.ok()) return entitlements_.error();
+    return (*entitlements_)[key];
+  }
+
+ private:
+  pid_t pid_;
+  Result<Value> entitlements_;
 };
 
 class CodeSigning {

@@ -14,30 +14,14 @@ constexpr const char* kEntitlementsFile = "/Contents/Entitlements.pdoc";
 // rather than read.
 constexpr size_t kMaxEntitlementsBytes = size_t{1} << 20;
 
-class Task final : public SigningTask {
- public:
-  Task(pid_t pid, Result<Value> entitlements) : pid_(pid), entitlements_(std::move(entitlements)) {}
-
-  pid_t pid() const override { return pid_; }
-
-  Result<Value> entitlementValue(std::string_view key) const override {
-    if (!entitlements_.ok()) return entitlements_.error();
-    return (*entitlements_)[key];
-  }
-
- private:
-  pid_t pid_;
-  Result<Value> entitlements_;
-};
-
 class LinuxCodeSigning final : public CodeSigning {
  public:
   LinuxCodeSigning(ProcessInfo* processes, FileSystem* fs) : processes_(processes), fs_(fs) {}
 
   std::shared_ptr<const SigningTask> taskForPid(pid_t pid) override {
     Result<std::string> exe = processes_->executablePath(pid);
-    if (!exe.ok()) return std::make_shared<Task>(pid, exe.error());
-    return std::make_shared<Task>(pid, entitlementsForExecutable(*exe));
+    if (!exe.ok()) return std::make_shared<ReadSigningTask>(pid, exe.error());
+    return std::make_shared<ReadSigningTask>(pid, entitlementsForExecutable(*exe));
   }
 
   Result<Value> entitlementsForExecutable(const std::string& executablePath) override {

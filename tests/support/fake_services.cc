@@ -3,31 +3,14 @@
 #include <cerrno>
 
 namespace dr::testing {
-namespace {
-
-class FakeTask final : public SigningTask {
- public:
-  FakeTask(pid_t pid, Result<Value> entitlements)
-      : pid_(pid), entitlements_(std::move(entitlements)) {}
-  pid_t pid() const override { return pid_; }
-  Result<Value> entitlementValue(std::string_view key) const override {
-    if (!entitlements_.ok()) return entitlements_.error();
-    return (*entitlements_)[key];
-  }
-
- private:
-  pid_t pid_;
-  Result<Value> entitlements_;
-};
-
-}  // namespace
+namespace {}  // namespace
 
 std::shared_ptr<const SigningTask> FakeCodeSigning::taskForPid(pid_t pid) {
   if (failingPids.contains(pid)) {
-    return std::make_shared<FakeTask>(pid, PosixError(ESRCH, "fake entitlements"));
+    return std::make_shared<ReadSigningTask>(pid, PosixError(ESRCH, "fake entitlements"));
   }
   auto it = entitlements.find(pid);
-  return std::make_shared<FakeTask>(
+  return std::make_shared<ReadSigningTask>(
       pid, it == entitlements.end() ? Value::EmptyDictionary() : it->second);
 }
 
