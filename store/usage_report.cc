@@ -37,6 +37,8 @@ std::string_view UsageActionWord(int action) {
 
 void sendUsageReport(UsageReports* sink, const Value& identifier, const Value& version,
                      const Value& extensionPoint, int action) {
+  // No sink: reports are switched off.
+  if (sink == nullptr) return;
   if (identifier.isAbsent() || version.isAbsent() || extensionPoint.isAbsent()) return;
   std::string id = identifier.description();
   bool firstParty = id.starts_with(kFirstPartyPrefix);

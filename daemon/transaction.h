@@ -1,0 +1,101 @@
+// Transaction: one request of one client and its one reply.
+//
+// Made when the message arrives and run on the server's service queue by
+// dispatch, which checks the envelope and runs the request's handler from the
+// request table. Every request ends in exactly one reply (done, or a failure
+// operation), except that a request of a client that is gone, or a message
+// that asked for no reply, gets none. Failures are replies: "errorcode" and
+// "error" are added to the reply, next to whatever the handler already put
+// there. Holds its client strongly. REQUIRES: used on the service queue only.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "core/status.h"
+#include "core/value.h"
+#include "platform/message_service.h"
+#include "plugin/plugin.h"
+
+namespace dr {
+
+class DRDIpcClient;
+class DRDServer;
+
+// The codes of "errorcode".
+inline constexpr uint64_t kErrorRegistration = 2;  // the registry refused the plug-in
+inline constexpr uint64_t kErrorMalformed = 4;     // bad request, unknown name or UUID, ...
+inline constexpr uint64_t kErrorVersion = 7;       // unsupported protocol version
+inline constexpr uint64_t kErrorBadPath = 9;       // relative, unresolvable or empty path
+inline constexpr uint64_t kErrorNotPermitted = 11;
+inline constexpr uint64_t kErrorBusy = 14;
+
+// The one protocol version served.
+inline constexpr uint64_t kProtocolVersion = 2;
+
+class Transaction {
+ public:
+  // Called per path: the canonical path and true, or the path as given and
+  // false when it cannot be resolved. False stops the walk; it must have
+  // sent an error reply.
+  using PathOperation = std::function<bool(const std::string& path, bool resolved)>;
+  // Called per plug-in; false stops the walk and must have replied.
+  using PlugInOperation = std::function<bool(const DRDPlugInPtr& plugIn)>;
+
+  static std::shared_ptr<Transaction> initWithRequestForClient(
+      PeerMessage request, std::shared_ptr<DRDIpcClient> client);
+
+  // Checks the version and the client, then runs the handler of the request.
+  void dispatch();
+
+  // Walks "paths"; true when every path was handled.
+  bool marshalPaths(const PathOperation& operation);
+  // marshalPaths, then the success reply when it ran to the end.
+  bool processPaths(const PathOperation& operation);
+  // Walks "uuids" as installed plug-ins; true when every one was handled.
+  // Sends no success reply.
+  bool processUuidList(const PlugInOperation& operation);
+
+  // Sends the reply.
+  void done();
+  // Adds "errorcode" and "error" to the reply, then sends it.
+  void failMessage(uint64_t code, std::string_view message);
+  // An error of drd's own domain keeps its code and description; any other
+  // is sent with `code` and its localized description.
+  void failError(uint64_t code, const Error& error);
+
+  const std::shared_ptr<DRDIpcClient>& client() const { return client_; }
+  const Value& request() const { return request_.body; }
+  const Value& reply() const { return reply_; }
+  // Adds `key` to the reply.
+  void setReplyValue(std::string_view key, const Value& value);
+  DRDServer& server() const;
+  std::shared_ptr<PeerConnection> connection() const;
+
+  // The value under `key` when it is an array (a dictionary), else absent.
+  static Value ArrayValue(const Value& message, std::string_view key);
+  static Value DictionaryValue(const Value& message, std::string_view key);
+
+  // Request handlers, one per entry of the request table.
+  void addPlugIns();
+  void removePlugIns();
+  void bulkPlugIns();
+  void matchPlugIns();
+  void readyPlugIns();
+  void accessPlugIns();
+  void annotatePlugIns();
+  void lockDownPlugIns();
+
+ private:
+  Transaction(PeerMessage request, std::shared_ptr<DRDIpcClient> client);
+
+  const std::shared_ptr<DRDIpcClient> client_;
+  const PeerMessage request_;
+  Value reply_;  // a dictionary
+  bool replied_ = false;
+};
+
+}  // namespace dr

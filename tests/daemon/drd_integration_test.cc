@@ -1,0 +1,192 @@
+// drd end to end: the real binary in a fresh temporary environment, spoken to
+// over its real socket.
+#include <gtest/gtest.h>
+#include <signal.h>
+
+#include <string>
+#include <vector>
+
+#include "platform/drm1.h"
+#include "tests/support/drm1_peer.h"
+#include "tests/support/process_fixtures.h"
+
+namespace dr {
+namespace {
+
+using testing::DrdProcess;
+using testing::Drm1Peer;
+using testing::TempFolder;
+
+constexpr char kUsage[] = "Usage: drd [-S servicename] [-v]\n";
+
+class DrdTest : public ::testing::Test {
+ protected:
+  // Starts drd with `arguments` and waits until it serves `serviceName`.
+  DrdProcess& Start(std::vector<std::string> arguments = {},
+                    const std::string& serviceName = "com.corvel.dromon.drd") {
+    drd_ = std::make_unique<DrdProcess>(root_.path(), std::move(arguments));
+    EXPECT_TRUE(drd_->waitUntilServing(serviceName)) << drd_->standardError();
+    return *drd_;
+  }
+  // Every test that started drd ends it as the service manager would: the
+  // daemon must stop cleanly.
+  void TearDown() override {
+    if (!drd_) return;
+    ASSERT_TRUE(drd_->signal(SIGTERM));
+    EXPECT_EQ(drd_->waitForExit(), 0) << drd_->standardError();
+  }
+
+  TempFolder root_;
+  std::unique_ptr<DrdProcess> drd_;
+};
+
+TEST_F(DrdTest, BadCommandLinesPrintUsageAndExit2) {
+  const std::vector<std::vector<std::string>> rows = {
+      {"-x"}, {"-d"}, {"-S"}, {"stray"}, {"-v", "stray"}, {"-d", "/tmp/a", "-v", "-q"},
+  };
+  for (const auto& arguments : rows) {
+    DrdProcess drd(root_.path(), arguments);
+    EXPECT_EQ(drd.waitForExit(), 2) << arguments[0];
+    EXPECT_EQ(drd.standardError(), kUsage) << arguments[0];
+  }
+}
+
+TEST_F(DrdTest, SecondDaemonOnTheSameNameExits1) {
+  Start();
+  DrdProcess second(root_.path(), {});
+  EXPECT_EQ(second.waitForExit(), 1);
+  EXPECT_NE(second.standardError().find("unable to construct server\n"), std::string::npos)
+      << second.standardError();
+  Drm1Peer peer(drd_->socketPath());
+  EXPECT_TRUE(peer.connected()) << "the first daemon must keep serving";
+}
+
+TEST_F(DrdTest, LastServiceNameCounts) {
+  Start({"-S", "first.name", "-v", "-S", "second.name"}, "second.name");
+  EXPECT_FALSE(Drm1Peer(drd_->socketPath("first.name")).connected());
+}
+
+// Pipelined on one connection, every request gets one reply bound to its
+// serial, in order, with the envelope's error.
+TEST_F(DrdTest, EachRequestGetsOneBoundReply) {
+  struct Row {
+    Value body;
+    uint64_t code;
+    std::string error;
+  };
+  const char* kUnrecognized = "unrecognized request";
+  std::vector<Row> rows = {
+      {Value{{"request", "match"}}, 7, "unsupported protocol version 0 (need 2)"},
+      {Value{{"request", "match"}, {"version", uint64_t{3}}}, 7,
+       "unsupported protocol version 3 (need 2)"},
+      {Value{{"request", "match"}, {"version", "2"}}, 7, "unsupported protocol version 0 (need 2)"},
+      {Value{{"version", uint64_t{2}}}, 4, "invalid request format (missing type)"},
+      {Value{{"request", uint64_t{1}}, {"version", uint64_t{2}}}, 4,
+       "invalid request format (missing type)"},
+      {Value{{"request", "Match"}, {"version", uint64_t{2}}}, 4, kUnrecognized},
+      {Value{{"request", "frobnicate"}, {"version", uint64_t{2}}}, 4, kUnrecognized},
+  };
+  for (const char* name :
+       {"add", "remove", "bulk", "match", "ready", "access", "annotate", "lock"}) {
+    rows.push_back({Value{{"request", name}, {"version", uint64_t{2}}}, 4, kUnrecognized});
+  }
+  Start();
+  Drm1Peer peer(drd_->socketPath());
+  ASSERT_TRUE(peer.connected());
+  // A message that wants no reply is processed without one.
+  ASSERT_TRUE(peer.send(1, Value{{"request", "match"}, {"version", uint64_t{2}}}, false));
+  for (size_t i = 0; i < rows.size(); ++i) ASSERT_TRUE(peer.send(10 + i, rows[i].body));
+  for (size_t i = 0; i < rows.size(); ++i) {
+    std::optional<drm1::Frame> reply = peer.receive();
+    ASSERT_TRUE(reply) << "no reply to row " << i;
+    EXPECT_TRUE(reply->header.isReply());
+    EXPECT_EQ(reply->header.replyTo, 10 + i);
+    EXPECT_EQ(reply->body["errorcode"], Value(rows[i].code)) << i;
+    EXPECT_EQ(reply->body["error"], Value(rows[i].error)) << i;
+    EXPECT_EQ(reply->body.size(), 2u) << reply->body.description();
+  }
+  EXPECT_FALSE(peer.receive(std::chrono::milliseconds(200))) << "one reply too many";
+}
+
+// Each kind of broken frame closes its own connection only; another client
+// is served before and after.
+TEST_F(DrdTest, BrokenFrameClosesOnlyItsConnection) {
+  const std::string good =
+      *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Value{{"request", "match"}});
+  auto withByte = [&](size_t offset, char byte) {
+    std::string frame = good;
+    frame[offset] = byte;
+    return frame;
+  };
+  auto withLength = [&](uint32_t length) {
+    std::string frame = good;
+    for (int i = 0; i < 4; ++i) frame[4 + i] = static_cast<char>((length >> (8 * i)) & 0xFF);
+    return frame;
+  };
+  const std::string oversize = withLength(drm1::kMaxBodySize + 1);
+  const std::vector<std::pair<const char*, std::string>> rows = {
+      {"bad magic", withByte(0, 'X')},
+      {"unknown flag", withByte(24, 0x05)},
+      {"reply flag from a client", withByte(24, 0x03)},
+      {"body too long", oversize},
+      {"unknown tag", withByte(drm1::kHeaderSize, 0x0C)},
+      {"top level not a dictionary", withByte(drm1::kHeaderSize, 0x0A)},
+      {"trailing bytes", withLength(static_cast<uint32_t>(good.size() - drm1::kHeaderSize + 1)) +
+                             std::string(1, '\0')},
+      {"serial zero", withByte(8, 0)},
+  };
+  Start();
+  Drm1Peer bystander(drd_->socketPath());
+  ASSERT_TRUE(bystander.connected());
+  uint64_t serial = 1;
+  for (const auto& [what, bytes] : rows) {
+    Drm1Peer peer(drd_->socketPath());
+    ASSERT_TRUE(peer.connected());
+    peer.sendRaw(bytes);
+    EXPECT_TRUE(peer.sawEndOfStream()) << what;
+    ASSERT_TRUE(bystander.send(serial, Value{{"version", uint64_t{2}}})) << what;
+    std::optional<drm1::Frame> reply = bystander.receive();
+    ASSERT_TRUE(reply) << what;
+    EXPECT_EQ(reply->header.replyTo, serial++) << what;
+  }
+}
+
+// A client that hangs up with many requests still queued gets nothing and
+// breaks nothing.
+TEST_F(DrdTest, ClientGoneWithQueuedRequestsLeavesDaemonServing) {
+  Start({"-v"});
+  {
+    Drm1Peer leaver(drd_->socketPath());
+    ASSERT_TRUE(leaver.connected());
+    for (uint64_t serial = 1; serial <= 500; ++serial) {
+      leaver.send(serial, Value{{"request", "match"}, {"version", uint64_t{2}}});
+    }
+  }
+  Drm1Peer peer(drd_->socketPath());
+  ASSERT_TRUE(peer.send(7, Value{{"request", "lock"}, {"version", uint64_t{2}}}));
+  std::optional<drm1::Frame> reply = peer.receive();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->header.replyTo, 7u);
+}
+
+// With -v, a client's every thousandth request is counted in the log, and
+// the count includes requests that failed.
+TEST_F(DrdTest, VerboseLogCountsEachThousandRequests) {
+  Start({"-v"});
+  Drm1Peer peer(drd_->socketPath());
+  for (uint64_t serial = 1; serial <= 1001; ++serial) {
+    ASSERT_TRUE(peer.send(serial, Value{{"request", "match"}, {"version", uint64_t{2}}}));
+  }
+  for (uint64_t serial = 1; serial <= 1001; ++serial) ASSERT_TRUE(peer.receive()) << serial;
+  const std::string log = drd_->standardError();
+  const std::string line = "used 1000 requests so far\n";
+  size_t at = log.find(line);
+  ASSERT_NE(at, std::string::npos) << log.substr(0, 2000);
+  EXPECT_EQ(log.find(line, at + 1), std::string::npos);
+  EXPECT_EQ(log.find("used 999 "), std::string::npos);
+  EXPECT_EQ(log.find("used 1001 "), std::string::npos);
+  EXPECT_NE(log.find("request match\n"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace dr

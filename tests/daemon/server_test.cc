@@ -1,0 +1,168 @@
+// The server's own decisions, over fake platform services: which uninstalled
+// plug-ins' removals are logged, how holds block and release plug-ins, and
+// which hosts need the discovery workaround.
+#include "daemon/server.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <thread>
+
+#include "core/log.h"
+#include "daemon/ipc_client.h"
+#include "platform/message_service.h"
+#include "tests/support/fake_service_manager.h"
+#include "tests/support/fake_services.h"
+#include "tests/support/registry_bundles.h"
+#include "tests/support/test_registry.h"
+
+namespace dr {
+namespace {
+
+using namespace std::chrono_literals;
+using registry_test::MakeBundle;
+
+Value Info(const std::string& id) {
+  return Value{
+      {"BNBundleIdentifier", id},
+      {"BNBundleVersion", "3"},
+      {"UXExtension", Value{{"UXExtensionPointIdentifier", "com.example.point"},
+                            {"UXExtensionAttributes", Value{{"UXExtensionIdentifier", id},
+                                                            {"UXExtensionPointName", "Point"}}}}}};
+}
+
+TEST(WorkaroundTest, OlderListedHostsNeedIt) {
+  struct Row {
+    const char* identifier;
+    const char* version;
+    bool needs;
+  };
+  const Row rows[] = {
+      {"com.corvel.Brivane", "10.1.4", true},     {"com.corvel.Brivane", "9.9", true},
+      {"com.corvel.Brivane", "10.2", false},      {"com.corvel.Brivane", "10.10", false},
+      {"com.corvel.Brivane", "10.2.1", false},    {"com.corvel.BrivaneTrial", "10.1", true},
+      {"com.corvel.Quellor", "4.1.9", true},      {"com.corvel.Quellor", "4.2", false},
+      {"com.corvel.vorelapp", "5.1", true},       {"com.corvel.OdelloApp", "10", true},
+      {"com.corvel.brivane", "1.0", false},       {"com.example.other", "1.0", false},
+      {"com.corvel.BrivaneTrialX", "1.0", false},
+  };
+  for (const Row& row : rows) {
+    EXPECT_EQ(Needs17732150Workaround(row.identifier, row.version), row.needs)
+        << row.identifier << " " << row.version;
+  }
+}
+
+class ServerTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    registry_ = test::OpenTestRegistry(folder_.path());
+    ASSERT_TRUE(registry_);
+    ServerOptions options;
+    options.database.registry = registry_.get();
+    options.database.notifications = &notifications_;
+    options.database.usageReports = &reports_;
+    options.database.plugInServices.serviceManager = &serviceManager_;
+    options.socketDirectory = folder_ / "sockets";
+    options.useSocketActivation = false;
+    options.serviceManager = &serviceManager_;
+    options.codeSigning = &codeSigning_;
+    options.preferences = &preferences_;
+    server_ =
+        DRDServer::initForServiceDatabase("com.example.drd", folder_ / "Annotations", options);
+    ASSERT_TRUE(server_);
+  }
+
+  DRDPlugInPtr Add(const std::string& id) {
+    std::string path = MakeBundle(folder_ / (id + ".appex"), Info(id),
+                                  Value{{"com.corvel.security.app-sandbox", true}});
+    EXPECT_FALSE(server_->addPlugIn(path).has_value());
+    return server_->findPlugInAtPath(path);
+  }
+
+  registry_test::TempFolder folder_;
+  std::unique_ptr<Registry> registry_;
+  testing::FakeNotificationCenter notifications_;
+  testing::FakeUsageReports reports_;
+  test::FakeServiceManager serviceManager_;
+  testing::FakeCodeSigning codeSigning_;
+  testing::FakePreferences preferences_;
+  std::shared_ptr<DRDServer> server_;
+};
+
+TEST_F(ServerTest, UninstallStopsInstancesAndLogsOnlyRealFailures) {
+  serviceManager_.removeResults[{"com.example.stopped", "3"}] = 0;
+  serviceManager_.removeResults[{"com.example.refused", "3"}] = 1;
+  std::vector<std::string> paths;
+  for (const char* id : {"com.example.stopped", "com.example.idle", "com.example.refused"}) {
+    ASSERT_TRUE(Add(id));
+    paths.push_back(folder_ / (std::string(id) + ".appex"));
+  }
+  ScopedLogCapture log;
+  for (const std::string& path : paths) ASSERT_FALSE(server_->removePlugIn(path).has_value());
+  bool logged = false;
+  for (int i = 0; i < 300 && !logged; ++i) {
+    server_->mainQueue().sync([] {});
+    logged = log.contains("PLUGIN REMOVAL:");
+    if (!logged) std::this_thread::sleep_for(10ms);
+  }
+  std::this_thread::sleep_for(100ms);
+  server_->mainQueue().sync([] {});
+  std::vector<std::string> removals;
+  for (const std::string& line : log.lines()) {
+    if (line.starts_with("PLUGIN REMOVAL:")) removals.push_back(line);
+  }
+  EXPECT_EQ(removals, std::vector<std::string>{"PLUGIN REMOVAL:com.example.refused RESULT:1"});
+  EXPECT_EQ(serviceManager_.removals.size(), 3u) << "every uninstalled plug-in is stopped";
+}
+
+TEST_F(ServerTest, HoldsBlockUntilEachIsReleased) {
+  DRDPlugInPtr held = Add("com.example.held");
+  DRDPlugInPtr free = Add("com.example.free");
+  ASSERT_TRUE(held && free);
+  // A second record of the same plug-in counts as the same plug-in.
+  DRDPlugInPtr twin = DRDPlugIn::initWithRGData(registry_->entryForUuid(*held->uuid()));
+  ASSERT_TRUE(twin);
+  ASSERT_NE(twin.get(), held.get());
+
+  const int keepAlive = KeepAliveCount();
+  auto first = DRDPlugInHold::initWithPlugInsForClient({held, held}, nullptr);
+  auto second = DRDPlugInHold::initWithPlugInsForClient({twin}, nullptr);
+  auto empty = DRDPlugInHold::initWithPlugInsForClient({}, nullptr);
+  EXPECT_EQ(first->blocked().size(), 1u);
+  const Uuid firstToken = first->uuid(), secondToken = second->uuid(), emptyToken = empty->uuid();
+  server_->addHold(std::move(first));
+  server_->addHold(std::move(second));
+  server_->addHold(std::move(empty));
+  EXPECT_EQ(KeepAliveCount(), keepAlive + 3);
+  EXPECT_EQ(notifications_.posted().size(), 3u);
+
+  struct Step {
+    std::optional<Uuid> release;
+    bool heldAfter;
+    size_t logLines;
+  };
+  const Step steps[] = {
+      {std::nullopt, true, 0}, {firstToken, true, 1},   {firstToken, true, 0},
+      {emptyToken, true, 1},   {secondToken, false, 1}, {Uuid::random(), false, 0},
+  };
+  size_t posted = 3;
+  for (const Step& step : steps) {
+    ScopedLogCapture log;
+    if (step.release) server_->unholdToken(*step.release);
+    EXPECT_EQ(server_->holdOnPlugIn(*held), step.heldAfter);
+    EXPECT_EQ(server_->holdOnPlugIn(*twin), step.heldAfter);
+    EXPECT_FALSE(server_->holdOnPlugIn(*free));
+    EXPECT_EQ(log.lines().size(), step.logLines);
+    if (step.logLines) {
+      EXPECT_EQ(log.lines()[0],
+                Format("releasing plug-in hold %@ at client's request", *step.release));
+    }
+    posted += step.logLines;
+    EXPECT_EQ(notifications_.posted().size(), posted);
+  }
+  EXPECT_TRUE(server_->holds().empty());
+  EXPECT_EQ(KeepAliveCount(), keepAlive);
+}
+
+}  // namespace
+}  // namespace dr
