@@ -25,9 +25,9 @@ DRDatabase::DRDatabase(const std::optional<std::string>& path, DatabaseOptions o
   annotations_ = DRDAnnotationStore::initWithDatabase(path, options_.annotationStore);
 }
 
-DRDatabase::~DRDatabase() {
-  if (options_.registry) options_.registry->removeObserver(this);
-}
+// The registry holds its observers weakly, so a database that is gone is
+// never called; nothing is withdrawn here, since the registry may be gone too.
+DRDatabase::~DRDatabase() = default;
 
 void DRDatabase::subscribe() { options_.registry->addObserver(weak_from_this()); }
 

@@ -82,13 +82,15 @@ class DatabaseTest : public ::testing::Test {
     return n;
   }
 
+  // Destroyed in reverse: the database first, then the registry, whose
+  // destruction drains its event thread, and only then what events reach.
   registry_test::TempFolder folder_;
-  std::unique_ptr<Registry> registry_;
   testing::FakeNotificationCenter notifications_;
   testing::FakeUsageReports reports_;
   test::FakeServiceManager serviceManager_;
   PlugInServices services_;
   std::shared_ptr<Delegate> delegate_ = std::make_shared<Delegate>();
+  std::unique_ptr<Registry> registry_;
   std::shared_ptr<DRDatabase> db_;
 };
 
