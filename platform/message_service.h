@@ -9,7 +9,9 @@
 // the peer hangs up, breaks the protocol (logged, and only that connection
 // closes) or is cancelled. Replies are queued per connection and written by
 // that connection's thread, so sending never blocks the caller; a peer whose
-// queue passes kMaxQueuedReplyBytes is closed.
+// queue passes kMaxQueuedReplyBytes is closed, and one with
+// kMaxUnansweredRequests requests in flight is not read until they are
+// answered.
 //
 // Ownership: a connection keeps itself alive while its thread runs, and
 // holds its context object until its last event has been delivered; callers
@@ -56,6 +58,10 @@ struct ConnectionEvent {
 class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
  public:
   static constexpr size_t kMaxQueuedReplyBytes = size_t{64} << 20;
+  // Requests delivered and not yet answered, per connection. At the limit the
+  // connection is not read until replies go out, so one peer that pipelines
+  // without end cannot fill the queue every peer's requests share.
+  static constexpr uint32_t kMaxUnansweredRequests = 64;
 
   ~PeerConnection();
   PeerConnection(const PeerConnection&) = delete;
@@ -102,6 +108,7 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   std::string outbox_;             // guarded by mu_: encoded frames not yet written
   size_t outboxSent_ = 0;          // guarded by mu_
   uint64_t nextSerial_ = 1;        // guarded by mu_
+  uint32_t unanswered_ = 0;        // guarded by mu_
   std::shared_ptr<void> context_;  // guarded by mu_
   std::function<void(const ConnectionEvent&)> handler_;  // set before resume
 };

@@ -93,6 +93,7 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
       drm1::EncodeFrame(nextSerial_, requestSerial, drm1::kFlagIsReply, body);
   if (!frame) return frame.error();
   ++nextSerial_;
+  if (unanswered_ > 0) --unanswered_;
   if (outbox_.size() - outboxSent_ + frame->size() > kMaxQueuedReplyBytes) {
     SystemLog("closing %@: more than 64 MiB of replies unread", description());
     closed_ = true;
@@ -141,20 +142,51 @@ void PeerConnection::run() {
   drm1::FrameDecoder decoder;
   std::string buf(kReadChunk, '\0');
   bool peerOpen = true;
+  // Delivers the frames already received, as far as the limit of unanswered
+  // requests allows; false on a protocol error.
+  auto deliver = [&]() -> bool {
+    for (;;) {
+      {
+        std::lock_guard<std::mutex> lock(mu_);
+        if (unanswered_ >= kMaxUnansweredRequests) return true;
+      }
+      Result<std::optional<drm1::Frame>> frame = decoder.next();
+      if (!frame) {
+        SystemLog("protocol error on %@: %@", description(), frame.error());
+        return false;
+      }
+      if (!frame->has_value()) return true;
+      drm1::Frame& f = **frame;
+      if (f.header.isReply()) {
+        SystemLog("protocol error on %@: a peer sent a reply", description());
+        return false;
+      }
+      if (f.header.wantsReply()) {
+        std::lock_guard<std::mutex> lock(mu_);
+        ++unanswered_;
+      }
+      ConnectionEvent event;
+      event.message = PeerMessage{f.header.serial, f.header.wantsReply(), std::move(f.body)};
+      if (handler_) handler_(event);
+    }
+  };
   while (peerOpen && !closed_) {
-    bool pendingOut;
+    if (!deliver()) break;
+    bool pendingOut, readable;
     {
       std::lock_guard<std::mutex> lock(mu_);
       pendingOut = outboxSent_ < outbox_.size();
+      readable = unanswered_ < kMaxUnansweredRequests;
     }
-    struct pollfd fds[2] = {{fd_, static_cast<short>(POLLIN | (pendingOut ? POLLOUT : 0)), 0},
-                            {wakeFd_, POLLIN, 0}};
+    const short events = static_cast<short>((readable ? POLLIN : 0) | (pendingOut ? POLLOUT : 0));
+    struct pollfd fds[2] = {{fd_, events, 0}, {wakeFd_, POLLIN, 0}};
     if (::poll(fds, 2, -1) < 0) {
       if (errno == EINTR) continue;
       break;
     }
     if (fds[1].revents & POLLIN) DrainWakeFd(wakeFd_);
     if ((fds[0].revents & POLLOUT) && !writeSome()) break;
+    if (fds[0].revents & (POLLHUP | POLLERR) && !readable) break;
     if (fds[0].revents & (POLLIN | POLLHUP | POLLERR)) {
       ssize_t n = ::recv(fd_, buf.data(), buf.size(), MSG_DONTWAIT);
       if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
@@ -163,24 +195,6 @@ void PeerConnection::run() {
         break;
       }
       decoder.feed(std::string_view(buf.data(), static_cast<size_t>(n)));
-      for (;;) {
-        Result<std::optional<drm1::Frame>> frame = decoder.next();
-        if (!frame) {
-          SystemLog("protocol error on %@: %@", description(), frame.error());
-          peerOpen = false;
-          break;
-        }
-        if (!frame->has_value()) break;
-        drm1::Frame& f = **frame;
-        if (f.header.isReply()) {
-          SystemLog("protocol error on %@: a peer sent a reply", description());
-          peerOpen = false;
-          break;
-        }
-        ConnectionEvent event;
-        event.message = PeerMessage{f.header.serial, f.header.wantsReply(), std::move(f.body)};
-        if (handler_) handler_(event);
-      }
     }
     // Write what the handler just queued without waiting for the next poll.
     if (!writeSome()) break;
