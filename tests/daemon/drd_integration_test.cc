@@ -2,8 +2,12 @@
 // over its real socket.
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/socket.h>
 
+#include <atomic>
+#include <chrono>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/drm1.h"
@@ -17,7 +21,31 @@ using testing::DrdProcess;
 using testing::Drm1Peer;
 using testing::TempFolder;
 
+using namespace std::chrono_literals;
+
 constexpr char kUsage[] = "Usage: drd [-S servicename] [-v]\n";
+
+// Hand-made frames, for bytes the encoder refuses to produce.
+std::string U32(uint32_t n) {
+  std::string out;
+  for (int i = 0; i < 4; ++i) out.push_back(static_cast<char>((n >> (8 * i)) & 0xFF));
+  return out;
+}
+std::string U64(uint64_t n) {
+  return U32(static_cast<uint32_t>(n)) + U32(static_cast<uint32_t>(n >> 32));
+}
+std::string Key(const std::string& key) { return U32(static_cast<uint32_t>(key.size())) + key; }
+// A request frame with serial 1 around `body` (encoded bytes).
+std::string RawRequest(const std::string& body) {
+  return std::string("DRM1", 4) + U32(static_cast<uint32_t>(body.size())) + U64(1) + U64(0) +
+         U32(drm1::kFlagWantsReply) + U32(0) + body;
+}
+// A top dictionary { "a": [[[...]]] } whose innermost array is at `depth`.
+std::string NestedBody(int depth) {
+  std::string body = "\x0B" + U32(1) + Key("a");
+  for (int level = 2; level <= depth; ++level) body += "\x0A" + U32(level < depth ? 1 : 0);
+  return body;
+}
 
 class DrdTest : public ::testing::Test {
  protected:
@@ -124,11 +152,21 @@ TEST_F(DrdTest, BrokenFrameClosesOnlyItsConnection) {
     return frame;
   };
   const std::string oversize = withLength(drm1::kMaxBodySize + 1);
+  std::string oversizeWithBody = oversize;
+  oversizeWithBody.resize(drm1::kHeaderSize + drm1::kMaxBodySize + 1, '\0');
   const std::vector<std::pair<const char*, std::string>> rows = {
       {"bad magic", withByte(0, 'X')},
       {"unknown flag", withByte(24, 0x05)},
       {"reply flag from a client", withByte(24, 0x03)},
-      {"body too long", oversize},
+      {"body length 16 MiB + 1, header only", oversize},
+      {"body length 16 MiB + 1, body sent", oversizeWithBody},
+      {"string not UTF-8",
+       RawRequest("\x0B" + U32(1) + Key("request") + "\x07" + U32(2) + "\xC3\x28")},
+      {"key not UTF-8", RawRequest("\x0B" + U32(1) + Key("\xFF") + "\x02")},
+      {"duplicate key",
+       RawRequest("\x0B" + U32(2) + Key("request") + "\x02" + Key("request") + "\x01")},
+      {"nesting depth 65", RawRequest(NestedBody(65))},
+      {"count larger than the body", RawRequest("\x0B" + U32(1000))},
       {"unknown tag", withByte(drm1::kHeaderSize, 0x0C)},
       {"top level not a dictionary", withByte(drm1::kHeaderSize, 0x0A)},
       {"trailing bytes", withLength(static_cast<uint32_t>(good.size() - drm1::kHeaderSize + 1)) +
@@ -186,6 +224,75 @@ TEST_F(DrdTest, VerboseLogCountsEachThousandRequests) {
   EXPECT_EQ(log.find("used 999 "), std::string::npos);
   EXPECT_EQ(log.find("used 1001 "), std::string::npos);
   EXPECT_NE(log.find("request match\n"), std::string::npos);
+}
+
+// The limits themselves are allowed: nesting depth 64 and a body of exactly
+// 16 MiB are requests like any other.
+TEST_F(DrdTest, FramesAtTheLimitsAreServed) {
+  std::string big = "\x0B" + U32(1) + Key("pad") + "\x08";
+  const uint32_t padding = drm1::kMaxBodySize - static_cast<uint32_t>(big.size()) - 4;
+  big += U32(padding) + std::string(padding, 'p');
+  ASSERT_EQ(big.size(), drm1::kMaxBodySize);
+  const std::vector<std::pair<const char*, std::string>> rows = {
+      {"nesting depth 64", RawRequest(NestedBody(64))},
+      {"body of 16 MiB", RawRequest(big)},
+  };
+  Start();
+  for (const auto& [what, bytes] : rows) {
+    Drm1Peer peer(drd_->socketPath());
+    ASSERT_TRUE(peer.sendRaw(bytes)) << what;
+    std::optional<drm1::Frame> reply = peer.receive(10s);
+    ASSERT_TRUE(reply) << what;
+    EXPECT_EQ(reply->header.replyTo, 1u) << what;
+    EXPECT_EQ(reply->body["error"], Value("unsupported protocol version 0 (need 2)")) << what;
+  }
+}
+
+// A peer that pipelines requests without ever reading its replies must not
+// stall anybody else: another client is answered promptly while the flood
+// goes on, and the daemon keeps serving after the flooder leaves. (Its cut-off
+// at the reply queue limit takes tens of seconds of flooding here, so it is
+// checked at the message service level instead.)
+TEST_F(DrdTest, PeerThatNeverReadsDoesNotStallOthers) {
+  Start();
+  auto hog = std::make_unique<Drm1Peer>(drd_->socketPath());
+  ASSERT_TRUE(hog->connected());
+  std::atomic<bool> stop{false};
+  std::atomic<uint64_t> sent{0};
+  std::thread flood([&] {
+    const Value request{{"request", "frobnicate"}, {"version", uint64_t{2}}};
+    std::string batch;
+    uint64_t serial = 1;
+    while (!stop) {
+      batch.clear();
+      for (int i = 0; i < 1000; ++i) {
+        batch += *drm1::EncodeFrame(serial++, 0, drm1::kFlagWantsReply, request);
+      }
+      if (!hog->sendRaw(batch)) return;  // cut off
+      sent += 1000;
+    }
+  });
+  Drm1Peer other(drd_->socketPath());
+  ASSERT_TRUE(other.connected());
+  uint64_t serial = 1;
+  for (int round = 0; round < 5; ++round, ++serial) {
+    std::this_thread::sleep_for(200ms);
+    const auto start = std::chrono::steady_clock::now();
+    ASSERT_TRUE(other.send(serial, Value{{"request", "lock"}, {"version", uint64_t{2}}}));
+    std::optional<drm1::Frame> reply = other.receive(5s);
+    ASSERT_TRUE(reply) << "round " << round << " after " << sent << " flooding requests";
+    EXPECT_EQ(reply->header.replyTo, serial);
+    EXPECT_LT(std::chrono::steady_clock::now() - start, 3s) << "round " << round;
+  }
+  EXPECT_GT(sent, 0u) << "the flood never got going";
+  stop = true;
+  ::shutdown(hog->fd(), SHUT_RDWR);  // unblocks a send waiting on a full socket
+  flood.join();
+  hog.reset();
+  ASSERT_TRUE(other.send(serial, Value{{"request", "lock"}, {"version", uint64_t{2}}}));
+  std::optional<drm1::Frame> after = other.receive(30s);
+  ASSERT_TRUE(after) << "the daemon stopped serving after the flood";
+  EXPECT_EQ(after->header.replyTo, serial);
 }
 
 }  // namespace

@@ -23,6 +23,9 @@ class Drm1Peer {
   Drm1Peer& operator=(const Drm1Peer&) = delete;
 
   bool connected() const { return connected_; }
+  // The socket, for tests that act on it directly (shutdown from another
+  // thread, for instance).
+  int fd() const { return fd_; }
   // False when not every byte could be written.
   bool sendRaw(const std::string& bytes);
   bool send(uint64_t serial, const Value& body, bool wantsReply = true);

@@ -1,0 +1,152 @@
+#include "client/include/drd/connection.h"
+
+#include <errno.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <string_view>
+
+namespace dr::client {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// Milliseconds left until `deadline`, rounded up, for poll(); 0 when past.
+int MillisecondsLeft(Clock::time_point deadline) {
+  auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - Clock::now()).count();
+  if (left <= 0) return 0;
+  return left > INT32_MAX ? INT32_MAX : static_cast<int>(left);
+}
+
+Clock::time_point DeadlineAfter(std::chrono::milliseconds timeout) {
+  if (timeout > std::chrono::hours(24 * 365)) return Clock::time_point::max();
+  return Clock::now() + timeout;
+}
+
+Error ClientError(int64_t code, std::string description) {
+  return Error(kClientErrorDomain, code, std::move(description));
+}
+
+}  // namespace
+
+Result<std::unique_ptr<Connection>> Connection::Open(const std::string& serviceName,
+                                                     const std::string& socketDirectory) {
+  const std::string path = socketDirectory + "/" + serviceName;
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  if (serviceName.empty() || socketDirectory.empty()) {
+    return PosixError(EINVAL, "connect to drd at \"" + path + "\"");
+  }
+  if (path.size() >= sizeof addr.sun_path)
+    return PosixError(ENAMETOOLONG, "connect to drd at " + path);
+  std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return PosixError(errno, "socket");
+  int rc;
+  do {
+    rc = ::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
+  } while (rc != 0 && errno == EINTR);
+  if (rc != 0) {
+    int saved = errno;
+    ::close(fd);
+    return PosixError(saved, "connect to drd at " + path);
+  }
+  return std::unique_ptr<Connection>(new Connection(fd));
+}
+
+Connection::Connection(int fd) : fd_(fd) {}
+
+Connection::~Connection() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+bool Connection::isOpen() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return fd_ >= 0;
+}
+
+Status Connection::fail(int64_t code, std::string description) {
+  if (fd_ >= 0) ::close(fd_);
+  fd_ = -1;
+  deadError_ = ClientError(code, std::move(description));
+  return *deadError_;
+}
+
+Result<uint64_t> Connection::write(const Value& message, uint32_t flags,
+                                   Clock::time_point deadline) {
+  if (fd_ < 0) return *deadError_;
+  const uint64_t serial = nextSerial_;
+  Result<std::string> frame = drm1::EncodeFrame(serial, 0, flags, message);
+  if (!frame) return frame.error();
+  ++nextSerial_;
+  const std::string& bytes = *frame;
+  size_t sent = 0;
+  while (sent < bytes.size()) {
+    ssize_t n = ::send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (n > 0) {
+      sent += static_cast<size_t>(n);
+      continue;
+    }
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+      struct pollfd p = {fd_, POLLOUT, 0};
+      int ready = ::poll(&p, 1, MillisecondsLeft(deadline));
+      if (ready < 0 && errno == EINTR) continue;
+      if (ready > 0) continue;
+      if (sent == 0) return ClientError(kTimeout, "drd did not take the message in time");
+      // Half a frame on the wire: the stream can never be used again.
+      return fail(kTimeout, "drd did not take the whole message in time; connection closed");
+    }
+    return fail(kConnectionClosed, "connection closed by drd (" +
+                                       std::string(std::strerror(n < 0 ? errno : EPIPE)) + ")");
+  }
+  return serial;
+}
+
+Status Connection::send(const Value& message, std::chrono::milliseconds timeout) {
+  std::lock_guard<std::mutex> lock(mu_);
+  Result<uint64_t> serial = write(message, 0, DeadlineAfter(timeout));
+  return serial.status();
+}
+
+Result<Value> Connection::request(const Value& message, std::chrono::milliseconds timeout) {
+  std::lock_guard<std::mutex> lock(mu_);
+  const Clock::time_point deadline = DeadlineAfter(timeout);
+  Result<uint64_t> serial = write(message, drm1::kFlagWantsReply, deadline);
+  if (!serial) return serial.error();
+  for (;;) {
+    Result<std::optional<drm1::Frame>> frame = decoder_.next();
+    if (!frame) {
+      return fail(kProtocolError, "protocol error from drd: " + frame.error().description());
+    }
+    if (frame->has_value()) {
+      drm1::Frame& f = **frame;
+      // Anything else is a late reply to a request given up on, or a
+      // message this connection does not wait for.
+      if (f.header.isReply() && f.header.replyTo == *serial) return std::move(f.body);
+      continue;
+    }
+    struct pollfd p = {fd_, POLLIN, 0};
+    int ready = ::poll(&p, 1, MillisecondsLeft(deadline));
+    if (ready < 0 && errno == EINTR) continue;
+    if (ready < 0) return fail(kConnectionClosed, PosixError(errno, "poll").description());
+    if (ready == 0) {
+      return ClientError(kTimeout,
+                         "no reply from drd within " + std::to_string(timeout.count()) + " ms");
+    }
+    char buffer[65536];
+    ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
+    if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
+    if (n == 0) return fail(kConnectionClosed, "connection closed by drd");
+    if (n < 0) {
+      return fail(kConnectionClosed,
+                  "connection closed by drd (" + std::string(std::strerror(errno)) + ")");
+    }
+    decoder_.feed(std::string_view(buffer, static_cast<size_t>(n)));
+  }
+}
+
+}  // namespace dr::client
