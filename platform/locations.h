@@ -7,6 +7,8 @@
 
 #include <functional>
 #include <string>
+#include <string_view>
+#include <vector>
 
 namespace dr {
 
@@ -19,6 +21,19 @@ std::string SocketDirectory(const EnvironmentLookup& getenv = nullptr);
 // The user's configuration folder; empty when neither XDG_CONFIG_HOME nor
 // HOME is set.
 std::string ConfigHome(const EnvironmentLookup& getenv = nullptr);
+
+// The user's home folder: $HOME, else (for the process's own environment
+// only: an injected one stands for a whole world) the account's home folder;
+// "" when neither is known.
+std::string HomeFolder(const EnvironmentLookup& getenv = nullptr);
+
+// The user's data folder: $XDG_DATA_HOME when it is absolute, else
+// <home>/.local/share; "" when no absolute folder can be made.
+std::string DataHome(const EnvironmentLookup& getenv = nullptr);
+
+// The absolute folders of a colon-separated list, in order. Empty and
+// relative entries are dropped, as the XDG rules ask of their lists.
+std::vector<std::string> SplitFolderList(std::string_view list);
 
 // The value of `name` when set and not empty; otherwise "".
 std::string EnvironmentValue(const EnvironmentLookup& getenv, const char* name);

@@ -1,9 +1,12 @@
+#include <pwd.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <string>
 
 #include "platform/locations.h"
+
+#include <vector>
 
 namespace dr {
 
@@ -29,6 +32,42 @@ std::string ConfigHome(const EnvironmentLookup& getenv) {
   }
   if (std::string home = EnvironmentValue(getenv, "HOME"); !home.empty()) return home + "/.config";
   return std::string();
+}
+
+std::string HomeFolder(const EnvironmentLookup& getenv) {
+  if (std::string home = EnvironmentValue(getenv, "HOME"); !home.empty()) return home;
+  if (getenv) return std::string();
+  // A daemon started without HOME still has an account.
+  passwd pw;
+  passwd* found = nullptr;
+  std::vector<char> buffer(16384);
+  if (::getpwuid_r(::getuid(), &pw, buffer.data(), buffer.size(), &found) == 0 && found &&
+      found->pw_dir) {
+    return found->pw_dir;
+  }
+  return std::string();
+}
+
+std::string DataHome(const EnvironmentLookup& getenv) {
+  if (std::string data = EnvironmentValue(getenv, "XDG_DATA_HOME");
+      !data.empty() && data[0] == '/') {
+    return data;
+  }
+  std::string home = HomeFolder(getenv);
+  return !home.empty() && home[0] == '/' ? home + "/.local/share" : std::string();
+}
+
+std::vector<std::string> SplitFolderList(std::string_view list) {
+  std::vector<std::string> folders;
+  size_t start = 0;
+  while (start <= list.size()) {
+    size_t colon = list.find(':', start);
+    if (colon == std::string_view::npos) colon = list.size();
+    std::string_view folder = list.substr(start, colon - start);
+    if (!folder.empty() && folder[0] == '/') folders.emplace_back(folder);
+    start = colon + 1;
+  }
+  return folders;
 }
 
 }  // namespace dr

@@ -1,12 +1,12 @@
 // Registry entries, their lazily parsed dictionaries, and the registry's
 // options from the environment.
-#include <pwd.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <vector>
 
 #include "core/format.h"
+#include "platform/locations.h"
 #include "platform/pdoc.h"
 #include "platform/registry.h"
 #include "platform/registry_scan.h"
@@ -68,38 +68,16 @@ Result<RegistryOptions> RegistryOptionsFromEnvironment(
   if (std::string registry = get("DR_REGISTRY"); !registry.empty()) {
     options.databasePath = registry;
   } else {
-    std::string dataHome = get("XDG_DATA_HOME");
-    if (dataHome.empty() || dataHome.front() != '/') {
-      std::string home = get("HOME");
-      if (home.empty()) {
-        // A daemon started without HOME still has an account.
-        passwd pw;
-        passwd* found = nullptr;
-        std::vector<char> buffer(16384);
-        if (::getpwuid_r(::getuid(), &pw, buffer.data(), buffer.size(), &found) == 0 && found &&
-            found->pw_dir) {
-          home = found->pw_dir;
-        }
-      }
-      if (home.empty() || home.front() != '/') {
-        return Error(kRegistryErrorDomain, kRegistryStorage,
-                     "no location for the registry database: neither DR_REGISTRY, "
-                     "XDG_DATA_HOME nor a home folder is known");
-      }
-      dataHome = home + "/.local/share";
+    std::string dataHome = DataHome(getenv);
+    if (dataHome.empty()) {
+      return Error(kRegistryErrorDomain, kRegistryStorage,
+                   "no location for the registry database: neither DR_REGISTRY, "
+                   "XDG_DATA_HOME nor a home folder is known");
     }
     options.databasePath = dataHome + "/dromon/registry.sqlite3";
   }
   if (std::string roots = get("DR_SYSTEM_ROOTS"); !roots.empty()) {
-    options.systemRoots.clear();
-    size_t pos = 0;
-    while (pos <= roots.size()) {
-      size_t colon = roots.find(':', pos);
-      if (colon == std::string::npos) colon = roots.size();
-      std::string root = roots.substr(pos, colon - pos);
-      if (!root.empty() && root.front() == '/') options.systemRoots.push_back(root);
-      pos = colon + 1;
-    }
+    options.systemRoots = SplitFolderList(roots);
   }
   return options;
 }

@@ -1,5 +1,4 @@
 #include <dirent.h>
-#include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -17,6 +16,7 @@
 
 #include "core/log.h"
 #include "platform/bundle_reader.h"
+#include "platform/locations.h"
 #include "platform/pdoc.h"
 #include "platform/process_info.h"
 #include "platform/registry.h"
@@ -38,34 +38,13 @@ constexpr std::string_view kDeletedSuffix = " (deleted)";
 constexpr const char* kBundleIdentifierKey = "BNBundleIdentifier";
 constexpr const char* kBundleVersionKey = "BNBundleVersion";
 
-std::string NonEmptyEnv(const char* name) {
-  const char* v = std::getenv(name);
-  return v ? std::string(v) : std::string();
-}
-
-std::string HomeFolder() {
-  std::string home = NonEmptyEnv("HOME");
-  if (!home.empty()) return home;
-  struct passwd* pw = ::getpwuid(::getuid());
-  return pw && pw->pw_dir ? std::string(pw->pw_dir) : std::string();
-}
-
 std::vector<std::string> SdkFolders() {
-  std::string list = NonEmptyEnv(kSdkPathVariable);
+  std::string list = EnvironmentValue(nullptr, kSdkPathVariable);
   if (list.empty()) {
-    std::string data = NonEmptyEnv("XDG_DATA_HOME");
-    if (data.empty()) data = HomeFolder() + "/.local/share";
-    list = data + "/dromon/SDKs:" + kSystemSdkFolder;
+    std::string data = DataHome();
+    list = (data.empty() ? "" : data + "/dromon/SDKs:") + kSystemSdkFolder;
   }
-  std::vector<std::string> folders;
-  size_t start = 0;
-  while (start <= list.size()) {
-    size_t colon = list.find(':', start);
-    if (colon == std::string::npos) colon = list.size();
-    if (colon > start) folders.push_back(list.substr(start, colon - start));
-    start = colon + 1;
-  }
-  return folders;
+  return SplitFolderList(list);
 }
 
 // The pids of the user's own processes, in ascending order. drd serves one

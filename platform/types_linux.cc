@@ -25,6 +25,7 @@
 #include <vector>
 
 #include "platform/file_system.h"
+#include "platform/locations.h"
 #include "platform/registry.h"
 #include "platform/types.h"
 
@@ -222,11 +223,6 @@ class LinuxTypeService final : public TypeService {
   std::shared_ptr<const Parents> declared_;  // guarded by mu_
 };
 
-void AppendFolder(std::vector<std::string>& folders, std::string folder) {
-  // The XDG rules ask that relative folders be ignored.
-  if (!folder.empty() && folder[0] == '/') folders.push_back(std::move(folder));
-}
-
 }  // namespace
 
 std::vector<std::string> DataFoldersFromEnvironment(
@@ -236,21 +232,10 @@ std::vector<std::string> DataFoldersFromEnvironment(
     return v ? std::string(v) : std::string();
   };
   std::vector<std::string> folders;
-  std::string home = get("XDG_DATA_HOME");
-  if (home.empty()) {
-    std::string userHome = get("HOME");
-    if (!userHome.empty()) home = userHome + "/.local/share";
-  }
-  AppendFolder(folders, home);
+  if (std::string home = DataHome(getenv); !home.empty()) folders.push_back(home);
   std::string dirs = get("XDG_DATA_DIRS");
   if (dirs.empty()) dirs = kDefaultDataDirs;
-  size_t start = 0;
-  while (start <= dirs.size()) {
-    size_t colon = dirs.find(':', start);
-    if (colon == std::string::npos) colon = dirs.size();
-    AppendFolder(folders, dirs.substr(start, colon - start));
-    start = colon + 1;
-  }
+  for (std::string& folder : SplitFolderList(dirs)) folders.push_back(std::move(folder));
   return folders;
 }
 
