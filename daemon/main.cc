@@ -17,6 +17,7 @@
 #include "daemon/server.h"
 #include "platform/locations.h"
 #include "platform/notifications.h"
+#include "platform/policy.h"
 #include "platform/preferences.h"
 #include "platform/registry.h"
 #include "platform/sandbox.h"
@@ -97,6 +98,7 @@ int main(int argc, char** argv) {
       dr::MakeFilePreferences(dr::PreferencesOptionsFromEnvironment());
   std::unique_ptr<dr::NotificationCenter> notifications =
       dr::MakeFileNotificationCenter(dr::NotificationOptionsFromEnvironment());
+  std::unique_ptr<dr::Policy> policy = dr::MakeFilePolicy(dr::PolicyOptionsFromEnvironment());
   std::unique_ptr<dr::UsageReports> usageReports =
       dr::MakeUsageReports(dr::UsageReportOptionsFromEnvironment());
 
@@ -111,6 +113,7 @@ int main(int argc, char** argv) {
   options.serviceManager = serviceManager.get();
   options.codeSigning = signing.get();
   options.preferences = preferences.get();
+  options.policy = policy.get();
   std::shared_ptr<dr::DRDServer> server =
       dr::DRDServer::initForServiceDatabase(line->serviceName, line->annotationFile, options);
   if (!server) return Fail("unable to construct server");

@@ -26,6 +26,7 @@
 #include "platform/bundle_reader.h"
 #include "platform/code_signing.h"
 #include "platform/message_service.h"
+#include "platform/policy.h"
 #include "platform/process_info.h"
 #include "platform/service_manager.h"
 #include "store/database.h"
@@ -50,6 +51,8 @@ struct ServerOptions {
   BundleReader* bundleReader = nullptr;
   // The user's exclusions; required.
   Preferences* preferences = nullptr;
+  // The administrator's deny list; null: nothing is denied.
+  Policy* policy = nullptr;
 };
 
 class DRDServer : public DRDatabase, public DRDatabaseDelegate {

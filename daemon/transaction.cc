@@ -4,10 +4,18 @@
 
 #include <cstring>
 
+#include <cerrno>
+#include <set>
+
 #include "core/format.h"
+#include "core/log.h"
+#include "daemon/discovery.h"
 #include "daemon/ipc_client.h"
 #include "daemon/server.h"
+#include "model/plugin_keys.h"
+#include "platform/pdoc.h"
 #include "platform/probes.h"
+#include "store/extension_issuing.h"
 
 namespace dr {
 namespace {
@@ -19,6 +27,19 @@ constexpr const char* kUuidsKey = "uuids";
 constexpr const char* kErrorCodeKey = "errorcode";
 constexpr const char* kErrorKey = "error";
 constexpr const char* kUnrecognizedRequest = "unrecognized request";
+constexpr const char* kFlagsKey = "flags";
+constexpr const char* kRulesKey = "rules";
+constexpr const char* kAnnotationsKey = "annotations";
+constexpr const char* kMatchesKey = "matches";
+constexpr const char* kExtensionsKey = "extensions";
+constexpr const char* kConflictsKey = "conflicts";
+constexpr const char* kElectionKey = "election";
+constexpr const char* kExtensionKey = "extension";
+constexpr const char* kOnHoldReason = "the plug-in is on hold";
+
+// The "flags" of a hold request: what each path names.
+constexpr uint64_t kHoldApplication = 1;  // every plug-in inside the application
+constexpr uint64_t kHoldPlugIn = 2;       // the one plug-in at the path
 
 // Paths are resolved into a buffer of this size; longer ones do not resolve.
 constexpr size_t kMaxResolvedPath = 1024;
@@ -42,6 +63,23 @@ std::optional<std::string> CanonicalPath(const std::string& path) {
   ::free(resolved);
   if (result.size() >= kMaxResolvedPath) return std::nullopt;
   return result;
+}
+
+// A number as a message carries one: an integer or a floating-point value
+// (a boolean is not one).
+bool IsMessageNumber(const Value& value) {
+  return value.type() == Value::Type::kInt || value.type() == Value::Type::kUInt ||
+         value.type() == Value::Type::kDouble;
+}
+
+// One entry of "conflicts": the running instance that makes a plug-in busy.
+Value BusyDescription(const BusyExtensionInstance& instance) {
+  return Value(Dictionary{
+      {"pid", Value(static_cast<int64_t>(instance.pid))},
+      {"path", Value(instance.bundlePath)},
+      {"identifier", Value(instance.bundleIdentifier)},
+      {"version", Value(instance.bundleVersion)},
+  });
 }
 
 }  // namespace
@@ -187,15 +225,255 @@ void Transaction::failError(uint64_t code, const Error& error) {
   }
 }
 
-// The request handlers are not written yet: each request is answered as
-// unknown until its handler lands.
-void Transaction::addPlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::removePlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::bulkPlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::matchPlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::readyPlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::accessPlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::annotatePlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
-void Transaction::lockDownPlugIns() { failMessage(kErrorMalformed, kUnrecognizedRequest); }
+// ---- Registration -------------------------------------------------------
+
+void Transaction::addPlugIns() {
+  processPaths([this](const std::string& path, bool resolved) {
+    if (!resolved) {
+      failMessage(kErrorBadPath, Format("invalid plugin path: %@", path));
+      return false;
+    }
+    probes::PluginAdd(path.c_str());
+    if (server().addPlugIn(path)) {
+      SystemLog("failed to register plug-in at %@", path);
+      failMessage(kErrorRegistration, Format("unable to register plug-in at %@", path));
+      return false;
+    }
+    return true;
+  });
+}
+
+void Transaction::removePlugIns() {
+  processPaths([this](const std::string& path, bool resolved) {
+    probes::PluginRemove(path.c_str(), resolved);
+    // A bundle deleted from disk is unregistered under the path as sent.
+    if (server().removePlugIn(path)) {
+      failMessage(kErrorBadPath, Format("no plugin at %@", path));
+      return false;
+    }
+    return true;
+  });
+}
+
+void Transaction::bulkPlugIns() {
+  SystemLog("bulk options 0x%lx not supported", request()[kFlagsKey].uintValue());
+  done();
+}
+
+void Transaction::readyPlugIns() {
+  std::vector<DRDPlugInPtr> toEnable;  // each plug-in once, in request order
+  std::set<Uuid> seen;
+  const pid_t pid = client_->pid();
+  bool checked = processUuidList([&](const DRDPlugInPtr& p) {
+    const std::string uuid = p->uuid() ? p->uuid()->string() : std::string();
+    probes::PluginReady(uuid.c_str());
+    if (server().holdOnPlugIn(*p)) {
+      server().debug("denied access to pid %d for plugin %@(%@): %@", pid, p->identifier(), uuid,
+                     kOnHoldReason);
+      // A held plug-in is refused like any plug-in the host may not use.
+      failMessage(kErrorNotPermitted,
+                  Format("access to plugin %@ denied: %@", p->identifier(), kOnHoldReason));
+      return false;
+    }
+    if (p->isData()) return true;  // nothing to enable
+    if (std::optional<std::string> reason = p->allowForClient(*client_)) {
+      server().debug("denied access to pid %d for plugin %@(%@): %@", pid, p->identifier(), uuid,
+                     *reason);
+      failMessage(kErrorNotPermitted,
+                  Format("access to plugin %@ denied: %@", p->identifier(), *reason));
+      return false;
+    }
+    if (!p->uuid() || seen.insert(*p->uuid()).second) toEnable.push_back(p);
+    return true;
+  });
+  if (!checked) return;
+  // Every plug-in passed the checks; enable them all, even after a failure.
+  std::optional<Error> firstFailure;
+  for (const DRDPlugInPtr& p : toEnable) {
+    std::optional<Error> error = p->enableForPid(pid);
+    if (error && !firstFailure) firstFailure = std::move(error);
+  }
+  if (firstFailure) {
+    failError(kErrorMalformed, *firstFailure);
+  } else {
+    done();
+  }
+}
+
+// ---- Discovery ----------------------------------------------------------
+
+void Transaction::matchPlugIns() {
+  const Value& rules = request()[kRulesKey];
+  if (rules.isPresent() && !rules.isDictionary()) {
+    failMessage(kErrorMalformed, "invalid request format (bad rules dictionary)");
+    return;
+  }
+  const Value& flagsValue = request()[kFlagsKey];
+  const uint64_t flags = flagsValue.type() == Value::Type::kUInt ? flagsValue.uintValue() : 0;
+  const pid_t pid = client_->pid();
+  const PlugInServices& services = server().options().database.plugInServices;
+  if (flags & DRDiscoverAll) {
+    const bool sandboxed = !services.sandbox || services.sandbox->isSandboxed(pid);
+    if (!client_->hasEntitlement(kManagerEntitlement) || sandboxed) {
+      failMessage(kErrorNotPermitted, "unauthorized discovery flag (DRDiscoverAll)");
+      return;
+    }
+  }
+
+  DiscoveryHost host;
+  host.client = client_.get();
+  if (const std::shared_ptr<DRBundle>& bundle = client_->bundle()) {
+    host.plugInsPath = bundle->plugInsPath();
+    host.bundleIdentifier = bundle->bundleIdentifier().value_or("");
+  }
+  host.needs17732150Workaround = client_->needs17732150Workaround();
+  DRDServer& s = server();
+  DiscoveryServices hooks;
+  hooks.isHeld = [&s](const DRDPlugIn& p) { return s.holdOnPlugIn(p); };
+  hooks.addAnnotation = [this](const DRDPlugIn& p, Dictionary& form) {
+    addAnnotationForPlugInIn(p, form);
+  };
+  if (Policy* policy = s.options().policy) {
+    hooks.mayUse = [policy, pid](const Value& form) {
+      return policy->mayProcessUsePlugIn(pid, form[kFormIdentifierKey].stringValue());
+    };
+  }
+  hooks.log = [&s](const std::string& line) { s.log("%@", line); };
+  hooks.debug = [&s](const std::string& line) { s.debug("%@", line); };
+  Discovery discovery(std::move(host), rules, flags, s.userPrefs().exclusions(), std::move(hooks));
+
+  std::vector<DRDPlugInPtr> candidates = s.findPlugIns(rules).value_or(std::vector<DRDPlugInPtr>{});
+  probes::DiscoverRaw(static_cast<uint32_t>(candidates.size()));
+  for (const DRDPlugInPtr& candidate : candidates) discovery.examine(candidate);
+  setReplyValue(kMatchesKey, discovery.finish());
+  done();
+}
+
+// ---- Access -------------------------------------------------------------
+
+void Transaction::accessPlugIns() {
+  Array tokens;
+  Sandbox* sandbox = server().options().database.plugInServices.sandbox;
+  bool walked = processUuidList([&](const DRDPlugInPtr& p) {
+    const std::string path = p->path().value_or("");
+    std::optional<std::string> token = issueReadExtensionForURL(sandbox, path);
+    if (!token) {
+      failMessage(kErrorMalformed, Format("cannot create extension to %@: %d", path, errno));
+      return false;
+    }
+    tokens.emplace_back(std::move(*token));
+    return true;
+  });
+  if (!walked) return;
+  setReplyValue(kExtensionsKey, Value(std::move(tokens)));
+  done();
+}
+
+// ---- Annotations --------------------------------------------------------
+
+void Transaction::annotatePlugIns() {
+  const Value annotations = DictionaryValue(request(), kAnnotationsKey);
+  if (annotations.isAbsent()) {
+    failMessage(kErrorMalformed, "invalid request format (bad annotations dictionary)");
+    return;
+  }
+  Dictionary changes;
+  // Values the annotation file cannot hold (a UUID, say) are refused here:
+  // kept in memory they would make every later save of the file fail.
+  if (const Value& election = annotations[kElectionKey]; election.isPresent()) {
+    if (!IsMessageNumber(election) || !pdoc::WriteXml(election)) {
+      failMessage(kErrorMalformed, "invalid request format (annotation election)");
+      return;
+    }
+    changes[kElectionKey] = election;
+  }
+  if (const Value& extension = annotations[kExtensionKey]; extension.isPresent()) {
+    if (!extension.isDictionary() || !pdoc::WriteXml(extension)) {
+      failMessage(kErrorMalformed, "invalid request format (annotation extension)");
+      return;
+    }
+    changes[kExtensionKey] = extension;
+  }
+  if (changes.empty()) {
+    done();
+    return;
+  }
+  const Value change(std::move(changes));
+  if (processUuidList([&](const DRDPlugInPtr& p) {
+        server().setAnnotationForPlugIn(change, *p);
+        return true;
+      })) {
+    done();
+  }
+}
+
+void Transaction::addAnnotationForPlugInIn(const DRDPlugIn& plugIn, Dictionary& form) {
+  Value annotation = server().annotationForPlugIn(plugIn);
+  form[kAnnotationsKey] = annotation.isDictionary() ? annotation : Value::EmptyDictionary();
+}
+
+// ---- Holds --------------------------------------------------------------
+
+void Transaction::lockDownPlugIns() {
+  const Value tokens = ArrayValue(request(), kUuidsKey);
+  if (tokens.isPresent()) {
+    for (const Value& token : tokens.array()) {
+      if (std::optional<Uuid> uuid = token.uuid()) server().unholdToken(*uuid);
+    }
+    done();
+    return;
+  }
+  const uint64_t flags = request()[kFlagsKey].uintValue();
+  std::vector<DRDPlugInPtr> plugIns;
+  bool walked = marshalPaths([&](const std::string& path, bool resolved) {
+    if (!resolved) {
+      failMessage(kErrorBadPath, Format("invalid path: %@", path));
+      return false;
+    }
+    if (flags == kHoldPlugIn) {
+      DRDPlugInPtr p = server().findPlugInAtPath(path);
+      if (!p) {
+        failMessage(kErrorBadPath, Format("no plug-in at path:%@", path));
+        return false;
+      }
+      plugIns.push_back(std::move(p));
+      return true;
+    }
+    if (flags == kHoldApplication) {
+      for (DRDPlugInPtr& p :
+           server().plugInsWithinApplication(path).value_or(std::vector<DRDPlugInPtr>{})) {
+        plugIns.push_back(std::move(p));
+      }
+      return true;
+    }
+    failMessage(kErrorMalformed, "invalid request format (unsupported hold flags)");
+    return false;
+  });
+  if (!walked) return;
+
+  // A single plug-in named by its path is held even while it runs: the
+  // caller is replacing exactly that bundle.
+  Array conflicts;
+  Array busy;
+  if (flags != kHoldPlugIn) {
+    for (const DRDPlugInPtr& p : plugIns) {
+      if (std::optional<BusyExtensionInstance> instance = p->checkBusy()) {
+        conflicts.push_back(BusyDescription(*instance));
+        busy.emplace_back(Format("%@(%@)", p->identifier(), p->uuid()));
+      }
+    }
+  }
+  if (!busy.empty()) {
+    server().debug("hold rejected. Busy plug-ins:%@", Value(std::move(busy)));
+    setReplyValue(kConflictsKey, Value(std::move(conflicts)));
+    failMessage(kErrorBusy, "plug-ins are busy");
+    return;
+  }
+  std::shared_ptr<DRDPlugInHold> hold = DRDPlugInHold::initWithPlugInsForClient(plugIns, client_);
+  server().addHold(hold);
+  setReplyValue(kUuidsKey, Value(hold->uuid()));
+  server().debug("hold request granted uuid:%@", hold->uuid().string());
+  done();
+}
 
 }  // namespace dr

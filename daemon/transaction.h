@@ -89,6 +89,10 @@ class Transaction {
   void annotatePlugIns();
   void lockDownPlugIns();
 
+  // Puts the stored annotation of `plugIn` into `form` under "annotations"
+  // (an empty dictionary when there is none).
+  void addAnnotationForPlugInIn(const DRDPlugIn& plugIn, Dictionary& form);
+
  private:
   Transaction(PeerMessage request, std::shared_ptr<DRDIpcClient> client);
 

@@ -114,9 +114,24 @@ TEST_F(DrdTest, EachRequestGetsOneBoundReply) {
       {Value{{"request", "Match"}, {"version", uint64_t{2}}}, 4, kUnrecognized},
       {Value{{"request", "frobnicate"}, {"version", uint64_t{2}}}, 4, kUnrecognized},
   };
-  for (const char* name :
-       {"add", "remove", "bulk", "match", "ready", "access", "annotate", "lock"}) {
-    rows.push_back({Value{{"request", name}, {"version", uint64_t{2}}}, 4, kUnrecognized});
+  // Every request name reaches its own handler; bare, each one fails its own
+  // way or succeeds with nothing to do.
+  const struct {
+    const char* name;
+    uint64_t code;
+    const char* error;
+  } bare[] = {
+      {"add", 4, "invalid request format"},
+      {"remove", 4, "invalid request format"},
+      {"bulk", 0, ""},
+      {"match", 0, ""},
+      {"ready", 4, "invalid request format (uuid)"},
+      {"access", 4, "invalid request format (uuid)"},
+      {"annotate", 4, "invalid request format (bad annotations dictionary)"},
+      {"lock", 4, "invalid request format"},
+  };
+  for (const auto& b : bare) {
+    rows.push_back({Value{{"request", b.name}, {"version", uint64_t{2}}}, b.code, b.error});
   }
   Start();
   Drm1Peer peer(drd_->socketPath());
@@ -129,9 +144,11 @@ TEST_F(DrdTest, EachRequestGetsOneBoundReply) {
     ASSERT_TRUE(reply) << "no reply to row " << i;
     EXPECT_TRUE(reply->header.isReply());
     EXPECT_EQ(reply->header.replyTo, 10 + i);
-    EXPECT_EQ(reply->body["errorcode"], Value(rows[i].code)) << i;
-    EXPECT_EQ(reply->body["error"], Value(rows[i].error)) << i;
-    EXPECT_EQ(reply->body.size(), 2u) << reply->body.description();
+    EXPECT_EQ(reply->body["errorcode"].uintValue(), rows[i].code) << i;
+    EXPECT_EQ(reply->body["error"].stringValue(), rows[i].error) << i;
+    if (rows[i].code != 0) {
+      EXPECT_EQ(reply->body.size(), 2u) << reply->body.description();
+    }
   }
   EXPECT_FALSE(peer.receive(std::chrono::milliseconds(200))) << "one reply too many";
 }
@@ -224,6 +241,33 @@ TEST_F(DrdTest, VerboseLogCountsEachThousandRequests) {
   EXPECT_EQ(log.find("used 999 "), std::string::npos);
   EXPECT_EQ(log.find("used 1001 "), std::string::npos);
   EXPECT_NE(log.find("request match\n"), std::string::npos);
+}
+
+// Each -v adds detail: none logs no request, one logs each request's name,
+// two also the full text of every message and reply.
+TEST_F(DrdTest, VerbosityDecidesWhatIsLogged) {
+  struct Row {
+    std::vector<std::string> arguments;
+    bool names, messages;
+  } rows[] = {{{}, false, false}, {{"-v"}, true, false}, {{"-v", "-v"}, true, true}};
+  for (const Row& row : rows) {
+    TempFolder root;
+    DrdProcess drd(root.path(), row.arguments);
+    ASSERT_TRUE(drd.waitUntilServing());
+    Drm1Peer peer(drd.socketPath());
+    ASSERT_TRUE(peer.send(1, Value{{"request", "bulk"}, {"version", uint64_t{2}}}));
+    ASSERT_TRUE(peer.receive());
+    ASSERT_TRUE(drd.signal(SIGTERM));
+    ASSERT_EQ(drd.waitForExit(), 0);
+    const std::string log = drd.standardError();
+    const size_t n = row.arguments.size();
+    EXPECT_EQ(log.find("request bulk\n") != std::string::npos, row.names) << n;
+    EXPECT_EQ(log.find("incoming request { \"request\": \"bulk\", \"version\": 2 }\n") !=
+                  std::string::npos,
+              row.messages)
+        << n << log;
+    EXPECT_EQ(log.find("Replying { }\n") != std::string::npos, row.messages) << n;
+  }
 }
 
 // The limits themselves are allowed: nesting depth 64 and a body of exactly

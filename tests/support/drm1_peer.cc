@@ -80,7 +80,9 @@ bool Drm1Peer::sawEndOfStream(std::chrono::milliseconds timeout) {
   return eof_;
 }
 
-DrdProcess::DrdProcess(const std::string& root, std::vector<std::string> arguments) : root_(root) {
+DrdProcess::DrdProcess(const std::string& root, std::vector<std::string> arguments,
+                       std::vector<std::string> extraEnvironment)
+    : root_(root) {
   const std::string binary = BinaryPath();
   const std::string errorFile = root_ + "/drd-stderr-" + std::to_string(::getpid()) + "-" +
                                 std::to_string(reinterpret_cast<uintptr_t>(this));
@@ -89,7 +91,14 @@ DrdProcess::DrdProcess(const std::string& root, std::vector<std::string> argumen
       "XDG_STATE_HOME=" + root_ + "/state",   "XDG_CONFIG_HOME=" + root_ + "/config",
       "XDG_DATA_HOME=" + root_ + "/data",     "DR_NOTIFY_DIR=" + root_ + "/notify",
       "DR_USAGE_LOG=" + root_ + "/usage.log", "HOME=" + root_,
+      "DR_POLICY=" + root_ + "/policy.pdoc",  "DR_SYSTEM_ROOTS=" + root_ + "/system",
   };
+  // Later entries win: drop the defaults that `extraEnvironment` sets.
+  for (const std::string& entry : extraEnvironment) {
+    const std::string name = entry.substr(0, entry.find('=') + 1);
+    std::erase_if(environment, [&](const std::string& e) { return e.starts_with(name); });
+    environment.push_back(entry);
+  }
   errorFile_ = errorFile;
   pid_ = ::fork();
   if (pid_ == 0) {

@@ -46,11 +46,14 @@ class Drm1Peer {
 
 // A drd of the build tree (../daemon/drd next to the test binary's folder),
 // run with its own DR_SOCKET_DIR, DR_REGISTRY, XDG_STATE_HOME,
-// XDG_CONFIG_HOME, DR_NOTIFY_DIR and DR_USAGE_LOG under `root`. Its standard
-// error goes to a file. Killed (SIGKILL) when destroyed while still running.
+// XDG_CONFIG_HOME, XDG_DATA_HOME, DR_NOTIFY_DIR, DR_USAGE_LOG, DR_POLICY
+// (root/policy.pdoc) and DR_SYSTEM_ROOTS (root/system) under `root`, plus
+// `environment` ("NAME=value" entries, which win). Its standard error goes
+// to a file. Killed (SIGKILL) when destroyed while still running.
 class DrdProcess {
  public:
-  DrdProcess(const std::string& root, std::vector<std::string> arguments);
+  DrdProcess(const std::string& root, std::vector<std::string> arguments,
+             std::vector<std::string> environment = {});
   ~DrdProcess();
   DrdProcess(const DrdProcess&) = delete;
   DrdProcess& operator=(const DrdProcess&) = delete;

@@ -1,0 +1,234 @@
+#include "daemon/discovery.h"
+
+#include <algorithm>
+
+#include "core/format.h"
+#include "model/helpers.h"
+#include "model/plugin_keys.h"
+
+namespace dr {
+namespace {
+
+constexpr const char* kAnnotationsFormKey = "annotations";
+constexpr const char* kOverriderFormKey = "overrider";
+constexpr const char* kOverridingFormKey = "overriding";
+constexpr const char* kReplaceEntitlement = "com.corvel.developer.replace-plugin";
+// Older hosts still find the internal filters that ship outside any
+// application under this folder.
+constexpr const char* k17732150Path = "Effecta/InternalFilters.app";
+
+}  // namespace
+
+const char* DiscoveryOutcomeName(DiscoveryOutcome outcome) {
+  switch (outcome) {
+    case DiscoveryOutcome::kReturned:
+      return "returned";
+    case DiscoveryOutcome::kHybrid:
+      return "hybrid (the host did not ask for hybrid plug-ins)";
+    case DiscoveryOutcome::kNotInApplication:
+      return "not on the system volume and inside no application";
+    case DiscoveryOutcome::kSystemOnly:
+      return "not on the system volume (the host asked for system plug-ins only)";
+    case DiscoveryOutcome::kDedicatedElsewhere:
+      return "dedicated to another application";
+    case DiscoveryOutcome::kHeld:
+      return "held";
+    case DiscoveryOutcome::kRulesMismatch:
+      return "does not match the host's rules";
+    case DiscoveryOutcome::kExcluded:
+      return "excluded by the user";
+    case DiscoveryOutcome::kNotAuthorized:
+      return "not authorized for the host";
+    case DiscoveryOutcome::kNoForm:
+      return "its description could not be made";
+    case DiscoveryOutcome::kSuperseded:
+      return "superseded by another copy";
+    case DiscoveryOutcome::kVetoed:
+      return "denied by the administrator's policy";
+  }
+  return "unknown";
+}
+
+Discovery::Discovery(DiscoveryHost host, Value rules, uint64_t flags, Value exclusions,
+                     DiscoveryServices services)
+    : host_(std::move(host)),
+      rules_(std::move(rules)),
+      flags_(flags),
+      exclusions_(exclusions.isArray() ? std::move(exclusions) : Value()),
+      services_(std::move(services)) {}
+
+void Discovery::debug(const std::string& line) const {
+  if (services_.debug) services_.debug(line);
+}
+
+void Discovery::setOutcome(size_t verdict, DiscoveryOutcome outcome, std::string detail,
+                           DRDPlugInPtr by) {
+  Verdict& v = verdicts_[verdict];
+  v.outcome = outcome;
+  v.detail = std::move(detail);
+  v.by = std::move(by);
+}
+
+bool Discovery::plugInMatches17732150Workaround(const DRDPlugIn& plugIn) const {
+  const std::string path = plugIn.path().value_or("");
+  if (path.find(k17732150Path) == std::string::npos) return false;
+  if (services_.log) {
+    services_.log(Format("PlugIn matching for %@[%d] found a 17732150 PlugIn: %@",
+                         host_.bundleIdentifier, host_.client->pid(), path));
+  }
+  return true;
+}
+
+std::optional<DiscoveryOutcome> Discovery::visibility(const DRDPlugIn& candidate) {
+  if (candidate.isHybrid() && !(flags_ & DRDiscoverHybrid)) return DiscoveryOutcome::kHybrid;
+  if (!candidate.onSystemVolume()) {
+    if (!candidate.containingUrl()) {
+      if (!host_.needs17732150Workaround || !plugInMatches17732150Workaround(candidate)) {
+        return DiscoveryOutcome::kNotInApplication;
+      }
+      flags_ |= DRDiscoverDuplicates;
+    }
+    if (flags_ & DRDiscoverSystemOnly) return DiscoveryOutcome::kSystemOnly;
+  }
+  if (candidate.isDedicated()) {
+    // A plain prefix test: the host's own plug-ins folder holds its
+    // dedicated plug-ins.
+    const std::string path = candidate.path().value_or("");
+    if (!host_.plugInsPath || path.compare(0, host_.plugInsPath->size(), *host_.plugInsPath) != 0) {
+      return DiscoveryOutcome::kDedicatedElsewhere;
+    }
+  }
+  if (services_.isHeld && services_.isHeld(candidate)) return DiscoveryOutcome::kHeld;
+  return std::nullopt;
+}
+
+void Discovery::examine(const DRDPlugInPtr& candidate) {
+  if (!candidate) return;
+  const size_t verdict = verdicts_.size();
+  verdicts_.push_back({candidate, DiscoveryOutcome::kReturned, {}, nullptr});
+  const DRDPlugIn& p = *candidate;
+  const pid_t pid = host_.client->pid();
+  const bool all = flags_ & DRDiscoverAll;
+
+  if (!all) {
+    if (std::optional<DiscoveryOutcome> hidden = visibility(p)) {
+      setOutcome(verdict, *hidden);
+      return;
+    }
+  }
+  if (!p.match(rules_)) {
+    setOutcome(verdict, DiscoveryOutcome::kRulesMismatch);
+    return;
+  }
+  for (const Value& exclusion : exclusions_.array()) {
+    if (!exclusion.isDictionary()) continue;  // only rules dictionaries are evaluated
+    if (p.match(exclusion)) {
+      debug(Format("client %d plugin %@ excluded", pid, p.identifier()));
+      setOutcome(verdict, DiscoveryOutcome::kExcluded, exclusion.description());
+      return;
+    }
+  }
+  if (!all) {
+    if (std::optional<std::string> refusal = p.allowForClient(*host_.client)) {
+      debug(Format("client %d cannot use plugin %@: %@", pid, p.identifier(), *refusal));
+      setOutcome(verdict, DiscoveryOutcome::kNotAuthorized, *refusal);
+      return;
+    }
+  }
+  std::optional<Error> error;
+  Value form = p.exportForm(&error);
+  if (error && services_.log) {
+    services_.log(Format("error matching %@: %@", p.path(), *error));
+  }
+  if (!form.isDictionary()) {
+    setOutcome(verdict, DiscoveryOutcome::kNoForm, error ? error->description() : std::string());
+    return;
+  }
+  if (!resolveDuplicates(candidate, verdict)) return;
+
+  Dictionary entries = form.dictionary();
+  if (services_.addAnnotation) {
+    services_.addAnnotation(p, entries);
+  } else {
+    entries[kAnnotationsFormKey] = Value::EmptyDictionary();
+  }
+  p.augmentForm(entries);
+  form = Value(std::move(entries));
+  accepted_.push_back({candidate, verdict, form});
+
+  const Value replaces = p.valueForEntitlement(kReplaceEntitlement);
+  auto replace = [&](const Value& identifier) {
+    if (identifier.isString()) {
+      replacements_[identifier.stringValue()] = {verdict, form[kFormUuidKey]};
+    }
+  };
+  if (replaces.isArray()) {
+    for (const Value& identifier : replaces.array()) replace(identifier);
+  } else {
+    replace(replaces);
+  }
+}
+
+bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict) {
+  const DRDPlugIn& p = *candidate;
+  const std::string identifier = p.identifier().value_or("");
+  const std::string version = p.version().value_or("");
+  for (auto it = accepted_.begin(); it != accepted_.end(); ++it) {
+    const Value& e = it->form;
+    if (e[kFormIdentifierKey].stringValue() != identifier || !e[kFormIdentifierKey].isString()) {
+      continue;
+    }
+    const int order = compareVersionString(version, e[kFormVersionKey].stringValue());
+    const bool fresher = (p.onSystemVolume() && !(e[kFormSystemResidentKey].isBool() &&
+                                                  e[kFormSystemResidentKey].boolValue()))
+                             ? true
+                             : p.lastModified() > e[kFormLastModifiedKey].intValue();
+    bool replaceExisting;
+    if (flags_ & DRDiscoverAllVersions) {
+      if ((flags_ & DRDiscoverDuplicates) || order != 0) continue;  // both stay
+      replaceExisting = fresher;
+    } else if (order == 0) {
+      replaceExisting = fresher;
+    } else {
+      replaceExisting = order > 0;
+    }
+    if (!replaceExisting) {
+      setOutcome(verdict, DiscoveryOutcome::kSuperseded, {}, it->plugIn);
+      return false;
+    }
+    setOutcome(it->verdict, DiscoveryOutcome::kSuperseded, {}, candidate);
+    accepted_.erase(it);
+    return true;
+  }
+  return true;
+}
+
+Value Discovery::finish() {
+  if (!replacements_.empty()) {
+    for (Accepted& a : accepted_) {
+      auto found = replacements_.find(a.form[kFormIdentifierKey].stringValue());
+      if (found == replacements_.end() || !a.form[kFormIdentifierKey].isString()) continue;
+      const Replacer& r = found->second;
+      a.form = a.form.changing(kOverriderFormKey, r.uuid);
+      // The replacer's own form, when it is still among the accepted ones.
+      for (Accepted& replacer : accepted_) {
+        if (replacer.verdict == r.verdict) {
+          replacer.form = replacer.form.changing(kOverridingFormKey, a.form[kFormIdentifierKey]);
+        }
+      }
+    }
+  }
+  Array matches;
+  const pid_t pid = host_.client->pid();
+  for (const Accepted& a : accepted_) {
+    if (services_.mayUse && !services_.mayUse(a.form)) {
+      debug(Format("client %d plugin %@ rejected by Keeper", pid, a.form[kFormIdentifierKey]));
+      setOutcome(a.verdict, DiscoveryOutcome::kVetoed);
+      continue;
+    }
+    matches.push_back(a.form);
+  }
+  return Value(std::move(matches));
+}
+
+}  // namespace dr

@@ -1,0 +1,199 @@
+#include "tests/integration/world.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <thread>
+
+#include <gtest/gtest.h>
+
+namespace dr::testing {
+namespace {
+
+constexpr const char* kServiceName = "com.corvel.dromon.drd";
+constexpr uint64_t kCallFailed = 99999;
+constexpr uint64_t kDiscoverAll = 0x200;
+
+std::string RelayBinary() {
+  std::string tests = DrdProcess::BinaryPath();
+  tests = tests.substr(0, tests.rfind('/'));      // build/<dir>/daemon
+  tests = tests.substr(0, tests.rfind('/') + 1);  // build/<dir>/
+  return tests + "tests/drd_relay_host";
+}
+
+void CopyExecutable(const std::string& from, const std::string& to) {
+  std::filesystem::create_directories(std::filesystem::path(to).parent_path());
+  std::filesystem::copy_file(from, to, std::filesystem::copy_options::overwrite_existing);
+  ::chmod(to.c_str(), 0755);
+}
+
+}  // namespace
+
+Value Request(const std::string& name, Dictionary fields) {
+  fields["request"] = Value(name);
+  fields["version"] = Value(uint64_t{2});
+  return Value(std::move(fields));
+}
+
+uint64_t ErrorCode(const Value& reply) { return reply["errorcode"].uintValue(); }
+std::string ErrorText(const Value& reply) { return reply["error"].stringValue(); }
+
+HostApp::HostApp(const std::string& appPath, const std::string& executable,
+                 const std::string& drdSocket, const std::string& relayFolder) {
+  const std::string program = appPath + "/Contents/Exec/" + executable;
+  CopyExecutable(RelayBinary(), program);
+  std::filesystem::create_directories(relayFolder);
+  const std::string relaySocket = relayFolder + "/" + kServiceName;
+  int out[2];
+  if (::pipe2(out, O_CLOEXEC) != 0) return;
+  pid_ = ::fork();
+  if (pid_ == 0) {
+    ::dup2(out[1], STDOUT_FILENO);
+    ::execl(program.c_str(), program.c_str(), drdSocket.c_str(), relaySocket.c_str(), nullptr);
+    ::_exit(127);
+  }
+  ::close(out[1]);
+  char line[16] = {};
+  ssize_t n = ::read(out[0], line, sizeof line - 1);  // "ready" once it listens
+  ::close(out[0]);
+  if (n <= 0) return;
+  Result<std::unique_ptr<client::Connection>> c =
+      client::Connection::Open(kServiceName, relayFolder);
+  if (c) connection_ = std::move(*c);
+}
+
+HostApp::~HostApp() { kill(); }
+
+void HostApp::kill() {
+  connection_.reset();
+  if (pid_ > 0) {
+    ::kill(pid_, SIGKILL);
+    ::waitpid(pid_, nullptr, 0);
+    pid_ = -1;
+  }
+}
+
+World::World() { std::filesystem::create_directories(root_ / "system"); }
+
+bool World::start(std::vector<std::string> environment) {
+  environment_ = std::move(environment);
+  drd_ = std::make_unique<DrdProcess>(root_.path(), std::vector<std::string>{"-v"}, environment_);
+  return drd_->waitUntilServing();
+}
+
+bool World::restart() {
+  manager_.reset();
+  drd_->signal(SIGTERM);
+  if (drd_->waitForExit() != 0) return false;
+  return start(environment_);
+}
+
+std::unique_ptr<client::Connection> World::connect() const {
+  Result<std::unique_ptr<client::Connection>> c =
+      client::Connection::Open(kServiceName, root_ / "sockets");
+  return c ? std::move(*c) : nullptr;
+}
+
+Value World::call(const Value& request, client::Connection* connection) const {
+  std::unique_ptr<client::Connection> own;
+  if (!connection) {
+    own = connect();
+    connection = own.get();
+  }
+  if (!connection) return Value{{"errorcode", Value(kCallFailed)}, {"error", "no connection"}};
+  Result<Value> reply = connection->request(request, std::chrono::seconds(20));
+  if (!reply) {
+    return Value{{"errorcode", Value(kCallFailed)}, {"error", reply.error().description()}};
+  }
+  return *reply;
+}
+
+std::string World::makeApp(const std::string& path, const std::string& id,
+                           const Value& entitlements) const {
+  return registry_test::MakeBundle(root_ / path,
+                                   Value{{"BNBundleIdentifier", Value(id)},
+                                         {"BNBundleVersion", "1.0"},
+                                         {"BNBundleExecutable", "host"},
+                                         {"BNBundleName", Value(id)}},
+                                   entitlements);
+}
+
+std::string World::makePlugIn(const std::string& path, const std::string& id,
+                              const std::string& version, const Dictionary& extra,
+                              const Value& entitlements) const {
+  // Plug-ins must run sandboxed to be admitted.
+  Dictionary granted = entitlements.dictionary();
+  granted["com.corvel.security.app-sandbox"] = Value(true);
+  Dictionary plugIn = extra;
+  plugIn["UXExtensionPointIdentifier"] = Value("com.example.point");
+  plugIn["UXExtensionAttributes"] =
+      Value{{"UXExtensionIdentifier", Value(id)}, {"UXExtensionPointName", "com.example.point"}};
+  const std::string bundle =
+      registry_test::MakeBundle(root_ / path,
+                                Value{{"BNBundleIdentifier", Value(id + ".bundle")},
+                                      {"BNBundleVersion", Value(version)},
+                                      {"BNBundleExecutable", "run"},
+                                      {"UXExtension", Value(std::move(plugIn))}},
+                                Value(std::move(granted)));
+  registry_test::WriteBytes(bundle + "/Contents/Exec/run", "#!/bin/sh\nexec sleep 60\n");
+  ::chmod((bundle + "/Contents/Exec/run").c_str(), 0755);
+  return bundle;
+}
+
+Value World::add(const std::vector<std::string>& paths) const {
+  Array list;
+  for (const std::string& p : paths) list.emplace_back(p);
+  return call(Request("add", {{"paths", Value(std::move(list))}}));
+}
+
+Value World::match(const Value& rules, uint64_t flags, client::Connection* connection) const {
+  Dictionary fields{{"flags", Value(flags)}};
+  if (rules.isPresent()) fields["rules"] = rules;
+  Value reply = call(Request("match", std::move(fields)), connection);
+  EXPECT_EQ(ErrorCode(reply), 0u) << ErrorText(reply);
+  return reply["matches"];
+}
+
+std::string World::Identifiers(const Value& matches) {
+  std::string text;
+  for (const Value& form : matches.array()) {
+    if (!text.empty()) text += ' ';
+    text += form["identifier"].stringValue();
+  }
+  return text;
+}
+
+Value World::everything() const {
+  if (!manager_) {
+    makeApp("Manager.app", "com.example.manager",
+            Value{{"com.corvel.private.dromon.manager", true}});
+    manager_ = host("Manager.app");
+  }
+  return match(Value(), kDiscoverAll, manager_->connection());
+}
+
+Value World::uuidOf(const std::string& id) const {
+  const Value forms = everything();
+  for (const Value& form : forms.array()) {
+    if (form["identifier"].stringValue() == id) {
+      return Value(Uuid::parse(form["uuid"].stringValue()));  // forms carry the text
+    }
+  }
+  ADD_FAILURE() << "no plug-in " << id << " registered";
+  return Value();
+}
+
+std::unique_ptr<HostApp> World::host(const std::string& app) const {
+  static int count = 0;
+  auto h = std::make_unique<HostApp>(root_ / app, "host", drd_->socketPath(),
+                                     root_ / ("relay" + std::to_string(++count)));
+  EXPECT_NE(h->connection(), nullptr) << "host " << app << " did not connect";
+  return h;
+}
+
+}  // namespace dr::testing
