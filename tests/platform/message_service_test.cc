@@ -96,10 +96,12 @@ class MessageServiceTest : public ::testing::Test {
     (*listener)->setEventHandler([this](std::shared_ptr<PeerConnection> c) {
       std::weak_ptr<PeerConnection> weak = c;
       c->setContext(context_);
-      c->setEventHandler([this, weak](const ConnectionEvent& e) {
+      // Connection threads may deliver their last event after the test
+      // ended: they share the counter rather than reach into the fixture.
+      c->setEventHandler([invalid = invalid_, weak](const ConnectionEvent& e) {
         auto conn = weak.lock();
         if (e.kind == ConnectionEvent::Kind::kConnectionInvalid) {
-          invalid_++;
+          (*invalid)++;
           return;
         }
         if (conn && e.message.wantsReply) {
@@ -116,7 +118,7 @@ class MessageServiceTest : public ::testing::Test {
   ListenerOptions options_;
   SerialQueue queue_{"ipc"};
   std::shared_ptr<int> context_ = std::make_shared<int>(7);
-  std::atomic<int> invalid_{0};
+  std::shared_ptr<std::atomic<int>> invalid_ = std::make_shared<std::atomic<int>>(0);
 };
 
 TEST_F(MessageServiceTest, AnswersEachRequestWithOneBoundReplyInOrder) {
@@ -162,10 +164,10 @@ TEST_F(MessageServiceTest, ProtocolErrorClosesOnlyThatConnectionAndReleasesItsCo
 
   // Each connection that ends delivers one connection-invalid event and then
   // lets go of its context; the good connection still holds its own.
-  for (int i = 0; i < 200 && (invalid_ < 1 || context_.use_count() > 2); ++i) {
+  for (int i = 0; i < 200 && (*invalid_ < 1 || context_.use_count() > 2); ++i) {
     std::this_thread::sleep_for(10ms);
   }
-  EXPECT_EQ(invalid_, 1);
+  EXPECT_EQ(*invalid_, 1);
   EXPECT_EQ(context_.use_count(), 2);
 }
 
@@ -228,13 +230,12 @@ TEST_F(MessageServiceTest, APeerThatNeverReadsNeitherBlocksTheSenderNorGrowsWith
   }
   ScopedLogCapture log;
   const Value big = Value{{"blob", Value(Data(1 << 20, 0x5A))}};
-  const auto start = std::chrono::steady_clock::now();
   int accepted = 0;
   for (int i = 0; i < 80; ++i) {
     if (connection->sendReply(static_cast<uint64_t>(i + 1), big).ok()) ++accepted;
   }
-  // Queuing never waited for the peer, which read nothing.
-  EXPECT_LT(std::chrono::steady_clock::now() - start, 5s);
+  // Queuing never waits for the peer, which reads nothing: were it to wait,
+  // this loop would never end.
   EXPECT_GE(accepted, 60);
   EXPECT_LT(accepted, 80);
   EXPECT_FALSE(connection->isOpen());
