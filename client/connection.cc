@@ -7,9 +7,32 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <mutex>
+#include <optional>
 #include <string_view>
 
+#include "platform/drm1.h"
+#include "platform/locations.h"
+
 namespace dr::client {
+
+struct Connection::State {
+  explicit State(int fd) : fd(fd) {}
+  ~State() {
+    if (fd >= 0) ::close(fd);
+  }
+
+  Result<uint64_t> write(const Value& message, uint32_t flags,
+                         std::chrono::steady_clock::time_point deadline);
+  Status fail(int64_t code, std::string description);
+
+  std::mutex mu;
+  int fd;                          // guarded by mu; -1 once dead
+  std::optional<Error> deadError;  // guarded by mu: why the connection died
+  uint64_t nextSerial = 1;         // guarded by mu
+  drm1::FrameDecoder decoder;      // guarded by mu
+};
+
 namespace {
 
 using Clock = std::chrono::steady_clock;
@@ -31,6 +54,8 @@ Error ClientError(int64_t code, std::string description) {
 }
 
 }  // namespace
+
+std::string DefaultSocketDirectory() { return SocketDirectory(); }
 
 Result<std::unique_ptr<Connection>> Connection::Open(const std::string& serviceName,
                                                      const std::string& socketDirectory) {
@@ -57,42 +82,40 @@ Result<std::unique_ptr<Connection>> Connection::Open(const std::string& serviceN
   return std::unique_ptr<Connection>(new Connection(fd));
 }
 
-Connection::Connection(int fd) : fd_(fd) {}
+Connection::Connection(int fd) : state_(std::make_unique<State>(fd)) {}
 
-Connection::~Connection() {
-  if (fd_ >= 0) ::close(fd_);
-}
+Connection::~Connection() = default;
 
 bool Connection::isOpen() const {
-  std::lock_guard<std::mutex> lock(mu_);
-  return fd_ >= 0;
+  std::lock_guard<std::mutex> lock(state_->mu);
+  return state_->fd >= 0;
 }
 
-Status Connection::fail(int64_t code, std::string description) {
-  if (fd_ >= 0) ::close(fd_);
-  fd_ = -1;
-  deadError_ = ClientError(code, std::move(description));
-  return *deadError_;
+Status Connection::State::fail(int64_t code, std::string description) {
+  if (fd >= 0) ::close(fd);
+  fd = -1;
+  deadError = ClientError(code, std::move(description));
+  return *deadError;
 }
 
-Result<uint64_t> Connection::write(const Value& message, uint32_t flags,
-                                   Clock::time_point deadline) {
-  if (fd_ < 0) return *deadError_;
-  const uint64_t serial = nextSerial_;
+Result<uint64_t> Connection::State::write(const Value& message, uint32_t flags,
+                                          Clock::time_point deadline) {
+  if (fd < 0) return *deadError;
+  const uint64_t serial = nextSerial;
   Result<std::string> frame = drm1::EncodeFrame(serial, 0, flags, message);
   if (!frame) return frame.error();
-  ++nextSerial_;
+  ++nextSerial;
   const std::string& bytes = *frame;
   size_t sent = 0;
   while (sent < bytes.size()) {
-    ssize_t n = ::send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+    ssize_t n = ::send(fd, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n > 0) {
       sent += static_cast<size_t>(n);
       continue;
     }
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
-      struct pollfd p = {fd_, POLLOUT, 0};
+      struct pollfd p = {fd, POLLOUT, 0};
       int ready = ::poll(&p, 1, MillisecondsLeft(deadline));
       if (ready < 0 && errno == EINTR) continue;
       if (ready > 0) continue;
@@ -107,20 +130,21 @@ Result<uint64_t> Connection::write(const Value& message, uint32_t flags,
 }
 
 Status Connection::send(const Value& message, std::chrono::milliseconds timeout) {
-  std::lock_guard<std::mutex> lock(mu_);
-  Result<uint64_t> serial = write(message, 0, DeadlineAfter(timeout));
+  std::lock_guard<std::mutex> lock(state_->mu);
+  Result<uint64_t> serial = state_->write(message, 0, DeadlineAfter(timeout));
   return serial.status();
 }
 
 Result<Value> Connection::request(const Value& message, std::chrono::milliseconds timeout) {
-  std::lock_guard<std::mutex> lock(mu_);
+  State& s = *state_;
+  std::lock_guard<std::mutex> lock(s.mu);
   const Clock::time_point deadline = DeadlineAfter(timeout);
-  Result<uint64_t> serial = write(message, drm1::kFlagWantsReply, deadline);
+  Result<uint64_t> serial = s.write(message, drm1::kFlagWantsReply, deadline);
   if (!serial) return serial.error();
   for (;;) {
-    Result<std::optional<drm1::Frame>> frame = decoder_.next();
+    Result<std::optional<drm1::Frame>> frame = s.decoder.next();
     if (!frame) {
-      return fail(kProtocolError, "protocol error from drd: " + frame.error().description());
+      return s.fail(kProtocolError, "protocol error from drd: " + frame.error().description());
     }
     if (frame->has_value()) {
       drm1::Frame& f = **frame;
@@ -129,23 +153,23 @@ Result<Value> Connection::request(const Value& message, std::chrono::millisecond
       if (f.header.isReply() && f.header.replyTo == *serial) return std::move(f.body);
       continue;
     }
-    struct pollfd p = {fd_, POLLIN, 0};
+    struct pollfd p = {s.fd, POLLIN, 0};
     int ready = ::poll(&p, 1, MillisecondsLeft(deadline));
     if (ready < 0 && errno == EINTR) continue;
-    if (ready < 0) return fail(kConnectionClosed, PosixError(errno, "poll").description());
+    if (ready < 0) return s.fail(kConnectionClosed, PosixError(errno, "poll").description());
     if (ready == 0) {
       return ClientError(kTimeout,
                          "no reply from drd within " + std::to_string(timeout.count()) + " ms");
     }
     char buffer[65536];
-    ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
+    ssize_t n = ::recv(s.fd, buffer, sizeof buffer, 0);
     if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
-    if (n == 0) return fail(kConnectionClosed, "connection closed by drd");
+    if (n == 0) return s.fail(kConnectionClosed, "connection closed by drd");
     if (n < 0) {
-      return fail(kConnectionClosed,
-                  "connection closed by drd (" + std::string(std::strerror(errno)) + ")");
+      return s.fail(kConnectionClosed,
+                    "connection closed by drd (" + std::string(std::strerror(errno)) + ")");
     }
-    decoder_.feed(std::string_view(buffer, static_cast<size_t>(n)));
+    s.decoder.feed(std::string_view(buffer, static_cast<size_t>(n)));
   }
 }
 

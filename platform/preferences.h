@@ -28,6 +28,10 @@ struct PreferencesOptions {
 // /etc/machine-id without surrounding white space, else the host name.
 PreferencesOptions PreferencesOptionsFromEnvironment(const EnvironmentLookup& getenv = nullptr);
 
+// The file of `domain` for the current user and host (for the programs that
+// write preferences); empty when `domain` cannot name a file.
+std::string CurrentHostPreferencesFile(const PreferencesOptions& options, std::string_view domain);
+
 class Preferences {
  public:
   virtual ~Preferences() = default;

@@ -46,9 +46,8 @@ class FilePreferences final : public Preferences {
   void synchronizeCurrentHost(std::string_view) override {}
 
   Value copyCurrentHostValue(std::string_view key, std::string_view domain) override {
-    if (!UsableDomain(domain)) return Value();
-    std::string path = options_.directory + kHostFolder + std::string(domain) + "." +
-                       options_.hostId + kPdocSuffix;
+    std::string path = CurrentHostPreferencesFile(options_, domain);
+    if (path.empty()) return Value();
     Result<std::string> bytes = fs_->readFile(path, kMaxPreferencesBytes);
     if (!bytes.ok()) {
       if (bytes.error().code() != kFileReadNoSuchFileError) logBroken(path, bytes.error());
@@ -97,6 +96,11 @@ PreferencesOptions PreferencesOptionsFromEnvironment(const EnvironmentLookup& ge
   }
   if (options.hostId.empty()) options.hostId = "localhost";
   return options;
+}
+
+std::string CurrentHostPreferencesFile(const PreferencesOptions& options, std::string_view domain) {
+  if (!UsableDomain(domain)) return std::string();
+  return options.directory + kHostFolder + std::string(domain) + "." + options.hostId + kPdocSuffix;
 }
 
 std::unique_ptr<Preferences> MakeFilePreferences(PreferencesOptions options, FileSystem* fs) {

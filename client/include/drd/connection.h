@@ -10,6 +10,9 @@
 // Threads: a Connection may be used from any thread; calls are serialized,
 // so one request waits for the one before it to finish.
 //
+// Errors are dr::Error values (core/status.h, installed with this header)
+// and messages are dr::Value dictionaries (core/value.h).
+//
 // Failure: every failure is a returned error, never an exception or a
 // signal. Connecting fails with the system's error (a missing socket means
 // drd is not running under that name). Once drd closes the connection, or
@@ -24,15 +27,11 @@
 #include <chrono>
 #include <cstdint>
 #include <memory>
-#include <mutex>
-#include <optional>
 #include <string>
 
-#include "client/include/drd/export.h"
 #include "core/status.h"
 #include "core/value.h"
-#include "platform/drm1.h"
-#include "platform/locations.h"
+#include "export.h"
 
 namespace dr::client {
 
@@ -44,11 +43,15 @@ inline constexpr int64_t kTimeout = 3;           // no reply (or no room to send
 inline constexpr const char* kDefaultServiceName = "com.corvel.dromon.drd";
 inline constexpr std::chrono::milliseconds kDefaultTimeout{30000};
 
+// The folder of drd's sockets for this user: $DR_SOCKET_DIR, else
+// $XDG_RUNTIME_DIR/dromon, else /tmp/dromon-<uid>.
+DRD_EXPORT std::string DefaultSocketDirectory();
+
 class DRD_EXPORT Connection {
  public:
   static Result<std::unique_ptr<Connection>> Open(
       const std::string& serviceName = kDefaultServiceName,
-      const std::string& socketDirectory = SocketDirectory());
+      const std::string& socketDirectory = DefaultSocketDirectory());
   ~Connection();
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
@@ -62,16 +65,10 @@ class DRD_EXPORT Connection {
   bool isOpen() const;
 
  private:
+  struct State;  // the socket and the frame decoder, kept out of this header
   explicit Connection(int fd);
-  Result<uint64_t> write(const Value& message, uint32_t flags,
-                         std::chrono::steady_clock::time_point deadline);
-  Status fail(int64_t code, std::string description);
 
-  mutable std::mutex mu_;
-  int fd_;                          // guarded by mu_; -1 once dead
-  std::optional<Error> deadError_;  // guarded by mu_: why the connection died
-  uint64_t nextSerial_ = 1;         // guarded by mu_
-  drm1::FrameDecoder decoder_;      // guarded by mu_
+  std::unique_ptr<State> state_;
 };
 
 }  // namespace dr::client
