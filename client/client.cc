@@ -2,25 +2,14 @@
 
 #include <utility>
 
+#include "platform/message_keys.h"
+
 namespace dr::client {
 namespace {
 
-// The protocol's keys and the request names drd serves.
-constexpr const char* kRequestKey = "request";
-constexpr const char* kVersionKey = "version";
-constexpr const char* kPathsKey = "paths";
-constexpr const char* kUuidsKey = "uuids";
-constexpr const char* kFlagsKey = "flags";
-constexpr const char* kRulesKey = "rules";
-constexpr const char* kAnnotationsKey = "annotations";
-constexpr const char* kMatchesKey = "matches";
-constexpr const char* kExtensionsKey = "extensions";
-constexpr const char* kConflictsKey = "conflicts";
-constexpr const char* kErrorCodeKey = "errorcode";
-constexpr const char* kErrorKey = "error";
-constexpr const char* kElectionKey = "election";
-constexpr const char* kSettingsKey = "extension";
-constexpr uint64_t kProtocolVersion = 2;
+using namespace message;
+
+constexpr const char* kSettingsKey = message::kExtensionKey;
 
 Error UnexpectedReply(std::string_view request, const Value& reply) {
   return Error(

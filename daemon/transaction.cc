@@ -13,6 +13,7 @@
 #include "daemon/ipc_client.h"
 #include "daemon/server.h"
 #include "model/plugin_keys.h"
+#include "platform/message_keys.h"
 #include "platform/pdoc.h"
 #include "platform/probes.h"
 #include "store/extension_issuing.h"
@@ -20,21 +21,9 @@
 namespace dr {
 namespace {
 
-constexpr const char* kRequestKey = "request";
-constexpr const char* kVersionKey = "version";
-constexpr const char* kPathsKey = "paths";
-constexpr const char* kUuidsKey = "uuids";
-constexpr const char* kErrorCodeKey = "errorcode";
-constexpr const char* kErrorKey = "error";
+using namespace message;
+
 constexpr const char* kUnrecognizedRequest = "unrecognized request";
-constexpr const char* kFlagsKey = "flags";
-constexpr const char* kRulesKey = "rules";
-constexpr const char* kAnnotationsKey = "annotations";
-constexpr const char* kMatchesKey = "matches";
-constexpr const char* kExtensionsKey = "extensions";
-constexpr const char* kConflictsKey = "conflicts";
-constexpr const char* kElectionKey = "election";
-constexpr const char* kExtensionKey = "extension";
 constexpr const char* kOnHoldReason = "the plug-in is on hold";
 
 // The "flags" of a hold request: what each path names.

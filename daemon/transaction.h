@@ -33,9 +33,6 @@ inline constexpr uint64_t kErrorBadPath = 9;       // relative, unresolvable or 
 inline constexpr uint64_t kErrorNotPermitted = 11;
 inline constexpr uint64_t kErrorBusy = 14;
 
-// The one protocol version served.
-inline constexpr uint64_t kProtocolVersion = 2;
-
 class Transaction {
  public:
   // Called per path: the canonical path and true, or the path as given and
