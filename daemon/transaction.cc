@@ -197,6 +197,11 @@ void Transaction::done() {
   Status sent = c->sendReply(request_.serial, reply_);
   if (!sent.ok() && c->isOpen()) {
     server().log("unable to reply to client %d: %@", client_->pid(), sent);
+    // A reply the wire cannot carry (nested too deeply or too large, say
+    // from a plug-in's own dictionaries) still answers the request.
+    c->sendReply(request_.serial,
+                 Value{{kErrorCodeKey, Value(kErrorMalformed)},
+                       {kErrorKey, Value(Format("reply cannot be sent: %@", sent))}});
   }
 }
 

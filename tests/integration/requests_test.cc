@@ -195,6 +195,23 @@ TEST_F(RequestsTest, OneCopyPerIdentifierUnlessAllVersionsAreAsked) {
   EXPECT_EQ(w.match(Value(), kAllVersions).size(), 2u);
 }
 
+// Bundles may nest deeper than a message can: a discovery that would carry
+// such a dictionary is still answered, and the connection goes on serving.
+TEST_F(RequestsTest, ReplyTooDeepForTheWireIsAnsweredWithAnError) {
+  Value deep = Value("bottom");
+  for (int level = 0; level < 70; ++level) deep = Value(Array{deep});
+  ASSERT_EQ(ErrorCode(w.add(
+                {w.makePlugIn("system/deep.appex", "com.example.deep", "1.0", {{"Deep", deep}})})),
+            0u);
+  std::unique_ptr<client::Connection> c = w.connect();
+  for (int i = 0; i < 70; ++i) {  // more than a connection may leave unanswered
+    Value reply = w.call(Request("match"), c.get());
+    ASSERT_EQ(ErrorCode(reply), 4u) << i;
+    ASSERT_TRUE(ErrorText(reply).starts_with("reply cannot be sent: ")) << ErrorText(reply);
+  }
+  EXPECT_EQ(ErrorCode(w.call(Request("bulk"), c.get())), 0u);
+}
+
 TEST_F(RequestsTest, ReplacementIsMarkedOnBothForms) {
   w.add({w.makePlugIn("system/old.appex", "com.example.old"),
          w.makePlugIn("system/new.appex", "com.example.new", "1.0", {},
