@@ -20,9 +20,10 @@ Value dictionaryChangingTo(const Value& dictionary, std::string_view key, const 
 // the same, +1 when after. Runs of decimal digits compare by numeric value
 // (so 1.10 is after 1.9, and 01 equals 1); other characters compare by code
 // point, case-sensitively (A before a), after canonical decomposition, so
-// canonically equivalent sequences are equal; when one string is a proper
-// prefix of the other, the shorter comes first. Text that is not UTF-8 is
-// compared byte by byte where it cannot be decoded.
+// canonically equivalent sequences are equal; a digit of any script meeting
+// another character orders as an ASCII digit would; when one string is a
+// proper prefix of the other, the shorter comes first. Bytes that are not
+// UTF-8 read as U+FFFD. The order is total: antisymmetric and transitive.
 int compareVersionString(std::string_view a, std::string_view b);
 
 }  // namespace dr

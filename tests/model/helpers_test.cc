@@ -31,11 +31,20 @@ TEST(CompareVersionStringTest, OrdersVersions) {
       {"123456789012345678901234567890", "123456789012345678901234567891", -1},
       {"2", "1a", 1},
       {"1a2", "1a10", -1},
+      // Strings that part inside a digit run compare the whole run.
+      {"v1.100", "v1.19", 1},
+      {"x01", "x001", 0},
       // Canonically equivalent: precomposed e-acute and e + combining acute.
       {"caf\xc3\xa9", "cafe\xcc\x81", 0},
       {"1.\xc3\xa9", "1.f", -1},
       // Full-width digits are digits too.
       {"\xef\xbc\x91\xef\xbc\x90", "9", 1},
+      // Against other characters a digit of any script orders like an ASCII
+      // digit; by code point, U+0662 < "3" < "Z" < U+0662 would be a cycle.
+      {"\xd9\xa2", "3", -1},
+      {"\xd9\xa2", "Z", -1},
+      {"c", "\xef\xbc\x91", 1},
+      {"\xef\xbc\x91'", "1|", -1},
   };
   for (const Row& r : rows) {
     EXPECT_EQ(compareVersionString(r.a, r.b), r.expected) << r.a << " vs " << r.b;
