@@ -93,6 +93,13 @@ bool World::restart() {
   return start(environment_);
 }
 
+bool World::kill9() {
+  manager_.reset();
+  drd_->signal(SIGKILL);
+  drd_->waitForExit();
+  return start(environment_);
+}
+
 std::unique_ptr<client::Connection> World::connect() const {
   Result<std::unique_ptr<client::Connection>> c =
       client::Connection::Open(kServiceName, root_ / "sockets");

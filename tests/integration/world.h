@@ -52,6 +52,9 @@ class World {
   bool start(std::vector<std::string> environment = {});
   // SIGTERM, wait, start again with the same environment.
   bool restart();
+  // SIGKILL (a crash: no clean-up runs), reap, start again with the same
+  // environment.
+  bool kill9();
 
   const std::string& root() const { return root_.path(); }
   std::string path(const std::string& relative) const { return root_ / relative; }
