@@ -1,0 +1,686 @@
+// drd's end-to-end load program: starts the built drd in a fresh temporary
+// environment, drives it through the client library and prints its speed,
+// scale and memory figures beside a floor (a DRM1 echo over a Unix socket)
+// and a peer (a D-Bus method call through a private dbus-daemon) carrying
+// messages of the same sizes.
+//
+//   load [--drd PATH] [--smoke] [--results FILE] [--micro FILE] [--only W1,W2,...]
+//        [--keep]
+//
+//   --drd      the drd binary (default: ../daemon/drd beside this program)
+//   --smoke    every workload once with tiny sizes (seconds; for CI)
+//   --results  also write the figures as Markdown to FILE; text after the
+//              line "<!-- notes -->" in an existing FILE is kept
+//   --micro    with --results: the micro-benchmarks' output, shown there too
+//   --only     run only the named workloads (W4 and W5 need W2)
+//   --keep     keep the temporary folder (drd's logs) for inspection
+//
+// Workloads (bench/README.md says what each figure means):
+//   W1 "lock" releasing an unknown token: latency on one connection and
+//      throughput of 8 concurrent clients
+//   W2 "match" for one extension point among 10,000 registered plug-ins
+//   W3 "match" without rules listing all of 1,000 plug-ins, with tokens
+//   W4 drd start to the first W2 reply, 10,000 registered
+//   W5 drd's peak resident set (VmHWM) after W2 and after W3
+//   W6 one "annotate" with 1,000 annotated plug-ins in the file, against
+//      writing, syncing and renaming a file of the same size
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/utsname.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+#include <filesystem>
+#include <fstream>
+#include <latch>
+#include <optional>
+#include <set>
+#include <sstream>
+
+#include "bench/load.h"
+#include "client/include/drd/connection.h"
+#include "platform/drm1.h"
+
+namespace drbench {
+namespace {
+
+using dr::Array;
+using dr::Value;
+using dr::client::Connection;
+
+constexpr const char* kServiceName = "com.corvel.dromon.drd";
+constexpr std::chrono::seconds kRequestTimeout{120};
+constexpr const char* kNotesMarker = "<!-- notes -->";
+
+struct Sizes {
+  int w1Warmup, w1Requests, w1Clients;
+  int w2Apps, w2Points, w2PerPoint, w2Requests;
+  int w3Apps, w3Points, w3PerPoint, w3Requests;
+  int w4Runs;
+  int w6Requests;
+  int rounds;  // drd, the floor and D-Bus take turns this many times
+};
+constexpr Sizes kFull = {1000, 20000, 8, 50, 100, 100, 1000, 10, 10, 100, 100, 5, 40, 10};
+constexpr Sizes kSmoke = {10, 200, 8, 2, 3, 4, 6, 2, 2, 5, 4, 1, 2, 2};
+
+struct Options {
+  std::string drd;
+  bool smoke = false;
+  std::string results;
+  std::string micro;
+  std::set<std::string> only;
+  bool keep = false;
+  bool runs(const std::string& w) const { return only.empty() || only.count(w) > 0; }
+};
+
+// One line of the report.
+struct Row {
+  std::string workload, figure, drd, floor, dbus, target, verdict;
+};
+
+std::string Fixed(double v, int decimals) {
+  char buffer[64];
+  std::snprintf(buffer, sizeof buffer, "%.*f", decimals, v);
+  return buffer;
+}
+
+// A latency for people: µs below 10 ms, ms above.
+std::string Latency(double us) {
+  if (us < 10000) return Fixed(us, us < 100 ? 1 : 0) + " µs";
+  return Fixed(us / 1000, 1) + " ms";
+}
+
+std::string Verdict(bool judged, bool met) {
+  if (!judged) return "—";
+  return met ? "met" : "MISSED";
+}
+
+std::string Mib(long kib) { return Fixed(static_cast<double>(kib) / 1024, 1) + " MiB"; }
+
+Value Envelope(const char* request) {
+  return Value{{"request", request}, {"version", uint64_t{2}}};
+}
+
+// One request that must succeed.
+Value Ask(Connection& c, const Value& message, const std::string& what) {
+  dr::Result<Value> reply = c.request(message, kRequestTimeout);
+  if (!reply) Die(what + ": " + reply.error().description());
+  if (reply->has("errorcode")) {
+    Die(what + ": drd answered error " + std::to_string((*reply)["errorcode"].intValue()) + " \"" +
+        (*reply)["error"].stringValue() + "\"");
+  }
+  return std::move(reply).value();
+}
+
+std::unique_ptr<Connection> Open(const std::string& folder,
+                                 const std::string& name = kServiceName) {
+  auto c = Connection::Open(name, folder);
+  if (!c) Die("cannot connect to " + folder + "/" + name + ": " + c.error().description());
+  return std::move(c).value();
+}
+
+size_t FrameSize(const Value& body) {
+  auto frame = dr::drm1::EncodeFrame(1, 0, dr::drm1::kFlagWantsReply, body);
+  if (!frame) Die("cannot encode a frame");
+  return frame->size();
+}
+
+Samples Measure(int warmup, int count, const std::function<void()>& once) {
+  for (int i = 0; i < warmup; ++i) once();
+  Samples s;
+  s.micros.reserve(static_cast<size_t>(count));
+  for (int i = 0; i < count; ++i) {
+    Clock::time_point t0 = Clock::now();
+    once();
+    s.add(Micros(t0, Clock::now()));
+  }
+  return s;
+}
+
+Row CpuRow(const Samples& s) {
+  return {"", "drd CPU per request (mean)", Latency(s.cpuMicros), "", "", "", ""};
+}
+
+// Requests per second of `clients` threads, each with its own connection
+// made by `connect` (which answers the per-request operation), sending
+// `perClient` requests one after another.
+double Throughput(int clients, int perClient,
+                  const std::function<std::function<void()>()>& connect) {
+  std::latch ready(clients + 1);
+  std::latch go(1);
+  std::vector<std::thread> threads;
+  for (int t = 0; t < clients; ++t) {
+    threads.emplace_back([&] {
+      std::function<void()> once = connect();
+      for (int i = 0; i < perClient / 10; ++i) once();  // warm the connection
+      ready.count_down();
+      go.wait();
+      for (int i = 0; i < perClient; ++i) once();
+    });
+  }
+  ready.arrive_and_wait();
+  Clock::time_point t0 = Clock::now();
+  go.count_down();
+  for (std::thread& t : threads) t.join();
+  double seconds = Micros(t0, Clock::now()) / 1e6;
+  return static_cast<double>(clients) * perClient / seconds;
+}
+
+std::string Rate(double perSecond) {
+  if (perSecond >= 10000) return Fixed(perSecond / 1000, 1) + " k/s";
+  return Fixed(perSecond, 0) + " /s";
+}
+
+// Registers every bundle of `set`, 100 paths per "add"; answers plug-ins
+// per second.
+double Register(Connection& c, const BundleSet& set) {
+  Clock::time_point t0 = Clock::now();
+  for (size_t at = 0; at < set.plugIns.size(); at += 100) {
+    Array paths;
+    for (size_t i = at; i < std::min(set.plugIns.size(), at + 100); ++i) {
+      paths.push_back(Value(set.plugIns[i]));
+    }
+    Ask(c, Envelope("add").changing("paths", Value(std::move(paths))), "add");
+  }
+  return static_cast<double>(set.plugIns.size()) / (Micros(t0, Clock::now()) / 1e6);
+}
+
+Value MatchPoint(int point) {
+  return Envelope("match").changing("rules", Value{{"UXExtensionPointName", PointName(point)}});
+}
+
+// Latencies of drd, the floor and the peer for one exchange: drd's request,
+// and the same request answered with drd's reply by the floor and the peer.
+// They are taken in alternating rounds, so that other work on the machine
+// weighs on all three alike.
+struct Figures {
+  Samples drd, floor, dbus;
+  bool dbusAvailable = false;
+};
+Figures Compare(const Drd& drd, const std::function<void()>& drdOnce, EchoServer& echo,
+                DbusPeer& dbus, const Value& request, const Value& reply, int warmup, int count,
+                int rounds) {
+  Figures f;
+  echo.setReply(reply);
+  dbus.setReply(reply);
+  auto floor = Open(echo.folder(), echo.name());
+  std::unique_ptr<DbusPeer::Client> bus = dbus.available() ? dbus.connect() : nullptr;
+  f.dbusAvailable = bus != nullptr;
+  auto floorOnce = [&] { Ask(*floor, request, "echo"); };
+  auto busOnce = [&] { bus->call(request); };
+  for (int i = 0; i < warmup; ++i) {
+    floorOnce();
+    if (bus) busOnce();
+    drdOnce();
+  }
+  const int per = std::max(1, count / rounds);
+  double cpu = 0;
+  auto append = [](Samples& to, const Samples& from) {
+    to.micros.insert(to.micros.end(), from.micros.begin(), from.micros.end());
+  };
+  for (int r = 0; r < rounds; ++r) {
+    append(f.floor, Measure(0, per, floorOnce));
+    if (bus) append(f.dbus, Measure(0, per, busOnce));
+    const double before = drd.cpuSeconds();
+    append(f.drd, Measure(0, per, drdOnce));
+    cpu += drd.cpuSeconds() - before;
+  }
+  f.drd.cpuMicros = cpu * 1e6 / static_cast<double>(f.drd.micros.size());
+  return f;
+}
+
+// The row of one quantile of a comparison.
+Row QuantileRow(const Figures& f, double q, std::string workload, std::string figure,
+                std::string target = "", std::string verdict = "") {
+  return {std::move(workload),
+          std::move(figure),
+          Latency(f.drd.quantile(q)),
+          Latency(f.floor.quantile(q)),
+          f.dbusAvailable ? Latency(f.dbus.quantile(q)) : "n/a",
+          std::move(target),
+          std::move(verdict)};
+}
+
+// Writes `bytes` beside `target` and renames it over, with the same durable
+// steps as drd's own file writes (data synced, then the folder).
+void DurableReplace(const std::string& target, const std::string& bytes) {
+  const std::string tmp = target + ".floor";
+  int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+  if (fd < 0 || ::write(fd, bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size()) ||
+      ::fsync(fd) != 0 || ::close(fd) != 0 || ::rename(tmp.c_str(), target.c_str()) != 0) {
+    Die("floor file write failed: " + std::string(std::strerror(errno)));
+  }
+  const std::string folder = std::filesystem::path(target).parent_path().string();
+  int dir = ::open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir < 0 || ::fsync(dir) != 0) Die("floor folder sync failed");
+  ::close(dir);
+}
+
+std::string Today() {
+  std::time_t now = std::time(nullptr);
+  char buffer[64];
+  std::strftime(buffer, sizeof buffer, "%Y-%m-%d %H:%M UTC", std::gmtime(&now));
+  return buffer;
+}
+
+// The system's load averages over 1, 5 and 15 minutes.
+std::string LoadAverage() {
+  std::ifstream in("/proc/loadavg");
+  double one = 0, five = 0, fifteen = 0;
+  in >> one >> five >> fifteen;
+  return Fixed(one, 2) + " " + Fixed(five, 2) + " " + Fixed(fifteen, 2);
+}
+
+std::string Machine() {
+  std::string cpu = "unknown CPU";
+  std::ifstream info("/proc/cpuinfo");
+  for (std::string line; std::getline(info, line);) {
+    if (line.rfind("model name", 0) == 0) {
+      cpu = line.substr(line.find(':') + 2);
+      break;
+    }
+  }
+  long memKiB = 0;
+  std::ifstream mem("/proc/meminfo");
+  for (std::string line; std::getline(mem, line);) {
+    if (line.rfind("MemTotal:", 0) == 0) memKiB = std::strtol(line.c_str() + 9, nullptr, 10);
+  }
+  struct utsname u = {};
+  ::uname(&u);
+  return cpu + ", " + std::to_string(std::thread::hardware_concurrency()) + " CPUs, " +
+         Fixed(static_cast<double>(memKiB) / (1024 * 1024), 1) + " GiB RAM, Linux " + u.release;
+}
+
+void PrintTable(const std::vector<Row>& rows) {
+  std::vector<size_t> w(7, 0);
+  auto cells = [](const Row& r) {
+    return std::vector<std::string>{r.workload, r.figure, r.drd,    r.floor,
+                                    r.dbus,     r.target, r.verdict};
+  };
+  // Display width: the UTF-8 continuation bytes take no column.
+  auto width = [](const std::string& s) {
+    return static_cast<size_t>(std::count_if(
+        s.begin(), s.end(), [](char c) { return (static_cast<unsigned char>(c) & 0xC0) != 0x80; }));
+  };
+  Row head{"workload", "figure", "drd", "floor", "D-Bus", "target", "verdict"};
+  for (const Row& r : rows)
+    for (size_t i = 0; i < 7; ++i)
+      w[i] = std::max({w[i], width(cells(r)[i]), width(cells(head)[i])});
+  auto line = [&](const Row& r) {
+    std::vector<std::string> c = cells(r);
+    for (size_t i = 0; i < 7; ++i) {
+      std::printf("%s%s  ", c[i].c_str(), std::string(w[i] - width(c[i]), ' ').c_str());
+    }
+    std::printf("\n");
+  };
+  line(head);
+  for (const Row& r : rows) line(r);
+}
+
+void WriteResults(const std::string& path, const std::vector<Row>& rows, const Options& o,
+                  const std::string& machine, const std::string& sizes) {
+  std::string notes;
+  {
+    std::ifstream old(path);
+    std::stringstream text;
+    text << old.rdbuf();
+    const std::string s = text.str();
+    size_t at = s.find(kNotesMarker);
+    if (at != std::string::npos) notes = s.substr(at);
+  }
+  std::ofstream out(path, std::ios::trunc);
+  out << "# drd benchmark results\n\n"
+      << "Written by `bench/load` (`./dev bench`); bench/README.md explains each figure.\n\n"
+      << "- Date: " << Today() << "\n"
+      << "- Machine: " << machine << "\n"
+      << "- drd: " << o.drd << " (RelWithDebInfo)\n"
+      << "- Sizes: " << sizes << (o.smoke ? " (smoke run: figures not judged)" : "") << "\n\n"
+      << "| workload | figure | drd | floor | D-Bus | target | verdict |\n"
+      << "|---|---|---|---|---|---|---|\n";
+  for (const Row& r : rows) {
+    out << "| " << r.workload << " | " << r.figure << " | " << r.drd << " | " << r.floor << " | "
+        << r.dbus << " | " << r.target << " | " << r.verdict << " |\n";
+  }
+  out << "\nFloor: a DRM1 echo server (one thread) on a Unix socket that decodes each request "
+         "and answers with drd's reply, through the same client library. D-Bus: an sd-bus "
+         "method call through a private dbus-daemon carrying the same DRM1 bytes, encoded and "
+         "decoded at both ends. drd, the floor and D-Bus take turns in rounds. W6 floor: "
+         "writing, fsyncing and renaming a file of the annotation file's size, then fsyncing "
+         "its folder, as drd's durable writes do. CPU per request: drd's threads' run time "
+         "over the measured requests, which other load on the machine disturbs far less than "
+         "the latencies.\n\n";
+  if (!o.micro.empty()) {
+    std::ifstream in(o.micro);
+    std::stringstream text;
+    text << in.rdbuf();
+    out << "## Micro-benchmarks (bench/micro)\n\n```\n" << text.str() << "```\n\n";
+  }
+  if (notes.empty()) notes = std::string(kNotesMarker) + "\n";
+  out << notes;
+  if (!out.good()) Die("cannot write " + path);
+}
+
+std::string DefaultDrd() {
+  char self[4096] = {};
+  ssize_t n = ::readlink("/proc/self/exe", self, sizeof self - 1);
+  std::filesystem::path p(std::string(self, n > 0 ? static_cast<size_t>(n) : 0));
+  return (p.parent_path().parent_path() / "daemon" / "drd").string();
+}
+
+Options Parse(int argc, char** argv) {
+  Options o;
+  for (int i = 1; i < argc; ++i) {
+    std::string a = argv[i];
+    auto value = [&]() -> std::string {
+      if (i + 1 >= argc) Die(a + " needs a value");
+      return argv[++i];
+    };
+    if (a == "--drd") {
+      o.drd = value();
+    } else if (a == "--smoke") {
+      o.smoke = true;
+    } else if (a == "--results") {
+      o.results = value();
+    } else if (a == "--micro") {
+      o.micro = value();
+    } else if (a == "--keep") {
+      o.keep = true;
+    } else if (a == "--only") {
+      std::stringstream list(value());
+      for (std::string w; std::getline(list, w, ',');) o.only.insert(w);
+    } else {
+      Die("usage: load [--drd PATH] [--smoke] [--results FILE] [--micro FILE] "
+          "[--only W1,W2,...] [--keep]");
+    }
+  }
+  if (o.drd.empty()) o.drd = DefaultDrd();
+  if (::access(o.drd.c_str(), X_OK) != 0) Die("no drd at " + o.drd + " (build it, or --drd)");
+  return o;
+}
+
+int Main(int argc, char** argv) {
+  const Options o = Parse(argc, argv);
+  const Sizes z = o.smoke ? kSmoke : kFull;
+  const std::string loadAtStart = LoadAverage();
+  const bool judged = !o.smoke;
+  TempRoot root;
+  root.keep = o.keep;
+  const std::string sdk = root.path() + "/sdk";
+  std::vector<Row> rows;
+  auto log = [](const std::string& s) { std::fprintf(stderr, "load: %s\n", s.c_str()); };
+
+  EchoServer echo(root.path() + "/floor", "echo");
+  DbusPeer dbus(root.path() + "/dbus");
+  if (!dbus.available()) log("D-Bus peer unavailable: " + dbus.unavailableReason());
+
+  // ---- The 1,000-plug-in drd: W1, W3, W6 ------------------------------------
+  std::optional<Drd> small;
+  long smallPeakKiB = 0;
+  double addRate = 0;
+  if (o.runs("W1") || o.runs("W3") || o.runs("W6")) {
+    log("making " + std::to_string(z.w3Points * z.w3PerPoint) + " bundles");
+    BundleSet set =
+        MakeBundles(root.path() + "/apps-small", sdk, z.w3Apps, z.w3Points, z.w3PerPoint);
+    small.emplace(o.drd, root.path() + "/drd-small", sdk);
+    small->start();
+    small->waitUntilServing();
+    auto c = Open(small->socketFolder());
+    log("registering");
+    addRate = Register(*c, set);
+
+    if (o.runs("W1")) {
+      log("W1");
+      const Value release = Envelope("lock").changing("uuids", Value(Array{dr::Uuid::random()}));
+      const Value reply = Ask(*c, release, "lock");
+      const Figures w1 = Compare(
+          *small, [&] { Ask(*c, release, "lock"); }, echo, dbus, release, reply, z.w1Warmup,
+          z.w1Requests, z.rounds);
+      // Throughput in alternating rounds too; each client sends its share.
+      const int per = std::max(1, z.w1Requests / z.w1Clients / z.rounds);
+      double drdRate = 0, floorRate = 0, dbusRate = 0;
+      for (int r = 0; r < z.rounds; ++r) {
+        drdRate += Throughput(z.w1Clients, per, [&] {
+          auto conn = std::shared_ptr<Connection>(Open(small->socketFolder()));
+          return [conn, release] { Ask(*conn, release, "lock"); };
+        });
+        floorRate += Throughput(z.w1Clients, per, [&] {
+          auto conn = std::shared_ptr<Connection>(Open(echo.folder(), echo.name()));
+          return [conn, release] { Ask(*conn, release, "echo"); };
+        });
+        if (dbus.available()) {
+          dbusRate += Throughput(z.w1Clients, per, [&] {
+            auto client = std::shared_ptr<DbusPeer::Client>(dbus.connect());
+            return [client, release] { client->call(release); };
+          });
+        }
+      }
+      const double p50 = w1.drd.quantile(0.5);
+      const bool met =
+          p50 <= 2 * w1.floor.quantile(0.5) && (!w1.dbusAvailable || p50 < w1.dbus.quantile(0.5));
+      const std::string sizes =
+          std::to_string(FrameSize(release)) + " B → " + std::to_string(FrameSize(reply)) + " B";
+      rows.push_back(QuantileRow(w1, 0.5, "W1 lock release (" + sizes + ")", "p50, 1 connection",
+                                 "≤ 2× floor, < D-Bus", Verdict(judged, met)));
+      rows.push_back(QuantileRow(w1, 0.99, "", "p99, 1 connection"));
+      rows.push_back(CpuRow(w1.drd));
+      rows.push_back({"", "throughput, " + std::to_string(z.w1Clients) + " clients",
+                      Rate(drdRate / z.rounds), Rate(floorRate / z.rounds),
+                      dbus.available() ? Rate(dbusRate / z.rounds) : "n/a", "", ""});
+    }
+
+    if (o.runs("W3") || o.runs("W6")) {
+      log("W3");
+      const Value listAll = Envelope("match");
+      const size_t expected = set.plugIns.size();
+      auto check = [&](const Value& reply) {
+        const Value& matches = reply["matches"];
+        if (matches.size() != expected) {
+          Die("W3: \"match\" listed " + std::to_string(matches.size()) + " plug-ins, not " +
+              std::to_string(expected));
+        }
+        for (const Value& form : matches.array()) {
+          if (form["extensions"].size() == 0) Die("W3: a form without \"extensions\" tokens");
+        }
+      };
+      const Value first = Ask(*c, listAll, "match");
+      check(first);
+      if (o.runs("W3")) {
+        const Figures w3 = Compare(
+            *small, [&] { check(Ask(*c, listAll, "match")); }, echo, dbus, listAll, first, 1,
+            z.w3Requests, z.rounds);
+        const double p50 = w3.drd.quantile(0.5);
+        const std::string label = "W3 list " + std::to_string(expected) + " (reply " +
+                                  Fixed(static_cast<double>(FrameSize(first)) / 1024, 0) + " KiB)";
+        rows.push_back(QuantileRow(w3, 0.5, label, "p50", "< 20 ms", Verdict(judged, p50 < 20000)));
+        rows.push_back(QuantileRow(w3, 0.99, "", "p99"));
+        rows.push_back(CpuRow(w3.drd));
+      }
+
+      if (o.runs("W6")) {
+        log("W6");
+        Array uuids;
+        for (const Value& form : first["matches"].array()) {
+          auto id = dr::Uuid::parse(form["uuid"].stringValue());
+          if (!id) Die("W6: a form without a UUID");
+          uuids.push_back(Value(*id));
+        }
+        // Every plug-in annotated: the file holds one entry per plug-in.
+        Clock::time_point t0 = Clock::now();
+        Ask(*c,
+            Envelope("annotate")
+                .changing("uuids", Value(uuids))
+                .changing("annotations",
+                          Value{{"election", 1}, {"extension", Value{{"mode", "fast"}}}}),
+            "annotate");
+        const double allMicros = Micros(t0, Clock::now());
+        const std::string file = small->annotationFile();
+        const std::string bytes = [&] {
+          std::ifstream in(file, std::ios::binary);
+          std::stringstream text;
+          text << in.rdbuf();
+          return text.str();
+        }();
+        if (bytes.empty()) Die("W6: no annotation file at " + file);
+        // One plug-in's election flips each time, so every request changes
+        // (and rewrites) the file; the floor writes the same bytes beside it,
+        // the two in alternating rounds.
+        int n = 0;
+        auto annotateOnce = [&] {
+          Ask(*c,
+              Envelope("annotate")
+                  .changing("uuids", Value(Array{uuids[static_cast<size_t>(n) % uuids.size()]}))
+                  .changing("annotations",
+                            Value{{"election", (n / static_cast<int>(uuids.size())) % 2}}),
+              "annotate");
+          ++n;
+        };
+        const std::string floorTarget =
+            std::filesystem::path(file).parent_path().string() + "/floor-target";
+        Samples drd6, floor6;
+        double cpu = 0;
+        const int per = std::max(1, z.w6Requests / z.rounds);
+        for (int r = 0; r < z.rounds; ++r) {
+          Samples f = Measure(0, per, [&] { DurableReplace(floorTarget, bytes); });
+          floor6.micros.insert(floor6.micros.end(), f.micros.begin(), f.micros.end());
+          const double before = small->cpuSeconds();
+          Samples d = Measure(0, per, annotateOnce);
+          cpu += small->cpuSeconds() - before;
+          drd6.micros.insert(drd6.micros.end(), d.micros.begin(), d.micros.end());
+        }
+        drd6.cpuMicros = cpu * 1e6 / static_cast<double>(drd6.micros.size());
+        const double p50 = drd6.quantile(0.5);
+        rows.push_back({"W6 annotate, " + std::to_string(uuids.size()) + " in file (" +
+                            Fixed(static_cast<double>(bytes.size()) / 1024, 0) + " KiB)",
+                        "p50", Latency(p50), Latency(floor6.quantile(0.5)), "", "≤ 2× floor",
+                        Verdict(judged, p50 <= 2 * floor6.quantile(0.5))});
+        rows.push_back(
+            {"", "p99", Latency(drd6.quantile(0.99)), Latency(floor6.quantile(0.99)), "", "", ""});
+        rows.push_back(CpuRow(drd6));
+        rows.push_back({"", "one request annotating all " + std::to_string(uuids.size()),
+                        Latency(allMicros), "", "", "", ""});
+      }
+    }
+    smallPeakKiB = small->peakResidentKiB();
+  }
+
+  // ---- The 10,000-plug-in drd: W2, W4, W5 -------------------------------------
+  long bigPeakKiB = 0, coldPeakKiB = 0;
+  const int total = z.w2Points * z.w2PerPoint;
+  if (o.runs("W2") || o.runs("W4") || o.runs("W5")) {
+    log("making " + std::to_string(total) + " bundles");
+    BundleSet set = MakeBundles(root.path() + "/apps-big", sdk, z.w2Apps, z.w2Points, z.w2PerPoint);
+    Drd big(o.drd, root.path() + "/drd-big", sdk);
+    big.start();
+    big.waitUntilServing();
+    auto c = Open(big.socketFolder());
+    log("registering");
+    const double bigAddRate = Register(*c, set);
+    if (addRate == 0) addRate = bigAddRate;
+
+    auto check = [&](const Value& reply) {
+      if (static_cast<int>(reply["matches"].size()) != z.w2PerPoint) {
+        Die("W2: \"match\" found " + std::to_string(reply["matches"].size()) + ", not " +
+            std::to_string(z.w2PerPoint));
+      }
+    };
+    log("W2");
+    Clock::time_point t0 = Clock::now();
+    const Value first = Ask(*c, MatchPoint(0), "match");
+    const double firstMicros = Micros(t0, Clock::now());
+    check(first);
+    // Each request asks for the next extension point in turn.
+    int n = 0;
+    const Figures w2 = Compare(
+        big, [&] { check(Ask(*c, MatchPoint(n++ % z.w2Points), "match")); }, echo, dbus,
+        MatchPoint(0), first, z.w2Points, z.w2Requests, z.rounds);
+    const double p50 = w2.drd.quantile(0.5);
+    rows.push_back(QuantileRow(w2, 0.5,
+                               "W2 match " + std::to_string(z.w2PerPoint) + " of " +
+                                   std::to_string(total) + " (reply " +
+                                   Fixed(static_cast<double>(FrameSize(first)) / 1024, 0) + " KiB)",
+                               "p50, warm", "< 2 ms", Verdict(judged, p50 < 2000)));
+    rows.push_back(QuantileRow(w2, 0.99, "", "p99, warm"));
+    rows.push_back(CpuRow(w2.drd));
+    rows.push_back({"", "first match after registering", Latency(firstMicros), "", "", "", ""});
+    bigPeakKiB = big.peakResidentKiB();
+    const long bigRssKiB = big.residentKiB();
+    c.reset();
+    big.stop();
+
+    if (o.runs("W4") || o.runs("W5")) {
+      log("W4");
+      Samples cold;
+      for (int run = 0; run < z.w4Runs; ++run) {
+        const Clock::time_point started = big.start();
+        std::unique_ptr<Connection> conn;
+        while (!conn) {
+          auto attempt = Connection::Open(kServiceName, big.socketFolder());
+          if (attempt) {
+            conn = std::move(attempt).value();
+          } else {
+            std::this_thread::sleep_for(std::chrono::microseconds(200));
+          }
+          if (Micros(started, Clock::now()) > 30e6) Die("W4: drd did not serve within 30 s");
+        }
+        check(Ask(*conn, MatchPoint(run % z.w2Points), "match"));
+        cold.add(Micros(started, Clock::now()));
+        cold.cpuMicros += big.cpuSeconds() * 1e6 / z.w4Runs;
+        coldPeakKiB = std::max(coldPeakKiB, big.peakResidentKiB());
+        conn.reset();
+        big.stop();
+      }
+      const double median = cold.quantile(0.5);
+      rows.push_back({"W4 cold start, " + std::to_string(total) + " registered",
+                      "start → first W2 reply, median of " + std::to_string(z.w4Runs),
+                      Latency(median), "", "", "< 300 ms", Verdict(judged, median < 300000)});
+      rows.push_back(
+          {"", "drd CPU until that reply (mean)", Latency(cold.cpuMicros), "", "", "", ""});
+    }
+    rows.push_back({"W5 memory (VmHWM)",
+                    std::to_string(total) + " registered, after registering + W2", Mib(bigPeakKiB),
+                    "", "", "< 64 MiB", Verdict(judged, bigPeakKiB < 64 * 1024)});
+    rows.push_back(
+        {"", std::to_string(total) + " registered, RSS after W2", Mib(bigRssKiB), "", "", "", ""});
+    if (coldPeakKiB > 0) {
+      rows.push_back({"", std::to_string(total) + " registered, after cold start + W2",
+                      Mib(coldPeakKiB), "", "", "< 64 MiB",
+                      Verdict(judged, coldPeakKiB < 64 * 1024)});
+    }
+  }
+  if (smallPeakKiB > 0) {
+    rows.push_back({rows.empty() || !o.runs("W2") ? "W5 memory (VmHWM)" : "",
+                    std::to_string(z.w3Points * z.w3PerPoint) + " registered, after W1, W3, W6",
+                    Mib(smallPeakKiB), "", "", "< 64 MiB",
+                    Verdict(judged, smallPeakKiB < 64 * 1024)});
+  }
+  if (addRate > 0) {
+    rows.push_back(
+        {"setup", "\"add\" registration, 100 paths a request", Rate(addRate), "", "", "", ""});
+  }
+  if (small) small->stop();
+
+  // Other work on the machine shows in every latency; drd's CPU time per
+  // request much less.
+  const std::string machine =
+      Machine() + "; load average " + loadAtStart + " at start, " + LoadAverage() + " at end";
+  const std::string sizes =
+      "W1 " + std::to_string(z.w1Requests) + " requests; W2 " + std::to_string(z.w2Requests) +
+      " requests over " + std::to_string(z.w2Points) + " points × " + std::to_string(z.w2PerPoint) +
+      " in " + std::to_string(z.w2Apps) + " apps; W3 " + std::to_string(z.w3Requests) +
+      " requests; W4 " + std::to_string(z.w4Runs) + " starts; W6 " + std::to_string(z.w6Requests) +
+      " requests; each in " + std::to_string(z.rounds) +
+      " rounds alternating with the floor and D-Bus";
+  std::printf("drd load figures — %s\n%s\n%s%s\n\n", Today().c_str(), machine.c_str(),
+              sizes.c_str(), o.smoke ? " (smoke run: figures not judged)" : "");
+  PrintTable(rows);
+  if (!o.results.empty()) WriteResults(o.results, rows, o, machine, sizes);
+  return 0;
+}
+
+}  // namespace
+}  // namespace drbench
+
+int main(int argc, char** argv) { return drbench::Main(argc, argv); }
