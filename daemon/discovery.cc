@@ -1,7 +1,5 @@
 #include "daemon/discovery.h"
 
-#include <algorithm>
-
 #include "core/format.h"
 #include "model/helpers.h"
 #include "model/plugin_keys.h"
@@ -154,12 +152,16 @@ void Discovery::examine(const DRDPlugInPtr& candidate) {
   }
   p.augmentForm(entries);
   form = Value(std::move(entries));
+  const size_t position = accepted_.size();
   accepted_.push_back({candidate, verdict, form});
+  if (const Value& id = form[kFormIdentifierKey]; id.isString()) {
+    acceptedByIdentifier_[id.stringValue()].push_back(position);
+  }
 
   const Value replaces = p.valueForEntitlement(kReplaceEntitlement);
   auto replace = [&](const Value& identifier) {
     if (identifier.isString()) {
-      replacements_[identifier.stringValue()] = {verdict, form[kFormUuidKey]};
+      replacements_[identifier.stringValue()] = {position, form[kFormUuidKey]};
     }
   };
   if (replaces.isArray()) {
@@ -171,18 +173,18 @@ void Discovery::examine(const DRDPlugInPtr& candidate) {
 
 bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict) {
   const DRDPlugIn& p = *candidate;
-  const std::string identifier = p.identifier().value_or("");
+  auto same = acceptedByIdentifier_.find(p.identifier().value_or(""));
+  if (same == acceptedByIdentifier_.end()) return true;
   const std::string version = p.version().value_or("");
-  for (auto it = accepted_.begin(); it != accepted_.end(); ++it) {
-    const Value& e = it->form;
-    if (e[kFormIdentifierKey].stringValue() != identifier || !e[kFormIdentifierKey].isString()) {
-      continue;
-    }
+  std::vector<size_t>& positions = same->second;  // in the order accepted
+  for (auto it = positions.begin(); it != positions.end(); ++it) {
+    Accepted& existing = accepted_[*it];
+    const Value& e = existing.form;
     const int order = compareVersionString(version, e[kFormVersionKey].stringValue());
-    const bool fresher = (p.onSystemVolume() && !(e[kFormSystemResidentKey].isBool() &&
-                                                  e[kFormSystemResidentKey].boolValue()))
-                             ? true
-                             : p.lastModified() > e[kFormLastModifiedKey].intValue();
+    const bool systemResident =
+        e[kFormSystemResidentKey].isBool() && e[kFormSystemResidentKey].boolValue();
+    const bool fresher = (p.onSystemVolume() && !systemResident) ||
+                         p.lastModified() > e[kFormLastModifiedKey].intValue();
     bool replaceExisting;
     if (flags_ & DRDiscoverAllVersions) {
       if ((flags_ & DRDiscoverDuplicates) || order != 0) continue;  // both stay
@@ -193,11 +195,12 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
       replaceExisting = order > 0;
     }
     if (!replaceExisting) {
-      setOutcome(verdict, DiscoveryOutcome::kSuperseded, {}, it->plugIn);
+      setOutcome(verdict, DiscoveryOutcome::kSuperseded, {}, existing.plugIn);
       return false;
     }
-    setOutcome(it->verdict, DiscoveryOutcome::kSuperseded, {}, candidate);
-    accepted_.erase(it);
+    setOutcome(existing.verdict, DiscoveryOutcome::kSuperseded, {}, candidate);
+    existing.removed = true;
+    positions.erase(it);
     return true;
   }
   return true;
@@ -206,21 +209,23 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
 Value Discovery::finish() {
   if (!replacements_.empty()) {
     for (Accepted& a : accepted_) {
-      auto found = replacements_.find(a.form[kFormIdentifierKey].stringValue());
-      if (found == replacements_.end() || !a.form[kFormIdentifierKey].isString()) continue;
+      const Value& identifier = a.form[kFormIdentifierKey];
+      if (a.removed || !identifier.isString()) continue;
+      auto found = replacements_.find(identifier.stringValue());
+      if (found == replacements_.end()) continue;
       const Replacer& r = found->second;
       a.form = a.form.changing(kOverriderFormKey, r.uuid);
-      // The replacer's own form, when it is still among the accepted ones.
-      for (Accepted& replacer : accepted_) {
-        if (replacer.verdict == r.verdict) {
-          replacer.form = replacer.form.changing(kOverridingFormKey, a.form[kFormIdentifierKey]);
-        }
+      // A replacer dropped as a duplicate meanwhile has no form to mark.
+      Accepted& replacer = accepted_[r.accepted];
+      if (!replacer.removed) {
+        replacer.form = replacer.form.changing(kOverridingFormKey, a.form[kFormIdentifierKey]);
       }
     }
   }
   Array matches;
   const pid_t pid = host_.client->pid();
   for (const Accepted& a : accepted_) {
+    if (a.removed) continue;
     if (services_.mayUse && !services_.mayUse(a.form)) {
       debug(Format("client %d plugin %@ rejected by Keeper", pid, a.form[kFormIdentifierKey]));
       setOutcome(a.verdict, DiscoveryOutcome::kVetoed);

@@ -23,6 +23,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "core/value.h"
@@ -119,8 +120,9 @@ class Discovery {
  private:
   struct Accepted {
     DRDPlugInPtr plugIn;
-    size_t verdict;  // index into verdicts_
-    Value form;      // a dictionary
+    size_t verdict;        // index into verdicts_
+    Value form;            // a dictionary
+    bool removed = false;  // superseded by a later copy; kept so positions stay
   };
 
   std::optional<DiscoveryOutcome> visibility(const DRDPlugIn& candidate);
@@ -140,11 +142,14 @@ class Discovery {
   const Value exclusions_;
   const DiscoveryServices services_;
   std::vector<Verdict> verdicts_;
-  std::vector<Accepted> accepted_;
-  // Replaced identifier -> the replacer (its verdict index and its form's
-  // "uuid"). Kept when the replacer is later dropped as a duplicate.
+  std::vector<Accepted> accepted_;  // in the order accepted
+  // Identifier -> positions in accepted_ of its copies still accepted, in
+  // order, so that a duplicate is checked against its own copies only.
+  std::unordered_map<std::string, std::vector<size_t>> acceptedByIdentifier_;
+  // Replaced identifier -> the replacer (its position in accepted_ and its
+  // form's "uuid"). Kept when the replacer is later dropped as a duplicate.
   struct Replacer {
-    size_t verdict;
+    size_t accepted;
     Value uuid;
   };
   std::map<std::string, Replacer> replacements_;
