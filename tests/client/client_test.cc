@@ -8,6 +8,7 @@
 #include "core/queue.h"
 #include "platform/message_service.h"
 #include "tests/support/process_fixtures.h"
+#include "tests/support/stand_in_listener.h"
 
 namespace dr::client {
 namespace {
@@ -28,25 +29,15 @@ Value Form(const std::string& identifier, const Uuid& uuid) {
 class ClientTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    ListenerOptions options;
-    options.socketDirectory = folder_.path() + "/sockets";
-    options.serviceName = "com.example.client";
-    options.useSocketActivation = false;
-    Result<std::unique_ptr<Listener>> listener = Listener::Create(options, &queue_);
-    ASSERT_TRUE(listener) << listener.error().description();
-    listener_ = std::move(*listener);
-    listener_->setEventHandler([this](std::shared_ptr<PeerConnection> c) {
-      std::weak_ptr<PeerConnection> weak = c;
-      c->setEventHandler([this, weak](const ConnectionEvent& e) {
-        auto conn = weak.lock();
-        if (e.kind != ConnectionEvent::Kind::kMessage || !conn) return;
-        std::lock_guard<std::mutex> lock(mu_);
-        sent_ = e.message.body;
-        conn->sendReply(e.message.serial, reply_);
-      });
-      c->resume();
-    });
-    listener_->resume();
+    listener_ = testing::StartStandInListener(
+        folder_.path() + "/sockets", "com.example.client", &queue_,
+        [this](const std::shared_ptr<PeerConnection>& conn, const ConnectionEvent& e) {
+          if (e.kind != ConnectionEvent::Kind::kMessage || !conn) return;
+          std::lock_guard<std::mutex> lock(mu_);
+          sent_ = e.message.body;
+          conn->sendReply(e.message.serial, reply_);
+        });
+    ASSERT_TRUE(listener_);
     auto client = Client::Open("com.example.client", folder_.path() + "/sockets");
     ASSERT_TRUE(client) << client.error().description();
     client_ = std::move(*client);

@@ -12,6 +12,7 @@
 #include "core/queue.h"
 #include "platform/message_service.h"
 #include "tests/support/process_fixtures.h"
+#include "tests/support/stand_in_listener.h"
 
 namespace dr::client {
 namespace {
@@ -27,33 +28,23 @@ using namespace std::chrono_literals;
 class ConnectionTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    ListenerOptions options;
-    options.socketDirectory = folder_.path() + "/sockets";
-    options.serviceName = kService;
-    options.useSocketActivation = false;
-    Result<std::unique_ptr<Listener>> listener = Listener::Create(options, &queue_);
-    ASSERT_TRUE(listener) << listener.error().description();
-    listener_ = std::move(*listener);
-    listener_->setEventHandler([this](std::shared_ptr<PeerConnection> c) {
-      std::weak_ptr<PeerConnection> weak = c;
-      c->setEventHandler([this, weak](const ConnectionEvent& e) {
-        auto conn = weak.lock();
-        if (e.kind != ConnectionEvent::Kind::kMessage || !conn) return;
-        {
-          std::lock_guard<std::mutex> lock(mu_);
-          seen_.emplace_back(e.message.serial, e.message.wantsReply);
-        }
-        const Value& what = e.message.body["do"];
-        if (what == Value("hang up")) return conn->cancel();
-        if (what == Value("ignore") || !e.message.wantsReply) return;
-        if (what == Value("sleep")) {
-          std::this_thread::sleep_for(std::chrono::milliseconds(e.message.body["ms"].intValue()));
-        }
-        conn->sendReply(e.message.serial, e.message.body.changing("serial", e.message.serial));
-      });
-      c->resume();
-    });
-    listener_->resume();
+    listener_ = testing::StartStandInListener(
+        folder_.path() + "/sockets", kService, &queue_,
+        [this](const std::shared_ptr<PeerConnection>& conn, const ConnectionEvent& e) {
+          if (e.kind != ConnectionEvent::Kind::kMessage || !conn) return;
+          {
+            std::lock_guard<std::mutex> lock(mu_);
+            seen_.emplace_back(e.message.serial, e.message.wantsReply);
+          }
+          const Value& what = e.message.body["do"];
+          if (what == Value("hang up")) return conn->cancel();
+          if (what == Value("ignore") || !e.message.wantsReply) return;
+          if (what == Value("sleep")) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(e.message.body["ms"].intValue()));
+          }
+          conn->sendReply(e.message.serial, e.message.body.changing("serial", e.message.serial));
+        });
+    ASSERT_TRUE(listener_);
   }
 
   Result<std::unique_ptr<Connection>> Open() {

@@ -17,6 +17,7 @@
 
 #include "core/log.h"
 #include "tests/support/process_fixtures.h"
+#include "tests/support/stand_in_listener.h"
 
 namespace dr {
 namespace {
@@ -90,28 +91,19 @@ class MessageServiceTest : public ::testing::Test {
   // A listener whose connections answer each request with its own body plus
   // "echo": true, and count their connection-invalid events.
   std::unique_ptr<Listener> EchoListener() {
-    Result<std::unique_ptr<Listener>> listener = Listener::Create(options_, &queue_);
-    EXPECT_TRUE(listener) << listener.error().description();
-    if (!listener) return nullptr;
-    (*listener)->setEventHandler([this](std::shared_ptr<PeerConnection> c) {
-      std::weak_ptr<PeerConnection> weak = c;
-      c->setContext(context_);
-      // Connection threads may deliver their last event after the test
-      // ended: they share the counter rather than reach into the fixture.
-      c->setEventHandler([invalid = invalid_, weak](const ConnectionEvent& e) {
-        auto conn = weak.lock();
-        if (e.kind == ConnectionEvent::Kind::kConnectionInvalid) {
-          (*invalid)++;
-          return;
-        }
-        if (conn && e.message.wantsReply) {
-          conn->sendReply(e.message.serial, e.message.body.changing("echo", true));
-        }
-      });
-      c->resume();
-    });
-    (*listener)->resume();
-    return std::move(*listener);
+    return testing::StartStandInListener(
+        options_.socketDirectory, options_.serviceName, &queue_,
+        [invalid = invalid_](const std::shared_ptr<PeerConnection>& conn,
+                             const ConnectionEvent& e) {
+          if (e.kind == ConnectionEvent::Kind::kConnectionInvalid) {
+            (*invalid)++;
+            return;
+          }
+          if (conn && e.message.wantsReply) {
+            conn->sendReply(e.message.serial, e.message.body.changing("echo", true));
+          }
+        },
+        context_);
   }
 
   testing::TempFolder folder_;
