@@ -76,6 +76,13 @@ std::string Quote(std::string_view text, size_t limit = kMaxQuoted) {
 // wrong with it.
 std::optional<std::string> XmlTextProblem(std::string_view text) {
   size_t i = 0;
+  // Printable ASCII, tab, LF and CR, nearly all of what drd writes, need no
+  // decoding; the first other byte starts a character.
+  while (i < text.size()) {
+    const auto b = static_cast<unsigned char>(text[i]);
+    if ((b < 0x20 && b != '\t' && b != '\n' && b != '\r') || b >= 0x80) break;
+    ++i;
+  }
   while (i < text.size()) {
     std::optional<char32_t> cp = DecodeUtf8(text, i);
     if (!cp) return "is not valid UTF-8";
@@ -220,12 +227,44 @@ struct Frame {
   Value value{};                     // kRoot: the document's value
 };
 
+// One expat parser per thread, reset between documents: making and freeing
+// a parser costs about as much as reading a small information dictionary,
+// and drd reads thousands of them when it starts. A parser that read a large
+// document is freed rather than kept, so its buffers are not held on to.
+class ThreadParser {
+ public:
+  static constexpr size_t kKeepBelow = 64 * 1024;
+
+  ~ThreadParser() {
+    if (parser_ != nullptr) XML_ParserFree(parser_);
+  }
+  // A parser with no handlers, ready for a new document; null when none can
+  // be made.
+  XML_Parser acquire() {
+    if (parser_ != nullptr && XML_ParserReset(parser_, nullptr) == XML_TRUE) return parser_;
+    if (parser_ != nullptr) XML_ParserFree(parser_);
+    parser_ = XML_ParserCreate(nullptr);
+    return parser_;
+  }
+  // Ends the use of the parser that read `size` bytes.
+  void release(size_t size) {
+    if (size < kKeepBelow) return;
+    XML_ParserFree(parser_);
+    parser_ = nullptr;
+  }
+
+ private:
+  XML_Parser parser_ = nullptr;
+};
+
 class XmlReader {
  public:
   XmlReader(size_t lineOffset) : lineOffset_(lineOffset) {}
 
   Result<Value> Read(std::string_view bytes) {
-    parser_ = XML_ParserCreate(nullptr);
+    thread_local ThreadParser parsers;
+    const size_t size = bytes.size();
+    parser_ = parsers.acquire();
     if (parser_ == nullptr) return Malformed("cannot create an XML parser");
     XML_SetUserData(parser_, this);
     XML_SetElementHandler(parser_, &XmlReader::OnStart, &XmlReader::OnEnd);
@@ -248,7 +287,7 @@ class XmlReader {
     } else if (!ok) {
       error = Malformed(LinePrefix() + XML_ErrorString(XML_GetErrorCode(parser_)));
     }
-    XML_ParserFree(parser_);
+    parsers.release(size);
     if (error) return *error;
     return std::move(result_);
   }
@@ -597,7 +636,7 @@ class XmlWriter {
         }
         out_ += "<array>\n";
         for (size_t i = 0; i < array.size(); ++i) {
-          path_.push_back(std::to_string(i));
+          path_.push_back({{}, i, true});
           Indent(level + 1);
           if (auto error = Write(array[i], level + 1)) return error;
           path_.pop_back();
@@ -614,7 +653,7 @@ class XmlWriter {
         }
         out_ += "<dict>\n";
         for (const auto& [key, element] : dict) {
-          path_.push_back(key);
+          path_.push_back({key, 0, false});
           if (auto problem = XmlTextProblem(key)) {
             path_.pop_back();
             return Unwritable(Where() + "a key " + *problem);
@@ -641,37 +680,44 @@ class XmlWriter {
   std::string Where() const {
     if (path_.empty()) return "";
     std::string where = "at ";
-    for (const std::string& part : path_) where += "/" + Quote(part);
+    for (const PathPart& part : path_) {
+      where += "/" + (part.isIndex ? std::to_string(part.index) : Quote(part.key));
+    }
     return where + ": ";
   }
 
   void Indent(int level) { out_.append(static_cast<size_t>(level) * 2, ' '); }
 
   void Scalar(const char* tag, const std::string& text) {
-    out_ += std::string("<") + tag + ">" + text + "</" + tag + ">\n";
+    out_.append("<").append(tag).append(">").append(text).append("</").append(tag).append(">\n");
   }
 
   // &, < and > as entities; CR as a character reference, since XML readers
   // turn a literal CR into LF.
   void Escape(std::string_view text) {
-    for (char c : text) {
-      switch (c) {
+    size_t plain = 0;  // the start of the characters not yet copied
+    for (size_t i = 0; i < text.size(); ++i) {
+      const char* entity = nullptr;
+      switch (text[i]) {
         case '&':
-          out_ += "&amp;";
+          entity = "&amp;";
           break;
         case '<':
-          out_ += "&lt;";
+          entity = "&lt;";
           break;
         case '>':
-          out_ += "&gt;";
+          entity = "&gt;";
           break;
         case '\r':
-          out_ += "&#13;";
+          entity = "&#13;";
           break;
         default:
-          out_ += c;
+          continue;
       }
+      out_.append(text.substr(plain, i - plain)).append(entity);
+      plain = i + 1;
     }
+    out_.append(text.substr(plain));
   }
 
   template <typename T>
@@ -727,7 +773,15 @@ class XmlWriter {
   }
 
   std::string out_;
-  std::vector<std::string> path_;
+  // One step of the path to the value being written: a dictionary key (a
+  // view of the key in the value written, which outlives the writer's use of
+  // it) or an array index. Text is made of it only for an error message.
+  struct PathPart {
+    std::string_view key;
+    size_t index;
+    bool isIndex;
+  };
+  std::vector<PathPart> path_;
 };
 
 }  // namespace

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
 #include <utility>
@@ -129,6 +130,7 @@ class LinuxServiceManager final : public ServiceManager {
       std::string path = folder + "/" + identifier + kSdkFileSuffix;
       struct stat st;
       if (::stat(path.c_str(), &st) != 0) continue;
+      if (std::optional<Value> known = knownSdk(path, st)) return *known;
       Result<std::string> bytes = FileSystem::Default()->readFile(path, kMaxSdkFileBytes);
       if (!bytes.ok()) return bytes.error();
       Result<Value> sdk = pdoc::Parse(*bytes);
@@ -138,6 +140,7 @@ class LinuxServiceManager final : public ServiceManager {
       if (!sdk->isDictionary()) {
         return Error(kPdocErrorDomain, pdoc::kMalformed, path + ": not a dictionary");
       }
+      rememberSdk(path, st, *sdk);
       return *sdk;
     }
     return Value();
@@ -293,9 +296,42 @@ class LinuxServiceManager final : public ServiceManager {
     return path;
   }
 
+  // An SDK file read before that is still the same file with the same size
+  // and times (so unchanged) answers the dictionary read then. Every plug-in
+  // of an extension point names the same file, and records are built by the
+  // thousand when drd starts.
+  struct SdkFile {
+    dev_t device;
+    ino_t inode;
+    off_t size;
+    struct timespec modified, changed;
+    Value dictionary;
+    bool same(const struct stat& st) const {
+      return device == st.st_dev && inode == st.st_ino && size == st.st_size &&
+             modified.tv_sec == st.st_mtim.tv_sec && modified.tv_nsec == st.st_mtim.tv_nsec &&
+             changed.tv_sec == st.st_ctim.tv_sec && changed.tv_nsec == st.st_ctim.tv_nsec;
+    }
+  };
+
+  std::optional<Value> knownSdk(const std::string& path, const struct stat& st) {
+    std::lock_guard lock(sdkMu_);
+    auto it = sdkFiles_.find(path);
+    if (it == sdkFiles_.end() || !it->second.same(st)) return std::nullopt;
+    return it->second.dictionary;
+  }
+
+  void rememberSdk(const std::string& path, const struct stat& st, const Value& dictionary) {
+    std::lock_guard lock(sdkMu_);
+    sdkFiles_.insert_or_assign(
+        path, SdkFile{st.st_dev, st.st_ino, st.st_size, st.st_mtim, st.st_ctim, dictionary});
+  }
+
   const Registry* const registry_;
   ProcessInfo* const processInfo_;
   BundleReader* const bundleReader_;
+
+  std::mutex sdkMu_;
+  std::map<std::string, SdkFile> sdkFiles_;  // guarded by sdkMu_
 
   mutable std::mutex mu_;
   std::vector<ExternalServiceGrant> grants_;  // guarded by mu_
