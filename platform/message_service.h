@@ -7,9 +7,11 @@
 // on a thread of its own and delivers its events to its handler one at a
 // time, in order: a message per frame, and a final kConnectionInvalid when
 // the peer hangs up, breaks the protocol (logged, and only that connection
-// closes) or is cancelled. Replies are queued per connection and written by
-// that connection's thread, so sending never blocks the caller; a peer whose
-// queue passes kMaxQueuedReplyBytes is closed, and one with
+// closes) or is cancelled. Replies are queued per connection: one with
+// nothing queued before it is written at once by the sender, as far as the
+// socket takes it without waiting, and the rest by the connection's thread,
+// so sending never blocks the caller; a peer whose queue passes
+// kMaxQueuedReplyBytes is closed, and one with
 // kMaxUnansweredRequests requests in flight is not read until they are
 // answered.
 //
@@ -95,7 +97,8 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   friend class Listener;
   PeerConnection(int fd, AuditToken token);
   void run();
-  bool writeSome();  // false when the peer is gone
+  bool writeSome();        // false when the peer is gone
+  bool writeSomeLocked();  // writeSome; REQUIRES: mu_ held
   void wake();
 
   const int fd_;

@@ -93,6 +93,9 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
       drm1::EncodeFrame(nextSerial_, requestSerial, drm1::kFlagIsReply, body);
   if (!frame) return frame.error();
   ++nextSerial_;
+  // A connection at its limit of unanswered requests is not being read; its
+  // thread must hear that this reply makes room.
+  const bool wasFull = unanswered_ >= kMaxUnansweredRequests;
   if (unanswered_ > 0) --unanswered_;
   if (outbox_.size() - outboxSent_ + frame->size() > kMaxQueuedReplyBytes) {
     SystemLog("closing %@: more than 64 MiB of replies unread", description());
@@ -100,8 +103,13 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
     wake();
     return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "reply queue full");
   }
+  const bool queuedBefore = outboxSent_ < outbox_.size();
   outbox_ += *frame;
-  wake();
+  // Nothing ahead of it: write it from here rather than waking the
+  // connection's thread to do so, which would double the thread switches
+  // of every request. A failure is left to that thread to find.
+  if (!queuedBefore) writeSomeLocked();
+  if (outboxSent_ < outbox_.size() || wasFull) wake();
   return Status::OK();
 }
 
@@ -124,6 +132,10 @@ bool PeerConnection::flush(int timeoutMs) {
 
 bool PeerConnection::writeSome() {
   std::lock_guard<std::mutex> lock(mu_);
+  return writeSomeLocked();
+}
+
+bool PeerConnection::writeSomeLocked() {
   while (outboxSent_ < outbox_.size()) {
     ssize_t n = ::send(fd_, outbox_.data() + outboxSent_, outbox_.size() - outboxSent_,
                        MSG_DONTWAIT | MSG_NOSIGNAL);
