@@ -1,6 +1,6 @@
 // FileSystem: whole-file reads, atomic and durable writes, folder creation.
 //
-// The daemon's only writes of its own state go through writeFileAtomically:
+// The daemon's writes of its own state go through writeFileAtomically:
 // the bytes go to a new temporary file beside the target, are fsynced, the
 // temporary is renamed over the target, and the folder is fsynced, so that a
 // crash at any point leaves either the old file or the new one, whole. A
@@ -37,6 +37,15 @@ class FileSystem {
   virtual Status writeFileAtomically(const std::string& path, std::string_view bytes,
                                      mode_t mode = 0600) = 0;
 
+  // Replaces the file at `path` with `bytes` atomically (written beside,
+  // renamed over) but not durably: nothing is synced, so after a crash the
+  // file may hold its old contents. For files whose loss costs nothing, such
+  // as change notification counters, where two syncs would double the cost
+  // of the change they announce. Errors: kFileErrorDomain / kFileWriteError.
+  // The base version is the durable write.
+  virtual Status replaceFile(const std::string& path, std::string_view bytes, mode_t mode = 0600) {
+    return writeFileAtomically(path, bytes, mode);
+  }
   // Creates the folder `path` and any missing parents, each with `mode`.
   // Succeeds when the folder exists already.
   virtual Status makeDirectories(const std::string& path, mode_t mode = 0700) = 0;
@@ -58,6 +67,9 @@ class FileSystemWrapper : public FileSystem {
   Status writeFileAtomically(const std::string& path, std::string_view bytes,
                              mode_t mode) override {
     return target_->writeFileAtomically(path, bytes, mode);
+  }
+  Status replaceFile(const std::string& path, std::string_view bytes, mode_t mode) override {
+    return target_->replaceFile(path, bytes, mode);
   }
   Status makeDirectories(const std::string& path, mode_t mode) override {
     return target_->makeDirectories(path, mode);

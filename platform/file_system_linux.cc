@@ -40,6 +40,44 @@ bool WriteAll(int fd, std::string_view bytes) {
   return true;
 }
 
+// The file at `path` replaced by `bytes`, and when `durable` synced before
+// and after the rename.
+Status Replace(const std::string& path, std::string_view bytes, mode_t mode, bool durable) {
+  // A unique temporary beside the target, so the rename stays within one
+  // file system and concurrent writers never share a temporary.
+  std::string tmp = path + ".tmp-" + Uuid::random().string();
+  int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode);
+  if (fd < 0) return FileError(kFileWriteError, errno, "create " + tmp);
+  auto fail = [&](const char* what) {
+    int e = errno;
+    ::close(fd);
+    ::unlink(tmp.c_str());
+    return Status(FileError(kFileWriteError, e, std::string(what) + " " + tmp));
+  };
+  if (::fchmod(fd, mode) != 0) return fail("chmod");  // the umask may have narrowed it
+  if (!WriteAll(fd, bytes)) return fail("write");
+  if (durable && ::fsync(fd) != 0) return fail("fsync");
+  if (::close(fd) != 0) {
+    int e = errno;
+    ::unlink(tmp.c_str());
+    return FileError(kFileWriteError, e, "close " + tmp);
+  }
+  if (::rename(tmp.c_str(), path.c_str()) != 0) {
+    int e = errno;
+    ::unlink(tmp.c_str());
+    return FileError(kFileWriteError, e, "rename " + tmp + " to " + path);
+  }
+  if (!durable) return Status::OK();
+  // Make the rename itself durable.
+  int dir = ::open(ParentOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir < 0) return FileError(kFileWriteError, errno, "open folder of " + path);
+  int rc = ::fsync(dir);
+  int e = errno;
+  ::close(dir);
+  if (rc != 0) return FileError(kFileWriteError, e, "fsync folder of " + path);
+  return Status::OK();
+}
+
 class LinuxFileSystem final : public FileSystem {
  public:
   Result<std::string> readFile(const std::string& path, size_t maxBytes) override {
@@ -77,38 +115,11 @@ class LinuxFileSystem final : public FileSystem {
 
   Status writeFileAtomically(const std::string& path, std::string_view bytes,
                              mode_t mode) override {
-    // A unique temporary beside the target, so the rename stays within one
-    // file system and concurrent writers never share a temporary.
-    std::string tmp = path + ".tmp-" + Uuid::random().string();
-    int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode);
-    if (fd < 0) return FileError(kFileWriteError, errno, "create " + tmp);
-    auto fail = [&](const char* what) {
-      int e = errno;
-      ::close(fd);
-      ::unlink(tmp.c_str());
-      return Status(FileError(kFileWriteError, e, std::string(what) + " " + tmp));
-    };
-    if (::fchmod(fd, mode) != 0) return fail("chmod");  // the umask may have narrowed it
-    if (!WriteAll(fd, bytes)) return fail("write");
-    if (::fsync(fd) != 0) return fail("fsync");
-    if (::close(fd) != 0) {
-      int e = errno;
-      ::unlink(tmp.c_str());
-      return FileError(kFileWriteError, e, "close " + tmp);
-    }
-    if (::rename(tmp.c_str(), path.c_str()) != 0) {
-      int e = errno;
-      ::unlink(tmp.c_str());
-      return FileError(kFileWriteError, e, "rename " + tmp + " to " + path);
-    }
-    // Make the rename itself durable.
-    int dir = ::open(ParentOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dir < 0) return FileError(kFileWriteError, errno, "open folder of " + path);
-    int rc = ::fsync(dir);
-    int e = errno;
-    ::close(dir);
-    if (rc != 0) return FileError(kFileWriteError, e, "fsync folder of " + path);
-    return Status::OK();
+    return Replace(path, bytes, mode, true);
+  }
+
+  Status replaceFile(const std::string& path, std::string_view bytes, mode_t mode) override {
+    return Replace(path, bytes, mode, false);
   }
 
   Status makeDirectories(const std::string& path, mode_t mode) override {

@@ -35,6 +35,9 @@ TEST(FileSystemTest, WritesReplaceAtomicallyOrLeaveEverythingAsItWas) {
   ASSERT_TRUE(fs->writeFileAtomically(dir / "state", bytes, 0600));
   EXPECT_EQ(ReadBytes(dir / "state"), bytes);
   EXPECT_EQ(ModeOf(dir / "state"), 0600u);
+  ASSERT_TRUE(fs->replaceFile(dir / "state", bytes + "!", 0640));  // the write without syncs
+  EXPECT_EQ(ReadBytes(dir / "state"), bytes + "!");
+  EXPECT_EQ(ModeOf(dir / "state"), 0640u);
 
   ASSERT_TRUE(fs->makeDirectories(dir / "a/b/c", 0700));
   EXPECT_EQ(ModeOf(dir / "a"), 0700u);
@@ -52,11 +55,18 @@ TEST(FileSystemTest, WritesReplaceAtomicallyOrLeaveEverythingAsItWas) {
       {true, "plain/d"},
   };
   for (const auto& row : refused) {
-    Status status = row.folder ? fs->makeDirectories(dir / row.path)
-                               : fs->writeFileAtomically(dir / row.path, "replacement");
-    ASSERT_FALSE(status) << row.path;
-    EXPECT_EQ(status.error().domain(), kFileErrorDomain);
-    EXPECT_EQ(status.error().code(), kFileWriteError);
+    std::vector<Status> statuses;
+    if (row.folder) {
+      statuses.push_back(fs->makeDirectories(dir / row.path));
+    } else {
+      statuses.push_back(fs->writeFileAtomically(dir / row.path, "replacement"));
+      statuses.push_back(fs->replaceFile(dir / row.path, "replacement"));
+    }
+    for (const Status& status : statuses) {
+      ASSERT_FALSE(status) << row.path;
+      EXPECT_EQ(status.error().domain(), kFileErrorDomain);
+      EXPECT_EQ(status.error().code(), kFileWriteError);
+    }
   }
   EXPECT_EQ(NamesIn(dir.path()), (Names{"a", "plain", "state"}));
   EXPECT_EQ(NamesIn(dir / "a"), Names{"b"});
