@@ -42,22 +42,26 @@ bool DRDPlugIn::match(const Value& rules) const {
   return true;
 }
 
-Value DRDPlugIn::valueForRuleKey(std::string_view key) const {
+const Value& DRDPlugIn::valueForRuleKey(std::string_view key, Value& holder) const {
   std::string_view prefix = kEntitlementRulePrefix;
-  if (key.starts_with(prefix)) return valueForEntitlement(key.substr(prefix.size()));
-  Value value;
-  if (key == kUXExtensionIdentifierKey) {
-    if (auto id = identifier()) value = Value(*id);
-  } else if (key == kUuidRuleKey) {
-    if (auto u = uuid()) value = Value(u->string());
+  if (key.starts_with(prefix)) {
+    holder = entitlements();
+    return holder[key.substr(prefix.size())];
   }
-  if (value.isAbsent()) value = attributes()[key];
-  if (value.isAbsent()) value = bundleInfoDictionary()[key];
-  return value;
+  if (key == kUXExtensionIdentifierKey) {
+    if (auto id = identifier()) return holder = Value(std::move(*id));
+  } else if (key == kUuidRuleKey) {
+    if (auto u = uuid()) return holder = Value(u->string());
+  }
+  holder = plugInDictionary();
+  if (const Value& value = holder[kUXExtensionAttributesKey][key]; value.isPresent()) return value;
+  holder = bundleInfoDictionary();
+  return holder[key];
 }
 
 bool DRDPlugIn::matchKeyPattern(std::string_view key, const Value& pattern) const {
-  Value value = valueForRuleKey(key);
+  Value holder;
+  const Value& value = valueForRuleKey(key, holder);
   if (IsTrue(pattern)) return value.isPresent() && !(value == Value(0));
   if (IsFalse(pattern)) return value.isAbsent() || value == Value(0);
   if (value.isAbsent()) return false;

@@ -51,6 +51,9 @@ std::vector<std::string> ResourceNames(const Value& resources) {
 // "../../.ssh" must not win hosts a token for a file outside its bundle. A
 // path that cannot be resolved is left to the sandbox to refuse.
 bool WithinBundle(const std::string& path, const std::string& bundlePath) {
+  // The bundle itself (the resource "." every app extension shares) needs no
+  // look at the disk; discovery issues it for every plug-in it returns.
+  if (path == bundlePath) return true;
   char resolved[PATH_MAX];
   char bundle[PATH_MAX];
   if (::realpath(path.c_str(), resolved) == nullptr) return true;

@@ -114,8 +114,10 @@ class DRDPlugIn : public DRPlugInCore {
 
  private:
   ServiceManager* serviceManager() const;
-  // The plug-in's value for a rule key, absent when it has none.
-  Value valueForRuleKey(std::string_view key) const;
+  // The plug-in's value for a rule key, absent when it has none. The answer
+  // lies inside `holder`, which keeps it alive: rules are evaluated against
+  // every installed plug-in, so the value is not copied out.
+  const Value& valueForRuleKey(std::string_view key, Value& holder) const;
   // Whether the type `type` conforms to `to` (the platform's type data).
   bool typeConformsTo(std::string_view type, std::string_view to) const;
 

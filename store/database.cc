@@ -66,10 +66,24 @@ void DRDatabase::autoElect(const DRDPlugIn& record) {
 }
 
 std::optional<std::vector<DRDPlugInPtr>> DRDatabase::findPlugIns(const Value& /*rules*/) {
+  const RegistryEntries entries = options_.registry->allEntries();
+  // Once the records are built (after the first discovery) every lookup is
+  // a cache hit: they are all taken in one entry into the queue rather than
+  // one entry per plug-in. Records still to be built are made one entry at
+  // a time, as plugInForProxy does.
+  std::vector<DRDPlugInPtr> cached(entries.size());
+  sync_.sync([&] {
+    for (size_t i = 0; i < entries.size(); ++i) {
+      auto it = cache_.find(entries[i]->uuid());
+      if (it != cache_.end()) cached[i] = it->second;
+    }
+  });
   std::vector<DRDPlugInPtr> result;
-  for (const RegistryEntryPtr& entry : options_.registry->allEntries()) {
-    if (entry->url().empty()) continue;
-    if (DRDPlugInPtr record = plugInForProxy(entry)) result.push_back(std::move(record));
+  result.reserve(entries.size());
+  for (size_t i = 0; i < entries.size(); ++i) {
+    if (entries[i]->url().empty()) continue;
+    DRDPlugInPtr record = cached[i] ? std::move(cached[i]) : plugInForProxy(entries[i]);
+    if (record) result.push_back(std::move(record));
   }
   return result;
 }

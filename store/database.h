@@ -13,10 +13,12 @@
 // with the system-log lines the daemon defines; nothing throws.
 #pragma once
 
+#include <cstring>
 #include <map>
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "core/queue.h"
@@ -110,7 +112,16 @@ class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<
  private:
   DatabaseOptions options_;
   std::unique_ptr<DRDAnnotationStore> annotations_;  // on sync_ only
-  std::map<Uuid, DRDPlugInPtr> cache_;               // on sync_ only
+  // Random UUIDs: their first eight bytes are as good a hash as any.
+  struct UuidHash {
+    size_t operator()(const Uuid& u) const {
+      size_t h;
+      std::memcpy(&h, u.bytes.data(), sizeof h);
+      return h;
+    }
+  };
+  // Every discovery looks up each installed plug-in here, so hashed.
+  std::unordered_map<Uuid, DRDPlugInPtr, UuidHash> cache_;  // on sync_ only
   std::mutex delegateMu_;
   std::weak_ptr<DRDatabaseDelegate> delegate_;  // guarded by delegateMu_
   SerialQueue sync_{"DRDatabase"};
