@@ -673,6 +673,18 @@ int Main(int argc, char** argv) {
       " requests; W4 " + std::to_string(z.w4Runs) + " starts; W6 " + std::to_string(z.w6Requests) +
       " requests; each in " + std::to_string(z.rounds) +
       " rounds alternating with the floor and D-Bus";
+  // The workloads in their order (the 1,000-plug-in drd ran W1, W3 and W6
+  // first): rows after a workload's first row belong to it.
+  std::vector<std::pair<std::string, Row>> keyed;
+  std::string group;
+  for (Row& r : rows) {
+    if (!r.workload.empty()) group = r.workload.rfind('W', 0) == 0 ? r.workload.substr(0, 2) : "W9";
+    keyed.emplace_back(group, std::move(r));
+  }
+  std::stable_sort(keyed.begin(), keyed.end(),
+                   [](const auto& a, const auto& b) { return a.first < b.first; });
+  rows.clear();
+  for (auto& [key, r] : keyed) rows.push_back(std::move(r));
   std::printf("drd load figures — %s\n%s\n%s%s\n\n", Today().c_str(), machine.c_str(),
               sizes.c_str(), o.smoke ? " (smoke run: figures not judged)" : "");
   PrintTable(rows);
