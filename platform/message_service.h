@@ -3,7 +3,10 @@
 // A Listener accepts on a Unix stream socket ($DR_SOCKET_DIR/<service name>,
 // or the socket systemd passed) and hands each new peer of the daemon's own
 // uid to its handler on the event queue it was given; peers of another uid
-// are closed at once with a log line. Each PeerConnection reads DRM1 frames
+// are closed at once with a log line. New peers are handed over one at a time
+// in turns by process: a process that connects in a loop gets one turn per
+// round, so another process's new connection waits for at most one of its
+// connections, not for all of them. Each PeerConnection reads DRM1 frames
 // on a thread of its own and delivers its events to its handler one at a
 // time, in order: a message per frame, and a final kConnectionInvalid when
 // the peer hangs up, breaks the protocol (logged, and only that connection
@@ -142,8 +145,11 @@ class Listener {
   const std::string& path() const { return path_; }
 
  private:
+  struct Arrivals;  // accepted connections waiting for the event queue
+
   Listener(int fd, std::string path, bool ownsPath, SerialQueue* queue);
   void acceptLoop();
+  void handOver(std::shared_ptr<PeerConnection> connection);
 
   const int fd_;
   const int wakeFd_;
@@ -151,6 +157,7 @@ class Listener {
   const bool ownsPath_;
   SerialQueue* const queue_;
   std::function<void(std::shared_ptr<PeerConnection>)> handler_;
+  std::shared_ptr<Arrivals> arrivals_;  // shared with the work queued on queue_
   std::thread thread_;
   std::atomic<bool> stopping_{false};
 };

@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <deque>
+#include <map>
 
 #include "core/log.h"
 #include "platform/file_system.h"
@@ -304,8 +306,45 @@ Result<std::unique_ptr<Listener>> Listener::Create(const ListenerOptions& option
   return std::unique_ptr<Listener>(new Listener(fd, path, true, eventQueue));
 }
 
+// Connections accepted and not yet handed to the handler, by peer process,
+// and the order in which the processes take their turns.
+struct Listener::Arrivals {
+  std::mutex mu;
+  std::map<pid_t, std::deque<std::shared_ptr<PeerConnection>>> waiting;  // guarded by mu
+  std::deque<pid_t> turns;  // guarded by mu: each process with waiting connections, once
+
+  void add(std::shared_ptr<PeerConnection> connection) {
+    std::lock_guard<std::mutex> lock(mu);
+    auto& queue = waiting[connection->pid()];
+    if (queue.empty()) turns.push_back(connection->pid());
+    queue.push_back(std::move(connection));
+  }
+  // The first connection of the process whose turn it is; that process goes
+  // to the back of the line if it has more.
+  std::shared_ptr<PeerConnection> next() {
+    std::lock_guard<std::mutex> lock(mu);
+    if (turns.empty()) return nullptr;
+    const pid_t pid = turns.front();
+    turns.pop_front();
+    auto it = waiting.find(pid);
+    std::shared_ptr<PeerConnection> connection = std::move(it->second.front());
+    it->second.pop_front();
+    if (it->second.empty()) {
+      waiting.erase(it);
+    } else {
+      turns.push_back(pid);
+    }
+    return connection;
+  }
+};
+
 Listener::Listener(int fd, std::string path, bool ownsPath, SerialQueue* queue)
-    : fd_(fd), wakeFd_(MakeWakeFd()), path_(std::move(path)), ownsPath_(ownsPath), queue_(queue) {}
+    : fd_(fd),
+      wakeFd_(MakeWakeFd()),
+      path_(std::move(path)),
+      ownsPath_(ownsPath),
+      queue_(queue),
+      arrivals_(std::make_shared<Arrivals>()) {}
 
 Listener::~Listener() {
   stop();
@@ -366,11 +405,18 @@ void Listener::acceptLoop() {
     int pidfd = -1;
     len = sizeof pidfd;
     if (::getsockopt(fd, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &len) == 0) token.pidfd = pidfd;
-    std::shared_ptr<PeerConnection> connection(new PeerConnection(fd, token));
-    if (handler_) {
-      queue_->async([handler = handler_, connection] { handler(connection); });
-    }
+    handOver(std::shared_ptr<PeerConnection>(new PeerConnection(fd, token)));
   }
+}
+
+void Listener::handOver(std::shared_ptr<PeerConnection> connection) {
+  if (!handler_) return;
+  arrivals_->add(std::move(connection));
+  // One piece of work per connection, each taking whichever connection's
+  // turn it is when it runs.
+  queue_->async([handler = handler_, arrivals = arrivals_] {
+    if (std::shared_ptr<PeerConnection> next = arrivals->next()) handler(next);
+  });
 }
 
 }  // namespace dr

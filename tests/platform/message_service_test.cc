@@ -2,18 +2,21 @@
 
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
 #include <fstream>
 #include <thread>
+#include <vector>
 
 #include "core/log.h"
 #include "tests/support/process_fixtures.h"
@@ -258,6 +261,63 @@ TEST_F(MessageServiceTest, RefusesPeersOfAnotherUser) {
   ASSERT_TRUE(WIFEXITED(status));
   EXPECT_EQ(WEXITSTATUS(status), 0);
   EXPECT_TRUE(log.contains("refusing peer pid"));
+}
+
+// A process that connects in a loop must not make another process's new
+// connection wait behind all of its own: connections are handed over in
+// turns by process. The handler is made slow for the looping process's
+// connections, so they pile up; the test's own connection must come within
+// the first few turns instead of after all of them.
+TEST_F(MessageServiceTest, NewPeersTakeTurnsByProcess) {
+  auto listener = Listener::Create(options_, &queue_);
+  ASSERT_TRUE(listener) << listener.error().description();
+  std::mutex mu;
+  std::vector<pid_t> order;
+  (*listener)->setEventHandler([&](std::shared_ptr<PeerConnection> c) {
+    if (c->pid() != ::getpid()) std::this_thread::sleep_for(20ms);
+    std::lock_guard<std::mutex> lock(mu);
+    order.push_back(c->pid());
+  });
+  (*listener)->resume();
+  constexpr int kLooped = 40;
+  int ready[2];
+  ASSERT_EQ(::pipe(ready), 0);
+  // The child only makes system calls: the parent has threads running.
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, (*listener)->path().c_str(), sizeof addr.sun_path - 1);
+  pid_t child = ::fork();
+  if (child == 0) {
+    for (int i = 0; i < kLooped; ++i) {
+      int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) ::_exit(2);
+    }
+    char byte = 1;
+    if (::write(ready[1], &byte, 1) != 1) ::_exit(3);
+    ::pause();  // keep the connections open until the parent is done
+    ::_exit(0);
+  }
+  ::close(ready[1]);
+  char byte = 0;
+  ASSERT_EQ(::read(ready[0], &byte, 1), 1);
+  ::close(ready[0]);
+  Peer mine((*listener)->path());
+  ASSERT_TRUE(mine.connected());
+  for (int i = 0; i < 500; ++i) {
+    {
+      std::lock_guard<std::mutex> lock(mu);
+      if (order.size() == kLooped + 1) break;
+    }
+    std::this_thread::sleep_for(10ms);
+  }
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
+  (*listener)->stop();
+  queue_.sync([] {});
+  std::lock_guard<std::mutex> lock(mu);
+  ASSERT_EQ(order.size(), static_cast<size_t>(kLooped + 1));
+  const auto at = std::find(order.begin(), order.end(), ::getpid()) - order.begin();
+  EXPECT_LT(at, 5) << "the test's connection came after " << at << " of the other process's";
 }
 
 }  // namespace
