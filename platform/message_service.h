@@ -6,7 +6,10 @@
 // are closed at once with a log line. New peers are handed over one at a time
 // in turns by process: a process that connects in a loop gets one turn per
 // round, so another process's new connection waits for at most one of its
-// connections, not for all of them. Each PeerConnection reads DRM1 frames
+// connections, not for all of them. At most kMaxWaitingConnections wait
+// for their turn; beyond that new peers stay in the socket's backlog until
+// the queue catches up, so a peer connecting in a loop cannot exhaust the
+// daemon's descriptors. Each PeerConnection reads DRM1 frames
 // on a thread of its own and delivers its events to its handler one at a
 // time, in order: a message per frame, and a final kConnectionInvalid when
 // the peer hangs up, breaks the protocol (logged, and only that connection
@@ -130,6 +133,8 @@ struct ListenerOptions {
 
 class Listener {
  public:
+  static constexpr size_t kMaxWaitingConnections = 256;
+
   // Opens the listening socket, suspended until resume(). A stale socket file
   // (nobody accepts on it) is replaced; a live one means the name is taken,
   // and anything else at that path is left alone: both are errors.

@@ -9,6 +9,7 @@
 
 #include <cerrno>
 #include <chrono>
+#include <condition_variable>
 #include <cstring>
 #include <deque>
 #include <map>
@@ -310,14 +311,17 @@ Result<std::unique_ptr<Listener>> Listener::Create(const ListenerOptions& option
 // and the order in which the processes take their turns.
 struct Listener::Arrivals {
   std::mutex mu;
+  std::condition_variable room;
   std::map<pid_t, std::deque<std::shared_ptr<PeerConnection>>> waiting;  // guarded by mu
   std::deque<pid_t> turns;  // guarded by mu: each process with waiting connections, once
+  size_t count = 0;         // guarded by mu: connections in `waiting`
 
   void add(std::shared_ptr<PeerConnection> connection) {
     std::lock_guard<std::mutex> lock(mu);
     auto& queue = waiting[connection->pid()];
     if (queue.empty()) turns.push_back(connection->pid());
     queue.push_back(std::move(connection));
+    ++count;
   }
   // The first connection of the process whose turn it is; that process goes
   // to the back of the line if it has more.
@@ -334,7 +338,18 @@ struct Listener::Arrivals {
     } else {
       turns.push_back(pid);
     }
+    if (count-- == kMaxWaitingConnections) room.notify_all();
     return connection;
+  }
+  // Blocks while kMaxWaitingConnections wait, until one is handed over or
+  // `stopping` is set (and room notified).
+  void waitForRoom(const std::atomic<bool>& stopping) {
+    std::unique_lock<std::mutex> lock(mu);
+    room.wait(lock, [&] { return count < kMaxWaitingConnections || stopping; });
+  }
+  void wakeAll() {
+    std::lock_guard<std::mutex> lock(mu);
+    room.notify_all();
   }
 };
 
@@ -364,6 +379,7 @@ void Listener::resume() {
 
 void Listener::stop() {
   stopping_ = true;
+  arrivals_->wakeAll();
   uint64_t one = 1;
   [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
   if (thread_.joinable()) thread_.join();
@@ -371,6 +387,11 @@ void Listener::stop() {
 
 void Listener::acceptLoop() {
   while (!stopping_) {
+    // A peer connecting faster than connections are handed over would
+    // otherwise hold an unbounded number of descriptors here; beyond the
+    // limit new peers wait in the socket's backlog instead.
+    arrivals_->waitForRoom(stopping_);
+    if (stopping_) return;
     struct pollfd fds[2] = {{fd_, POLLIN, 0}, {wakeFd_, POLLIN, 0}};
     if (::poll(fds, 2, -1) < 0) {
       if (errno == EINTR) continue;

@@ -14,7 +14,9 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
+#include <future>
 #include <thread>
 #include <vector>
 
@@ -318,6 +320,66 @@ TEST_F(MessageServiceTest, NewPeersTakeTurnsByProcess) {
   ASSERT_EQ(order.size(), static_cast<size_t>(kLooped + 1));
   const auto at = std::find(order.begin(), order.end(), ::getpid()) - order.begin();
   EXPECT_LT(at, 5) << "the test's connection came after " << at << " of the other process's";
+}
+
+size_t OpenDescriptors() {
+  size_t n = 0;
+  for ([[maybe_unused]] const auto& e : std::filesystem::directory_iterator("/proc/self/fd")) ++n;
+  return n;
+}
+
+// While connections are not handed over (the event queue is busy), no more
+// than kMaxWaitingConnections are accepted; the rest wait in the backlog and
+// all are handed over once the queue moves again.
+TEST_F(MessageServiceTest, AcceptsNoMoreThanTheWaitingLimitWhileTheQueueIsBusy) {
+  auto listener = Listener::Create(options_, &queue_);
+  ASSERT_TRUE(listener) << listener.error().description();
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  std::atomic<size_t> handed{0};
+  (*listener)->setEventHandler([&](std::shared_ptr<PeerConnection>) {
+    if (handed++ == 0) released.wait();
+  });
+  const size_t base = OpenDescriptors();
+  (*listener)->resume();
+  constexpr int kPeers = 2 * Listener::kMaxWaitingConnections;
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, (*listener)->path().c_str(), sizeof addr.sun_path - 1);
+  int ready[2];
+  ASSERT_EQ(::pipe(ready), 0);
+  pid_t child = ::fork();
+  if (child == 0) {  // system calls only: the parent has threads running
+    for (int i = 0; i < kPeers; ++i) {
+      int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) ::_exit(2);
+    }
+    char byte = 1;
+    if (::write(ready[1], &byte, 1) != 1) ::_exit(3);
+    ::pause();
+    ::_exit(0);
+  }
+  ::close(ready[1]);
+  char byte = 0;
+  ASSERT_EQ(::read(ready[0], &byte, 1), 1);
+  ::close(ready[0]);
+  // Each accepted connection holds its socket, a wake-up descriptor and, where
+  // the kernel gives one, a pidfd: at most three.
+  const size_t limit = 3 * (Listener::kMaxWaitingConnections + 1) + 8;
+  for (int i = 0; i < 100 && OpenDescriptors() - base < 2 * Listener::kMaxWaitingConnections; ++i) {
+    std::this_thread::sleep_for(20ms);
+  }
+  std::this_thread::sleep_for(200ms);  // room for the listener to overrun, were it to
+  EXPECT_LE(OpenDescriptors() - base, limit);
+  release.set_value();
+  for (int i = 0; i < 500 && handed < static_cast<size_t>(kPeers); ++i) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_EQ(handed, static_cast<size_t>(kPeers));
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
+  (*listener)->stop();
+  queue_.sync([] {});
 }
 
 }  // namespace
