@@ -62,6 +62,9 @@ class InputFileSystem : public FileSystem {
   Status makeDirectories(const std::string&, mode_t) override {
     return Error(kFileErrorDomain, 0, "read-only");
   }
+  Result<size_t> removeLeftoverTemporaries(const std::string&) override {
+    return Error(kFileErrorDomain, 0, "read-only");
+  }
 };
 
 // Answers the fuzzed SDK for every extension point.

@@ -5,7 +5,8 @@
 // temporary is renamed over the target, and the folder is fsynced, so that a
 // crash at any point leaves either the old file or the new one, whole. A
 // failure before the rename leaves the old file untouched and removes the
-// temporary.
+// temporary; a process killed before the rename leaves the temporary
+// ("<name>.tmp-<UUID>"), which removeLeftoverTemporaries clears at start.
 //
 // FileSystem is an interface so that tests can inject faults;
 // FileSystem::Default() is the real one. Implementations are safe to use from
@@ -50,6 +51,14 @@ class FileSystem {
   // Succeeds when the folder exists already.
   virtual Status makeDirectories(const std::string& path, mode_t mode = 0700) = 0;
 
+  // Removes the temporaries that writes to `path` left beside it when the
+  // writing process died before renaming them: the regular files named
+  // "<file name of path>.tmp-<UUID>" in its folder. Answers how many were
+  // removed (0 when there is no such folder). REQUIRES: no write to `path`
+  // is in progress (call it before the first one, as the file's only
+  // writer). Errors: kFileErrorDomain / kFileWriteError.
+  virtual Result<size_t> removeLeftoverTemporaries(const std::string& path) = 0;
+
   static constexpr size_t kDefaultMaxRead = size_t{256} << 20;
 
   // The real file system. Never null; lives for the whole process.
@@ -73,6 +82,9 @@ class FileSystemWrapper : public FileSystem {
   }
   Status makeDirectories(const std::string& path, mode_t mode) override {
     return target_->makeDirectories(path, mode);
+  }
+  Result<size_t> removeLeftoverTemporaries(const std::string& path) override {
+    return target_->removeLeftoverTemporaries(path);
   }
 
  private:

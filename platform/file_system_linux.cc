@@ -1,3 +1,4 @@
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -144,6 +145,38 @@ class LinuxFileSystem final : public FileSystem {
     if (::stat(path.c_str(), &st) != 0) return FileError(kFileWriteError, errno, "stat " + path);
     if (!S_ISDIR(st.st_mode)) return FileError(kFileWriteError, ENOTDIR, "mkdir " + path);
     return Status::OK();
+  }
+
+  Result<size_t> removeLeftoverTemporaries(const std::string& path) override {
+    const std::string folder = ParentOf(path);
+    const std::string prefix = path.substr(path.rfind('/') + 1) + ".tmp-";
+    DIR* dir = ::opendir(folder.c_str());
+    if (dir == nullptr) {
+      if (errno == ENOENT || errno == ENOTDIR) return size_t{0};  // nothing was ever saved there
+      return FileError(kFileWriteError, errno, "open folder " + folder);
+    }
+    size_t removed = 0;
+    int failure = 0;
+    std::string failed;
+    while (struct dirent* entry = ::readdir(dir)) {
+      std::string_view name = entry->d_name;
+      // Only names writes make: the prefix and a UUID, nothing else.
+      if (!name.starts_with(prefix) || !Uuid::parse(name.substr(prefix.size()))) continue;
+      struct stat st;
+      if (::fstatat(::dirfd(dir), entry->d_name, &st, AT_SYMLINK_NOFOLLOW) != 0 ||
+          !S_ISREG(st.st_mode)) {
+        continue;
+      }
+      if (::unlinkat(::dirfd(dir), entry->d_name, 0) == 0) {
+        ++removed;
+      } else if (errno != ENOENT && failure == 0) {
+        failure = errno;
+        failed = folder + "/" + entry->d_name;
+      }
+    }
+    ::closedir(dir);
+    if (failure != 0) return FileError(kFileWriteError, failure, "remove " + failed);
+    return removed;
   }
 };
 

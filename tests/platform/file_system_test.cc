@@ -102,5 +102,54 @@ TEST(FileSystemTest, ReadsWholeFilesAndRefusesTheRest) {
   }
 }
 
+// After a crash between creating a temporary and renaming it, only files
+// named exactly as a write to that target names its temporaries go.
+TEST(FileSystemTest, RemovesOnlyTheLeftoverTemporariesOfItsTarget) {
+  TempFolder dir;
+  FileSystem* fs = FileSystem::Default();
+  const std::string uuid = "0F1E2D3C-4B5A-4978-8695-A4B3C2D1E0F9";
+  const std::string lower = "0f1e2d3c-4b5a-4978-8695-a4b3c2d1e0f9";
+  ASSERT_TRUE(fs->writeFileAtomically(dir / "Annotations", "kept"));
+  struct Entry {
+    std::string name;
+    bool folder;
+    bool removed;
+  };
+  const Entry entries[] = {
+      {"Annotations.tmp-" + uuid, false, true},
+      {"Annotations.tmp-" + lower, false, true},
+      {"Annotations.tmp-" + uuid + "x", false, false},  // not a name a write makes
+      {"Annotations.tmp-notauuid", false, false},
+      {"Annotations.tmp-", false, false},
+      {"Other.tmp-" + uuid, false, false},  // another target's
+      {"XAnnotations.tmp-" + uuid, false, false},
+      {"Annotations.tmp-1F1E2D3C-4B5A-4978-8695-A4B3C2D1E0F9", true, false},  // a folder
+  };
+  for (const Entry& e : entries) {
+    if (e.folder) {
+      std::filesystem::create_directory(dir / e.name);
+    } else {
+      ASSERT_TRUE(fs->writeFileAtomically(dir / e.name, "partial"));
+    }
+  }
+  std::filesystem::create_symlink(dir / "Annotations",
+                                  dir / ("Annotations.tmp-" + uuid.substr(0, 35) + "0"));
+
+  Result<size_t> removed = fs->removeLeftoverTemporaries(dir / "Annotations");
+  ASSERT_TRUE(removed) << removed.error().description();
+  EXPECT_EQ(*removed, 2u);
+  Names expected = {"Annotations", "Annotations.tmp-" + uuid.substr(0, 35) + "0"};
+  for (const Entry& e : entries) {
+    if (!e.removed) expected.push_back(e.name);
+  }
+  std::sort(expected.begin(), expected.end());
+  EXPECT_EQ(NamesIn(dir.path()), expected);
+  EXPECT_EQ(ReadBytes(dir / "Annotations"), "kept");
+
+  // Nothing left: none removed; no folder: none either.
+  EXPECT_EQ(*fs->removeLeftoverTemporaries(dir / "Annotations"), 0u);
+  EXPECT_EQ(*fs->removeLeftoverTemporaries(dir / "missing/Annotations"), 0u);
+}
+
 }  // namespace
 }  // namespace dr
