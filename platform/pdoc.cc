@@ -653,17 +653,7 @@ class XmlWriter {
         }
         out_ += "<dict>\n";
         for (const auto& [key, element] : dict) {
-          path_.push_back({key, 0, false});
-          if (auto problem = XmlTextProblem(key)) {
-            path_.pop_back();
-            return Unwritable(Where() + "a key " + *problem);
-          }
-          Indent(level + 1);
-          out_ += "<key>";
-          Escape(key);
-          out_ += "</key>";
-          if (auto error = Write(element, level + 1)) return error;
-          path_.pop_back();
+          if (auto error = WriteEntry(key, element, level + 1)) return error;
         }
         Indent(level);
         out_ += "</dict>\n";
@@ -671,6 +661,23 @@ class XmlWriter {
       }
     }
     return Unwritable("unknown value type");
+  }
+
+  // One dictionary entry on lines indented `level` steps: the key element,
+  // then the value's elements.
+  std::optional<Error> WriteEntry(std::string_view key, const Value& element, int level) {
+    path_.push_back({key, 0, false});
+    if (auto problem = XmlTextProblem(key)) {
+      path_.pop_back();
+      return Unwritable(Where() + "a key " + *problem);
+    }
+    Indent(level);
+    out_ += "<key>";
+    Escape(key);
+    out_ += "</key>";
+    if (auto error = Write(element, level)) return error;
+    path_.pop_back();
+    return std::nullopt;
   }
 
   std::string& out() { return out_; }
@@ -812,6 +819,12 @@ Result<std::string> WriteXml(const Value& value) {
   writer.out() = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<pdoc version=\"1.0\">\n  ";
   if (std::optional<Error> error = writer.Write(value, 1)) return *error;
   writer.out() += "</pdoc>\n";
+  return std::move(writer.out());
+}
+
+Result<std::string> WriteXmlEntry(std::string_view key, const Value& value, int depth) {
+  XmlWriter writer;
+  if (std::optional<Error> error = writer.WriteEntry(key, value, depth + 1)) return *error;
   return std::move(writer.out());
 }
 

@@ -54,6 +54,15 @@ Result<Value> Parse(std::string_view bytes);
 // that is not UTF-8 or holds characters XML 1.0 cannot carry.
 Result<std::string> WriteXml(const Value& value);
 
+// The text of one entry, `key` with `value`, of a dictionary lying `depth`
+// levels inside <pdoc> (the document's own value lies at depth 1), exactly as
+// WriteXml writes that entry there. WriteXml's text of a non-empty dictionary
+// holds its entries' texts one after another in ascending key order, so a
+// caller that keeps each entry's text can rebuild a large document after a
+// change by writing only the changed entry. Fails as WriteXml does (the
+// message's path starts at `key`).
+Result<std::string> WriteXmlEntry(std::string_view key, const Value& value, int depth);
+
 // Reads and parses the file at `path`; file errors as FileSystem::readFile.
 Result<Value> ReadFile(const std::string& path, FileSystem* fs = FileSystem::Default());
 

@@ -22,6 +22,29 @@ constexpr const char* kDataKey = "data";
 constexpr const char* kFolderName = "com.corvel.dromon";
 constexpr const char* kFileName = "Annotations";
 
+// The "data" dictionary lies this many levels inside the document.
+constexpr int kDataDepth = 2;
+
+// The file's text before and after the entries of a non-empty "data"
+// dictionary: the layout written with one stand-in entry, cut around that
+// entry's text. The rest of the layout never changes, so this is made once.
+struct FileFrame {
+  std::string head, tail;
+};
+
+const FileFrame& FrameAroundEntries() {
+  static const FileFrame frame = [] {
+    const Value standIn(true);
+    const std::string doc =
+        *pdoc::WriteXml(Value{{kVersionKey, DRDAnnotationStore::kDatabaseVersion},
+                              {kDataKey, Value(Dictionary{{"", standIn}})}});
+    const std::string entry = *pdoc::WriteXmlEntry("", standIn, kDataDepth);
+    const size_t at = doc.find(entry);
+    return FileFrame{doc.substr(0, at), doc.substr(at + entry.size())};
+  }();
+  return frame;
+}
+
 // The user's state folder is handed around in a buffer of this many bytes,
 // terminator included; a longer path counts as no folder at all.
 constexpr size_t kUserDirectoryBufferSize = 1024;
@@ -74,13 +97,23 @@ std::unique_ptr<DRDAnnotationStore> DRDAnnotationStore::initWithDatabase(
   } else {
     store->annotationsURL_ = defaultDatabaseURL(store->options_);
   }
+  // A process killed while saving leaves its temporary beside the file; drd
+  // is the file's only writer and nothing is being saved yet.
+  Result<size_t> leftovers =
+      store->options_.fileSystem->removeLeftoverTemporaries(store->annotationsURL_);
+  if (!leftovers.ok()) {
+    SystemLog("unable to remove leftover temporaries of %@: %@", store->annotationsURL_,
+              leftovers.error());
+  } else if (*leftovers > 0) {
+    SystemLog("removed %u leftover temporaries of %@", *leftovers, store->annotationsURL_);
+  }
   if (Status loaded = store->loadDb(); !loaded.ok()) {
     // A missing file is the first run, not damage; its domain is not compared.
     if (loaded.error().code() != kFileReadNoSuchFileError) {
       SystemLog("unable to load annotation database:%@ error:%@ (resetting)",
                 store->annotationsURL_, loaded.error());
     }
-    store->annotations_ = Dictionary();
+    store->setAnnotations(Dictionary());
   }
   return store;
 }
@@ -105,13 +138,63 @@ Status DRDAnnotationStore::loadDb() {
     return fail(DRMakeErrorWithFormat(
         kDRErrorVersion, "found database version %d without a data dictionary", version));
   }
-  annotations_ = data.dictionary();
+  setAnnotations(data.dictionary());
   return Status::OK();
 }
 
+void DRDAnnotationStore::setAnnotations(Dictionary table) {
+  annotations_ = std::move(table);
+  entryXml_.clear();
+  entryXmlValid_ = false;
+}
+
+void DRDAnnotationStore::updateEntryXml(const std::string& key) {
+  if (!entryXmlValid_) return;  // the next save writes every entry anyway
+  auto entry = annotations_.find(key);
+  if (entry == annotations_.end()) {
+    entryXml_.erase(key);
+    return;
+  }
+  Result<std::string> text = pdoc::WriteXmlEntry(key, entry->second, kDataDepth);
+  if (!text) {
+    entryXml_.clear();
+    entryXmlValid_ = false;
+    return;
+  }
+  entryXml_.insert_or_assign(key, std::move(*text));
+}
+
 Status DRDAnnotationStore::saveDb() {
-  Value doc{{kVersionKey, kDatabaseVersion}, {kDataKey, Value(annotations_)}};
-  return pdoc::WriteFile(annotationsURL_, doc, kFileMode, options_.fileSystem);
+  if (!entryXmlValid_) {
+    entryXml_.clear();
+    bool written = true;
+    for (const auto& [key, entry] : annotations_) {
+      Result<std::string> text = pdoc::WriteXmlEntry(key, entry, kDataDepth);
+      if (!text) {
+        written = false;
+        break;
+      }
+      entryXml_.emplace_hint(entryXml_.end(), key, std::move(*text));
+    }
+    if (!written) entryXml_.clear();
+    entryXmlValid_ = written;
+  }
+  if (!entryXmlValid_ || annotations_.empty()) {
+    // The whole table through the writer: an empty "data" has a form of its
+    // own, and an entry that cannot be written fails the save with the
+    // writer's own message.
+    Value doc{{kVersionKey, kDatabaseVersion}, {kDataKey, Value(annotations_)}};
+    return pdoc::WriteFile(annotationsURL_, doc, kFileMode, options_.fileSystem);
+  }
+  const FileFrame& frame = FrameAroundEntries();
+  size_t size = frame.head.size() + frame.tail.size();
+  for (const auto& [key, text] : entryXml_) size += text.size();
+  std::string file;
+  file.reserve(size);
+  file += frame.head;
+  for (const auto& [key, text] : entryXml_) file += text;
+  file += frame.tail;
+  return options_.fileSystem->writeFileAtomically(annotationsURL_, file, kFileMode);
 }
 
 Value DRDAnnotationStore::annotationForPlugIn(const DRDPlugIn& plugIn) const {
@@ -143,6 +226,7 @@ void DRDAnnotationStore::setAnnotationForPlugIn(const Value& annotation, const D
     for (const auto& [name, value] : annotation.dictionary()) merged[name] = value;
     annotations_[key] = Value(std::move(merged));
   }
+  updateEntryXml(key);
   if (Status saved = saveDb(); !saved.ok()) {
     SystemLog("unable to save annotations:%@ error:%@", annotationsURL_, saved.error());
   }

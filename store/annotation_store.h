@@ -16,12 +16,16 @@
 // Writing the whole file on each change was chosen over an append log: the
 // table holds one small entry per annotated plug-in identifier and changes
 // only on user action, and a whole file replaced by rename is never half
-// written.
+// written. Serialising a table of a thousand entries costs more than the
+// write itself, so the store keeps each entry's XML text beside the table and
+// a change rewrites only the changed entry's text; the file is those texts
+// joined, the same bytes as serialising the whole table.
 #pragma once
 
 #include <sys/types.h>
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -94,21 +98,29 @@ class DRDAnnotationStore {
   // Replaces the table with the contents of the annotation file. On failure
   // the table is unchanged and the "db-load" probe fires with the error.
   Status loadDb();
-  // Writes the whole table to the annotation file, atomically.
+  // Writes the whole table to the annotation file, atomically and durably.
   Status saveDb();
 
   const std::string& annotationsURL() const { return annotationsURL_; }
   void setAnnotationsURL(std::string url) { annotationsURL_ = std::move(url); }
   // The table: annotation key → annotation dictionary.
   const Dictionary& annotations() const { return annotations_; }
-  void setAnnotations(Dictionary table) { annotations_ = std::move(table); }
+  void setAnnotations(Dictionary table);
 
  private:
   explicit DRDAnnotationStore(AnnotationStoreOptions options);
 
+  // Brings the kept text of the entry under `key` in step with the table.
+  void updateEntryXml(const std::string& key);
+
   AnnotationStoreOptions options_;
   std::string annotationsURL_;
   Dictionary annotations_;
+  // The XML text of every entry of annotations_, by key, while entryXmlValid_;
+  // after the table is replaced whole, or when an entry cannot be written,
+  // the next save writes the whole table (and its errors) as before.
+  std::map<std::string, std::string, std::less<>> entryXml_;
+  bool entryXmlValid_ = false;
 };
 
 }  // namespace dr

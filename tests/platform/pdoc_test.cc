@@ -223,6 +223,56 @@ TEST(PdocTest, RefusesToWriteWhatPdocCannotHold) {
   }
 }
 
+// Entries written one at a time, joined in key order, must give exactly the
+// bytes of the dictionary written whole, at any depth; a stand-in entry's
+// text marks where the entries go.
+TEST(PdocTest, EntriesWrittenAloneJoinToTheWholeDictionary) {
+  const Value nested{
+      {"list", Value(Array{1, "two", Value::EmptyArray(), Value::EmptyDictionary()})},
+      {"inner", Value{{"deep", Value{{"x", -1.5}}}}}};
+  const Dictionary rows[] = {
+      {{"only", 1}},
+      {{"b", 2}, {"a", 1}, {"B", 3}, {"", "empty key"}, {"\xc3\xa9t\xc3\xa9", "accented key"}},
+      {{"a&b<c>d", "x & y"}, {"cr\rkey", "line\r\n"}, {"quote\"'", "<tag>"}},
+      {{"settings", nested},
+       {"when", Value(Date{1769860800.125})},
+       {"bytes", Value(Data{0, 1, 255})},
+       {"big", Value(std::numeric_limits<uint64_t>::max())},
+       {"flag", false},
+       {"empty", Value::EmptyDictionary()}},
+  };
+  const Value standIn(true);
+  for (const Dictionary& dict : rows) {
+    for (int depth = 1; depth <= 3; ++depth) {
+      SCOPED_TRACE(Value(dict).description() + " at depth " + std::to_string(depth));
+      // The dictionary, or the stand-in, wrapped to lie `depth` levels down.
+      auto wrap = [depth](Value inner) {
+        for (int d = 1; d < depth; ++d) inner = Value{{"w", inner}};
+        return inner;
+      };
+      std::string whole = *WriteXml(wrap(Value(dict)));
+      std::string joined;
+      for (const auto& [key, value] : dict) {
+        Result<std::string> entry = WriteXmlEntry(key, value, depth);
+        ASSERT_TRUE(entry) << entry.error().description();
+        joined += *entry;
+      }
+      std::string frame = *WriteXml(wrap(Value(Dictionary{{"", standIn}})));
+      std::string mark = *WriteXmlEntry("", standIn, depth);
+      size_t at = frame.find(mark);
+      ASSERT_NE(at, std::string::npos);
+      EXPECT_EQ(frame.replace(at, mark.size(), joined), whole);
+    }
+  }
+  // What WriteXml refuses, an entry refuses too.
+  Result<std::string> uuid = WriteXmlEntry("id", Value{{"u", Uuid::random()}}, 2);
+  ASSERT_FALSE(uuid);
+  EXPECT_NE(uuid.error().localizedDescription().find("at /id/u: a UUID"), std::string::npos)
+      << uuid.error().description();
+  EXPECT_FALSE(WriteXmlEntry("k\xff", 1, 2));
+  EXPECT_FALSE(WriteXmlEntry("k", Value(), 2));
+}
+
 TEST(PdocTest, FilesRoundTripAndKeepTheirErrorDomains) {
   registry_test::TempFolder dir;
   const std::string path = dir / "Info.pdoc";

@@ -1,6 +1,7 @@
 // The annotation store over real files: load, reset and save, merging writes,
-// election reports, failing saves, the default location and a crash in the
-// middle of a stream of saves.
+// election reports, failing saves, saved bytes equal to the whole table
+// written at once, the default location and a crash in the middle of a stream
+// of saves.
 #include "store/annotation_store.h"
 
 #include <gtest/gtest.h>
@@ -257,6 +258,105 @@ TEST_F(AnnotationStoreTest, FailedSavesKeepMemoryAndLogEachTime) {
   store->setAnnotationForPlugIn(Value{{"election", 1}}, *Record("com.example.b"));
   EXPECT_EQ(log.lines().size(), 1u);
   EXPECT_EQ(OnDisk()["data"].size(), 3u);
+}
+
+// Every save must write exactly the bytes of the whole table written at once,
+// whatever the changes before it: entries added out of order, keys that need
+// escaping, nested settings, merges, erasures down to an empty table, a
+// reloaded file and a table replaced whole.
+TEST_F(AnnotationStoreTest, SavesWriteTheBytesOfTheWholeTable) {
+  auto fileIsTable = [&](const DRDAnnotationStore& store) {
+    EXPECT_EQ(FileSystem::Default()->readFile(file_).value_or("(none)"),
+              Xml(Value{{"version", 16}, {"data", Value(store.annotations())}}));
+  };
+  const Value nested{{"list", Value(Array{1, "a<b", Value::EmptyDictionary()})},
+                     {"inner", Value{{"r", 0.5}}}};
+  struct Step {
+    const char* what;
+    std::string id;
+    Value set;
+  } steps[] = {
+      {"first entry", "com.example.m", Value{{"election", 1}}},
+      {"before it", "com.example.a", Value{{"election", -1}, {"extension", nested}}},
+      {"after it", "com.example.z", Value{{"extension", Value::EmptyDictionary()}}},
+      {"key needing escapes", "com.example.a&b<c>", Value{{"election", 1}}},
+      {"merge into the middle", "com.example.m", Value{{"extension", nested}}},
+      {"nested change", "com.example.a", Value{{"extension", Value{{"inner", "x & y\r"}}}}},
+      {"erase the first", "com.example.a", Value()},
+      {"erase a missing key", "com.example.none", Value()},
+      {"erase the escaped", "com.example.a&b<c>", Value()},
+      {"erase the middle", "com.example.m", Value()},
+      {"erase the last", "com.example.z", Value()},
+      {"add to the empty table", "com.example.b", Value{{"election", 0}}},
+  };
+  auto store = Open(file_);
+  for (const Step& s : steps) {
+    SCOPED_TRACE(s.what);
+    auto record = Record(s.id);
+    ASSERT_TRUE(record);
+    store->setAnnotationForPlugIn(s.set, *record);
+    fileIsTable(*store);
+  }
+  EXPECT_EQ(store->annotations().size(), 1u);
+
+  auto reopened = Open(file_);
+  reopened->setAnnotationForPlugIn(Value{{"election", 1}}, *Record("com.example.c"));
+  fileIsTable(*reopened);
+  reopened->setAnnotations(Dictionary{{"com.example.y", Value{{"election", 1}}}});
+  reopened->setAnnotationForPlugIn(Value{{"election", 2}}, *Record("com.example.x"));
+  fileIsTable(*reopened);
+  EXPECT_EQ(reopened->annotations().size(), 2u);
+}
+
+// A change whose save failed is kept in memory and in the next save, which
+// writes the table as memory holds it, never text from before the change. An
+// entry the file cannot hold fails every save, with the writer's message,
+// until it is gone.
+TEST_F(AnnotationStoreTest, FailedSavesLeaveNoStaleTextForTheNextSave) {
+  FailingWrites failing;
+  auto store = Open(file_, &failing);
+  const Value unwritable{{"extension", Value{{"id", Uuid::random()}}}};
+  struct Step {
+    const char* what;
+    std::string id;
+    Value set;
+    bool writesFail;
+    std::string logged;  // the start of the logged error; "" when saved
+  } steps[] = {
+      {"saved", "com.example.a", Value{{"election", 1}}, false, ""},
+      {"changed, not saved", "com.example.a", Value{{"election", -1}}, true, "file error 512"},
+      {"added, not saved", "com.example.b", Value{{"election", 1}}, true, "file error 512"},
+      {"erased, not saved", "com.example.a", Value(), true, "file error 512"},
+      {"saved again", "com.example.c", Value{{"election", 1}}, false, ""},
+      {"re-added, not saved", "com.example.a", Value{{"election", 1}}, true, "file error 512"},
+      {"unwritable", "com.example.d", unwritable, false,
+       "pdoc error 2: at /data/com.example.d/extension/id: a UUID"},
+      {"still unwritable", "com.example.c", Value{{"election", 0}}, false,
+       "pdoc error 2: at /data/com.example.d/extension/id: a UUID"},
+      {"unwritable gone", "com.example.d", Value(), false, ""},
+  };
+  for (const Step& s : steps) {
+    SCOPED_TRACE(s.what);
+    failing.fail = s.writesFail;
+    const std::string before = FileSystem::Default()->readFile(file_).value_or("(none)");
+    ScopedLogCapture log;
+    store->setAnnotationForPlugIn(s.set, *Record(s.id));
+    std::vector<std::string> lines = log.lines();
+    if (s.logged.empty()) {
+      EXPECT_TRUE(lines.empty());
+      EXPECT_EQ(FileSystem::Default()->readFile(file_).value_or("(none)"),
+                Xml(Value{{"version", 16}, {"data", Value(store->annotations())}}));
+    } else {
+      ASSERT_EQ(lines.size(), 1u);
+      EXPECT_TRUE(
+          lines[0].starts_with("unable to save annotations:" + file_ + " error:" + s.logged))
+          << lines[0];
+      EXPECT_EQ(FileSystem::Default()->readFile(file_).value_or("(none)"), before);
+    }
+  }
+  EXPECT_EQ(OnDisk()["data"], (Value{{"com.example.a", Value{{"election", 1}}},
+                                     {"com.example.b", Value{{"election", 1}}},
+                                     {"com.example.c", Value{{"election", 0}}}}));
 }
 
 TEST_F(AnnotationStoreTest, DefaultLocationIsAPrivateFolderInTheStateHome) {
