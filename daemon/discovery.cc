@@ -1,5 +1,8 @@
 #include "daemon/discovery.h"
 
+#include <algorithm>
+#include <iterator>
+
 #include "core/format.h"
 #include "model/helpers.h"
 #include "model/plugin_keys.h"
@@ -11,9 +14,6 @@ constexpr const char* kAnnotationsFormKey = "annotations";
 constexpr const char* kOverriderFormKey = "overrider";
 constexpr const char* kOverridingFormKey = "overriding";
 constexpr const char* kReplaceEntitlement = "com.corvel.developer.replace-plugin";
-// Older hosts still find the internal filters that ship outside any
-// application under this folder.
-constexpr const char* k17732150Path = "Effecta/InternalFilters.app";
 
 }  // namespace
 
@@ -45,6 +45,20 @@ const char* DiscoveryOutcomeName(DiscoveryOutcome outcome) {
       return "denied by the administrator's policy";
   }
   return "unknown";
+}
+
+std::optional<std::vector<uint32_t>> CandidatesToExamine(const PlugInSet& candidates,
+                                                         const Value& rules, uint64_t flags,
+                                                         bool needs17732150Workaround) {
+  std::optional<std::vector<uint32_t>> chosen = candidates.mayMatch(rules);
+  // DRDiscoverAll skips the visibility checks, and with them the workaround.
+  if (!chosen || !needs17732150Workaround || (flags & DRDiscoverAll)) return chosen;
+  const std::vector<uint32_t>& filters = candidates.internalFilters();
+  std::vector<uint32_t> merged;
+  merged.reserve(chosen->size() + filters.size());
+  std::set_union(chosen->begin(), chosen->end(), filters.begin(), filters.end(),
+                 std::back_inserter(merged));
+  return merged;
 }
 
 Discovery::Discovery(DiscoveryHost host, Value rules, uint64_t flags, Value exclusions,

@@ -29,6 +29,7 @@
 #include "core/value.h"
 #include "plugin/plugin.h"
 #include "plugin/plugin_client.h"
+#include "plugin/plugin_set.h"
 
 namespace dr {
 
@@ -88,6 +89,17 @@ struct DiscoveryServices {
   std::function<void(const std::string&)> log;    // always written
   std::function<void(const std::string&)> debug;  // written when verbose
 };
+
+// The ascending positions in `candidates` of the ones a request with `rules`
+// and `flags` must examine, for a host that does or does not need the
+// matching workaround; none when every candidate must be. The others would
+// each be skipped without a trace (no log line, no flag set, nothing
+// returned): rules they fail, and for the workaround host no internal
+// filter whose visibility check sets DRDiscoverDuplicates. Only the
+// verdicts of the candidates left out are lost.
+std::optional<std::vector<uint32_t>> CandidatesToExamine(const PlugInSet& candidates,
+                                                         const Value& rules, uint64_t flags,
+                                                         bool needs17732150Workaround);
 
 class Discovery {
  public:

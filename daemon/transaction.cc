@@ -320,7 +320,8 @@ void Transaction::matchPlugIns() {
     host.plugInsPath = bundle->plugInsPath();
     host.bundleIdentifier = bundle->bundleIdentifier().value_or("");
   }
-  host.needs17732150Workaround = client_->needs17732150Workaround();
+  const bool needs17732150Workaround = client_->needs17732150Workaround();
+  host.needs17732150Workaround = needs17732150Workaround;
   DRDServer& s = server();
   DiscoveryServices hooks;
   hooks.isHeld = [&s](const DRDPlugIn& p) { return s.holdOnPlugIn(p); };
@@ -336,9 +337,17 @@ void Transaction::matchPlugIns() {
   hooks.debug = [&s](const std::string& line) { s.debug("%@", line); };
   Discovery discovery(std::move(host), rules, flags, s.userPrefs().exclusions(), std::move(hooks));
 
-  std::vector<DRDPlugInPtr> candidates = s.findPlugIns(rules).value_or(std::vector<DRDPlugInPtr>{});
-  probes::DiscoverRaw(static_cast<uint32_t>(candidates.size()));
-  for (const DRDPlugInPtr& candidate : candidates) discovery.examine(candidate);
+  const std::shared_ptr<const PlugInSet> candidates = s.installedPlugIns();
+  probes::DiscoverRaw(static_cast<uint32_t>(candidates->size()));
+  const std::vector<DRDPlugInPtr>& records = candidates->records();
+  // Only the candidates whose examination can tell are examined: the rest
+  // would be skipped without a trace.
+  if (std::optional<std::vector<uint32_t>> chosen =
+          CandidatesToExamine(*candidates, rules, flags, needs17732150Workaround)) {
+    for (uint32_t position : *chosen) discovery.examine(records[position]);
+  } else {
+    for (const DRDPlugInPtr& candidate : records) discovery.examine(candidate);
+  }
   setReplyValue(kMatchesKey, discovery.finish());
   done();
 }

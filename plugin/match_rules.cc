@@ -59,6 +59,11 @@ const Value& DRDPlugIn::valueForRuleKey(std::string_view key, Value& holder) con
   return holder[key];
 }
 
+Value DRDPlugIn::ruleValue(std::string_view key) const {
+  Value holder;
+  return valueForRuleKey(key, holder);
+}
+
 bool DRDPlugIn::matchKeyPattern(std::string_view key, const Value& pattern) const {
   Value holder;
   const Value& value = valueForRuleKey(key, holder);

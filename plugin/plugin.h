@@ -89,6 +89,9 @@ class DRDPlugIn : public DRPlugInCore {
   bool matchValuePattern(std::string_view value, std::string_view pattern) const;
   // The plug-in's value as an activation rule against a host's items.
   bool matchDictionaryPattern(const Value& value, const Value& pattern) const;
+  // The plug-in's value that a rule with `key` is evaluated against (a copy;
+  // absent when it has none).
+  Value ruleValue(std::string_view key) const;
 
   // ---- Authorization and activation (authorization.cc) --------------------
 

@@ -49,6 +49,7 @@ DRDPlugInPtr DRDatabase::createPlugInForProxy(const RegistryEntryPtr& entry) {
   if (!record) return nullptr;
   if (record->hasEntitlement(kAutoElectEntitlement)) autoElect(*record);
   cache_[*record->uuid()] = record;
+  ++cacheGeneration_;
   return record;
 }
 
@@ -66,13 +67,30 @@ void DRDatabase::autoElect(const DRDPlugIn& record) {
 }
 
 std::optional<std::vector<DRDPlugInPtr>> DRDatabase::findPlugIns(const Value& /*rules*/) {
+  return installedPlugIns()->records();
+}
+
+std::shared_ptr<const PlugInSet> DRDatabase::installedPlugIns() {
+  // Read before the entries: a change committed after this read leaves the
+  // set made below stale.
+  const uint64_t changes = registryChanges_.load(std::memory_order_acquire);
+  std::shared_ptr<const PlugInSet> unchanged;
+  sync_.sync([&] {
+    if (installed_ && installedChanges_ == changes && installedGeneration_ == cacheGeneration_) {
+      unchanged = installed_;
+    }
+  });
+  if (unchanged) return unchanged;
+
   const RegistryEntries entries = options_.registry->allEntries();
   // Once the records are built (after the first discovery) every lookup is
   // a cache hit: they are all taken in one entry into the queue rather than
   // one entry per plug-in. Records still to be built are made one entry at
   // a time, as plugInForProxy does.
   std::vector<DRDPlugInPtr> cached(entries.size());
+  uint64_t generation = 0;
   sync_.sync([&] {
+    generation = cacheGeneration_;
     for (size_t i = 0; i < entries.size(); ++i) {
       auto it = cache_.find(entries[i]->uuid());
       if (it != cache_.end()) cached[i] = it->second;
@@ -80,12 +98,24 @@ std::optional<std::vector<DRDPlugInPtr>> DRDatabase::findPlugIns(const Value& /*
   });
   std::vector<DRDPlugInPtr> result;
   result.reserve(entries.size());
+  bool allCached = true;
   for (size_t i = 0; i < entries.size(); ++i) {
     if (entries[i]->url().empty()) continue;
+    allCached = allCached && cached[i] != nullptr;
     DRDPlugInPtr record = cached[i] ? std::move(cached[i]) : plugInForProxy(entries[i]);
     if (record) result.push_back(std::move(record));
   }
-  return result;
+  auto set = std::make_shared<const PlugInSet>(std::move(result));
+  // A set with a record built just now, or with an entry that made none, is
+  // not kept: the next call builds (or tries) again, as the cache would.
+  if (allCached) {
+    sync_.sync([&] {
+      installed_ = set;
+      installedChanges_ = changes;
+      installedGeneration_ = generation;
+    });
+  }
+  return set;
 }
 
 DRDPlugInPtr DRDatabase::findPlugIn(const Uuid& uuid) {
@@ -120,13 +150,21 @@ std::optional<std::vector<DRDPlugInPtr>> DRDatabase::plugInsWithinApplication(
   return result;
 }
 
+void DRDatabase::registryChanged() { registryChanges_.fetch_add(1, std::memory_order_release); }
+
 std::optional<Error> DRDatabase::addPlugIn(const std::string& url) {
-  if (options_.registry->registerBundle(url).ok()) return std::nullopt;
+  // Whatever the outcome, the registry may have changed by now; its events
+  // come later, while the caller may discover at once.
+  const bool ok = options_.registry->registerBundle(url).ok();
+  registryChanged();
+  if (ok) return std::nullopt;
   return DRMakeError(kDRErrorRegistrar, "Registrar failed to register the plug-in");
 }
 
 std::optional<Error> DRDatabase::removePlugIn(const std::string& url) {
-  if (options_.registry->unregisterBundle(url).ok()) return std::nullopt;
+  const bool ok = options_.registry->unregisterBundle(url).ok();
+  registryChanged();
+  if (ok) return std::nullopt;
   return DRMakeError(kDRErrorRegistrar, "Registrar failed to deregister the plug-in");
 }
 
@@ -153,6 +191,7 @@ DRDPlugInPtr DRDatabase::cachedPlugIn(const Uuid& uuid) {
 }
 
 void DRDatabase::pluginsDidInstall(const RegistryEntries& entries) {
+  registryChanged();
   for (const RegistryEntryPtr& entry : entries) {
     SystemLog("INSTALLED:%@ %@(%@) %@ %@", entry->bundleIdentifier(), entry->plugInIdentifier(),
               entry->bundleVersion(), Value(entry->uuid()), entry->url());
@@ -164,6 +203,7 @@ void DRDatabase::pluginsDidInstall(const RegistryEntries& entries) {
 }
 
 void DRDatabase::pluginsDidUninstall(const RegistryEntries& entries) {
+  registryChanged();
   sync_.sync([&] {
     for (const RegistryEntryPtr& entry : entries) {
       auto it = cache_.find(entry->uuid());
@@ -177,7 +217,11 @@ void DRDatabase::pluginsDidUninstall(const RegistryEntries& entries) {
       }
       SystemLog("UNINSTALLED:%@ %@(%@) %@ %@", entry->bundleIdentifier(), entry->plugInIdentifier(),
                 entry->bundleVersion(), entry->uuid().string(), entry->url());
-      if (it != cache_.end()) cache_.erase(it);
+      if (it != cache_.end()) {
+        cache_.erase(it);
+        ++cacheGeneration_;
+        installed_.reset();  // its records stay alive no longer than needed
+      }
     }
   });
   std::shared_ptr<DRDatabaseDelegate> delegate;

@@ -13,6 +13,7 @@
 // with the system-log lines the daemon defines; nothing throws.
 #pragma once
 
+#include <atomic>
 #include <cstring>
 #include <map>
 #include <memory>
@@ -28,6 +29,7 @@
 #include "platform/registry.h"
 #include "platform/usage_reports.h"
 #include "plugin/plugin.h"
+#include "plugin/plugin_set.h"
 #include "store/annotation_store.h"
 
 namespace dr {
@@ -76,6 +78,15 @@ class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<
   // Every installed plug-in that makes a record; none when the registry gives
   // no list. `rules` is not used: the caller filters.
   std::optional<std::vector<DRDPlugInPtr>> findPlugIns(const Value& rules);
+  // The same records, in the same order, as a set with rule indexes. While
+  // neither the registry nor the cache changes, every call answers the one
+  // set, so its indexes are built once and the registry's entries are not
+  // listed again. The registry is known to change when addPlugIn or
+  // removePlugIn returns (so a caller that registers and then discovers sees
+  // its change) and when the registry's events arrive, which covers a change
+  // made to the registry directly. An entry without a cached record is built
+  // (or tried again) as findPlugIns does, and such a set is not kept.
+  std::shared_ptr<const PlugInSet> installedPlugIns();
   // The plug-in named `uuid`, or none (logged).
   DRDPlugInPtr findPlugIn(const Uuid& uuid);
   // The plug-in whose bundle is at `url`, or none (logged).
@@ -122,6 +133,17 @@ class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<
   };
   // Every discovery looks up each installed plug-in here, so hashed.
   std::unordered_map<Uuid, DRDPlugInPtr, UuidHash> cache_;  // on sync_ only
+  // Raised at every change of cache_, so a set made from it is known stale.
+  uint64_t cacheGeneration_ = 0;  // on sync_ only
+  // Raised after every change the database makes to the registry and at
+  // each of the registry's events.
+  std::atomic<uint64_t> registryChanges_{0};
+  void registryChanged();
+  // The last set installedPlugIns made wholly from cached records, with the
+  // registry changes and the cache generation it was made from; on sync_.
+  std::shared_ptr<const PlugInSet> installed_;
+  uint64_t installedChanges_ = 0;
+  uint64_t installedGeneration_ = 0;
   std::mutex delegateMu_;
   std::weak_ptr<DRDatabaseDelegate> delegate_;  // guarded by delegateMu_
   SerialQueue sync_{"DRDatabase"};

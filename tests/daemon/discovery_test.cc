@@ -153,5 +153,76 @@ TEST_F(DiscoveryTest, WorkaroundBitStaysSetForLaterCandidates) {
   EXPECT_NE(logged[0].find("found a 17732150 PlugIn: " + *first->path()), std::string::npos);
 }
 
+TEST_F(DiscoveryTest, ExaminingTheChosenCandidatesAnswersAsExaminingAll) {
+  // An internal filter that fails the rules comes first: for an old host its
+  // visibility check still sets the bit that keeps equal copies below.
+  RegistryEntry::Fields f;
+  f.uuid = Uuid::random();
+  f.url = registry_test::MakeBundle(folder / "Effecta/InternalFilters.app/f.appex", PlugInInfo("f"),
+                                    Sandboxed());
+  f.plugInIdentifier = "com.example.f.ext";
+  auto files = std::make_shared<RegistryBundleFiles>(pdoc::WriteXml(PlugInInfo("f")).value(),
+                                                     pdoc::WriteXml(Sandboxed()).value());
+  std::vector<DRDPlugInPtr> records{
+      DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services())};
+  auto named = [&](const std::string& name, const char* point, double registered) {
+    RegistryEntry::Fields g;
+    g.registrationDate = Date{registered};
+    g.containingApplication = RegistryApplication{folder / "App.app", "App"};
+    return make(PlugInInfo(name, Value(), Value{{"UXExtensionPointName", point}}), Sandboxed(),
+                std::move(g));
+  };
+  records.push_back(named("a", "viewer", 1));
+  records.push_back(named("b", "editor", 1));
+  records.push_back(named("a", "viewer", 2));  // the same identifier and version
+  records.push_back(named("c", "viewer", 1));
+  for (const DRDPlugInPtr& r : records) ASSERT_TRUE(r);
+  const PlugInSet set(records);
+
+  struct Row {
+    const char* what;
+    Value rules;
+    uint64_t flags;
+    bool workaround;
+  } rows[] = {
+      {"new host", Value{{"UXExtensionPointName", "viewer"}}, 0x1, false},
+      {"old host keeps equal copies", Value{{"UXExtensionPointName", "viewer"}}, 0x1, true},
+      {"old host, newest copy", Value{{"UXExtensionPointName", "viewer"}}, 0, true},
+      {"old host, system only", Value{{"UXExtensionPointName", "=viewer"}}, 0x9, true},
+      {"everything", Value{{"UXExtensionPointName", "editor"}}, DRDiscoverAll, true},
+      {"rules not indexed", Value{{"UXExtensionPointName", ">=a"}}, 0x1, true},
+  };
+  for (const Row& row : rows) {
+    DiscoveryHost h;
+    h.client = &host;
+    h.needs17732150Workaround = row.workaround;
+    auto run = [&](const std::vector<DRDPlugInPtr>& examined, std::vector<std::string>& logged) {
+      DiscoveryServices services;
+      services.log = [&](const std::string& line) { logged.push_back(line); };
+      services.debug = services.log;
+      Discovery d(h, row.rules, row.flags, Value(), services);
+      for (const DRDPlugInPtr& p : examined) d.examine(p);
+      return std::make_pair(d.finish(), d.flags());
+    };
+    std::optional<std::vector<uint32_t>> chosen =
+        CandidatesToExamine(set, row.rules, row.flags, row.workaround);
+    std::vector<DRDPlugInPtr> some = records;
+    if (chosen) {
+      some.clear();
+      for (uint32_t i : *chosen) some.push_back(records[i]);
+    }
+    std::vector<std::string> allLogged, someLogged;
+    auto all = run(records, allLogged);
+    auto picked = run(some, someLogged);
+    EXPECT_EQ(picked.first, all.first) << row.what;
+    EXPECT_EQ(picked.second, all.second) << row.what;
+    EXPECT_EQ(someLogged, allLogged) << row.what;
+    if (std::string(row.what) == "old host keeps equal copies") {
+      EXPECT_EQ(all.first.size(), 3u);  // both copies of "a", and "c"
+      EXPECT_LT(some.size(), records.size());
+    }
+  }
+}
+
 }  // namespace
 }  // namespace dr::test

@@ -241,5 +241,46 @@ TEST_F(DatabaseTest, ApplicationsAnswerTheirPlugInsOrNone) {
   EXPECT_FALSE(db_->plugInsWithinApplication(folder_ / "Other.app").has_value());
 }
 
+TEST_F(DatabaseTest, InstalledSetIsKeptUntilTheRegistryOrTheCacheChanges) {
+  RegistryEntryPtr a = Add("a", Info("com.example.a"));
+  Add("open", Info("com.example.open"), Value());  // makes no record
+  ASSERT_TRUE(a);
+  ScopedLogCapture log;
+
+  // The first set builds the records; the refused plug-in is tried (and
+  // logged) every time, so no set with it is kept.
+  std::shared_ptr<const PlugInSet> first = db_->installedPlugIns();
+  ASSERT_EQ(first->size(), 1u);
+  EXPECT_NE(db_->installedPlugIns(), first);
+  EXPECT_TRUE(log.contains("ignoring mis-configured plug-in"));
+  ASSERT_FALSE(db_->removePlugIn(folder_ / "open.appex").has_value());
+  // Events change the registry as far as the set knows: let them all pass.
+  ASSERT_TRUE(WaitFor(log, "UNINSTALLED:com.example.open"));
+
+  // Once every record is cached, the set is answered again as it is.
+  std::shared_ptr<const PlugInSet> cached = db_->installedPlugIns();
+  ASSERT_EQ(cached->size(), 1u);
+  EXPECT_EQ(cached->records().front(), first->records().front());
+  EXPECT_EQ(db_->installedPlugIns(), cached);
+
+  // A plug-in added is seen at once, before the registry's event arrives.
+  RegistryEntryPtr b = Add("b", Info("com.example.b"));
+  ASSERT_TRUE(b);
+  std::shared_ptr<const PlugInSet> grown = db_->installedPlugIns();
+  ASSERT_EQ(grown->size(), 2u);
+  EXPECT_EQ(*grown->records().back()->uuid(), b->uuid());
+  std::shared_ptr<const PlugInSet> again = db_->installedPlugIns();
+  EXPECT_EQ(again->size(), 2u);
+
+  // And one removed is gone at once.
+  ASSERT_FALSE(db_->removePlugIn(a->url()).has_value());
+  std::shared_ptr<const PlugInSet> shrunk = db_->installedPlugIns();
+  ASSERT_EQ(shrunk->size(), 1u);
+  EXPECT_EQ(*shrunk->records().front()->uuid(), b->uuid());
+  auto all = db_->findPlugIns(Value());
+  ASSERT_TRUE(all.has_value());
+  EXPECT_EQ(*all, shrunk->records());
+}
+
 }  // namespace
 }  // namespace dr
