@@ -46,21 +46,31 @@ void SerialQueue::async(std::function<void()> work) {
     state_->pending.emplace_back(state_->nextTicket++, std::move(work));
     if (!state_->worker.joinable()) state_->worker = std::thread(runWorker, state_);
   }
-  state_->cv.notify_all();
+  state_->cv.notify_one();
 }
 
 void SerialQueue::enter() {
   std::unique_lock<std::mutex> lock(state_->mu);
-  uint64_t ticket = state_->nextTicket++;
-  state_->cv.wait(lock, [&] { return state_->serving == ticket; });
+  const uint64_t ticket = state_->nextTicket++;
+  if (state_->serving == ticket) return;
+  std::condition_variable turn;
+  state_->waiting.emplace(ticket, &turn);
+  turn.wait(lock, [&] { return state_->serving == ticket; });
+  state_->waiting.erase(ticket);
 }
 
 void SerialQueue::leave() {
-  {
-    std::lock_guard<std::mutex> lock(state_->mu);
-    ++state_->serving;
+  std::lock_guard<std::mutex> lock(state_->mu);
+  advance(*state_);
+}
+
+void SerialQueue::advance(State& s) {
+  ++s.serving;
+  if (auto it = s.waiting.find(s.serving); it != s.waiting.end()) {
+    it->second->notify_one();
+  } else if (!s.pending.empty() && s.pending.front().first == s.serving) {
+    s.cv.notify_one();
   }
-  state_->cv.notify_all();
 }
 
 void SerialQueue::sync(const std::function<void()>& work) {
@@ -94,8 +104,7 @@ void SerialQueue::runWorker(std::shared_ptr<State> s) {
       work = nullptr;  // release captures before the next turn
     }
     lock.lock();
-    ++s->serving;
-    s->cv.notify_all();
+    advance(*s);
   }
 }
 

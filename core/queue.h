@@ -17,6 +17,7 @@
 #include <cstdint>
 #include <deque>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -65,14 +66,20 @@ class SerialQueue {
   // released from inside its own work leaves the thread nothing dangling.
   struct State {
     std::mutex mu;
-    std::condition_variable cv;
-    uint64_t nextTicket = 0;  // guarded by mu
-    uint64_t serving = 0;     // guarded by mu: the ticket whose turn it is
+    std::condition_variable cv;  // the worker's: async work may have its turn
+    // Each sync() caller waiting for its turn, by ticket, on a condition of
+    // its own: a turn ends by waking the one thread whose turn is next, not
+    // every waiter (thousands of dying connections may be waiting at once).
+    std::map<uint64_t, std::condition_variable*> waiting;  // guarded by mu
+    uint64_t nextTicket = 0;                               // guarded by mu
+    uint64_t serving = 0;  // guarded by mu: the ticket whose turn it is
     std::deque<std::pair<uint64_t, std::function<void()>>> pending;  // guarded by mu
     bool stopping = false;                                           // guarded by mu
     std::thread worker;                                              // guarded by mu
   };
   static void runWorker(std::shared_ptr<State> state);
+  // Gives the turn to the next ticket and wakes its holder. REQUIRES: mu held.
+  static void advance(State& state);
   void enter();  // waits for the caller's turn
   void leave();  // ends the current turn
 

@@ -45,6 +45,38 @@ TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
   for (int i = 0; i < 200; ++i) EXPECT_EQ(mine[i], i);
 }
 
+// Hundreds of threads waiting at once (as when many connections die
+// together), each mixing sync and async work: every piece runs once, alone,
+// and every waiter gets its turn (a lost wake-up hangs this test).
+TEST(SerialQueueTest, ManyWaitersEachGetTheirTurn) {
+  SerialQueue q("test");
+  constexpr int kThreads = 256, kEach = 20;
+  int ran = 0;  // unguarded on purpose: the queue is the guard
+  std::atomic<int> running{0};
+  std::atomic<bool> overlapped{false};
+  auto work = [&] {
+    if (running.fetch_add(1) != 0) overlapped = true;
+    ++ran;
+    running.fetch_sub(1);
+  };
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < kEach; ++i) {
+        if ((t + i) % 2) {
+          q.sync(work);
+        } else {
+          q.async(work);
+        }
+      }
+    });
+  }
+  for (auto& t : threads) t.join();
+  q.sync([] {});
+  EXPECT_FALSE(overlapped);
+  EXPECT_EQ(ran, kThreads * kEach);
+}
+
 TEST(SerialQueueTest, SyncRunsOnTheCallersThreadAndKnowsItsQueue) {
   SerialQueue a("a"), b("b");
   const auto caller = std::this_thread::get_id();
