@@ -24,9 +24,17 @@
 //   W5 drd's peak resident set (VmHWM) after W2 and after W3
 //   W6 one "annotate" with 1,000 annotated plug-ins in the file, against
 //      writing, syncing and renaming a file of the same size
+//   W7 64 clients each sending 2,000 mixed requests, alone and then beside
+//      hostile peers (malformed frames, a peer that never reads, a
+//      connect/disconnect loop) in another process; drd's memory afterwards
 #include <fcntl.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/utsname.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -61,10 +69,11 @@ struct Sizes {
   int w3Apps, w3Points, w3PerPoint, w3Requests;
   int w4Runs;
   int w6Requests;
-  int rounds;  // drd, the floor and D-Bus take turns this many times
+  int w7Clients, w7Requests;  // per client
+  int rounds;                 // drd, the floor and D-Bus take turns this many times
 };
-constexpr Sizes kFull = {1000, 20000, 8, 50, 100, 100, 1000, 10, 10, 100, 100, 5, 40, 10};
-constexpr Sizes kSmoke = {10, 200, 8, 2, 3, 4, 6, 2, 2, 5, 4, 1, 2, 2};
+constexpr Sizes kFull = {1000, 20000, 8, 50, 100, 100, 1000, 10, 10, 100, 100, 5, 40, 64, 2000, 10};
+constexpr Sizes kSmoke = {10, 200, 8, 2, 3, 4, 6, 2, 2, 5, 4, 1, 2, 4, 12, 2};
 
 struct Options {
   std::string drd;
@@ -259,6 +268,178 @@ void DurableReplace(const std::string& target, const std::string& bytes) {
   ::close(dir);
 }
 
+// ---- W7: many clients, then the same beside hostile peers -------------------
+
+constexpr uint64_t kHoldPlugIn = 2;  // "lock" flags: hold the plug-in at a path
+
+// The plug-ins a W7 client works on: their UUIDs and bundle paths.
+struct Targets {
+  Array uuids;
+  std::vector<std::string> paths;
+};
+
+// One W7 client: `count` requests, one after another, cycling through
+// "match" for one extension point, "annotate", "lock" holding the client's
+// own plug-in and then releasing that hold, "access" and "ready". Every
+// request must get its reply (the client library pairs them by serial);
+// "access" and "ready" may be refused for a plug-in, which is still an
+// answer. Latencies go to `out`.
+void MixedClient(const std::string& socketFolder, const Targets& t, int points, int client,
+                 int count, Samples* out) {
+  auto c = Open(socketFolder);
+  const size_t n = t.uuids.size();
+  const Value own = Value(t.paths[static_cast<size_t>(client) % n]);
+  Value hold;
+  out->micros.reserve(static_cast<size_t>(count));
+  for (int i = 0; i < count; ++i) {
+    const Value uuid = t.uuids[(static_cast<size_t>(client) * 7919 + static_cast<size_t>(i)) % n];
+    Value request;
+    bool mayBeRefused = false;
+    switch (i % 6) {
+      case 0:
+        request = MatchPoint((client + i) % points);
+        break;
+      case 1:
+        request = Envelope("annotate")
+                      .changing("uuids", Value(Array{uuid}))
+                      .changing("annotations", Value{{"extension", Value{{"c", client}}}});
+        break;
+      case 2:
+        request =
+            Envelope("lock").changing("flags", kHoldPlugIn).changing("paths", Value(Array{own}));
+        break;
+      case 3:
+        request = Envelope("lock").changing("uuids", Value(Array{hold}));
+        break;
+      case 4:
+        request = Envelope("access").changing("uuids", Value(Array{uuid}));
+        mayBeRefused = true;
+        break;
+      case 5:
+        request = Envelope("ready").changing("uuids", Value(Array{uuid}));
+        mayBeRefused = true;
+        break;
+    }
+    Clock::time_point t0 = Clock::now();
+    dr::Result<Value> reply = c->request(request, kRequestTimeout);
+    out->add(Micros(t0, Clock::now()));
+    if (!reply) Die("W7: client " + std::to_string(client) + ": " + reply.error().description());
+    if (reply->has("errorcode") && !mayBeRefused) {
+      Die("W7: client " + std::to_string(client) + ": \"" + request["request"].stringValue() +
+          "\" answered error " + std::to_string((*reply)["errorcode"].intValue()) + " \"" +
+          (*reply)["error"].stringValue() + "\"");
+    }
+    if (i % 6 == 2) {
+      hold = (*reply)["uuids"];
+      if (!hold.isUuid()) Die("W7: a hold without its token");
+    }
+  }
+}
+
+// `clients` MixedClients at once; their latencies together.
+Samples MixedLoad(const std::string& socketFolder, const Targets& t, int points, int clients,
+                  int count) {
+  std::vector<Samples> each(static_cast<size_t>(clients));
+  std::vector<std::thread> threads;
+  for (int k = 0; k < clients; ++k) {
+    threads.emplace_back(MixedClient, socketFolder, std::cref(t), points, k, count,
+                         &each[static_cast<size_t>(k)]);
+  }
+  for (std::thread& th : threads) th.join();
+  Samples all;
+  for (const Samples& s : each)
+    all.micros.insert(all.micros.end(), s.micros.begin(), s.micros.end());
+  return all;
+}
+
+// A raw DRM1 connection to drd, or -1.
+int RawConnect(const std::string& socketFolder) {
+  const std::string path = socketFolder + "/" + kServiceName;
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd >= 0 && ::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+bool SendAll(int fd, const std::string& bytes) {
+  for (size_t at = 0; at < bytes.size();) {
+    ssize_t n = ::send(fd, bytes.data() + at, bytes.size() - at, MSG_NOSIGNAL);
+    if (n <= 0) return false;
+    at += static_cast<size_t>(n);
+  }
+  return true;
+}
+
+// The hostile peers (`load --hostile-peers FOLDER`, a process of its own so
+// that drd sees them as another client process): until killed, one thread
+// sends complete but malformed frames, each on a new connection, and waits
+// for drd to close it; one pipelines small requests and never reads a reply
+// (drd closes it when its replies pass the queue limit; it then starts
+// again); one connects and disconnects as fast as it can, half the time
+// leaving a request behind.
+[[noreturn]] void HostilePeers(const std::string& socketFolder) {
+  const Value match = Envelope("match");
+  const std::string good = *dr::drm1::EncodeFrame(1, 0, dr::drm1::kFlagWantsReply, match);
+  std::vector<std::string> malformed;
+  for (size_t at : {size_t{0}, size_t{7}, dr::drm1::kHeaderSize}) {
+    std::string f = good;
+    f[at] = '\x7f';  // bad magic, a body past the limit, an unknown tag
+    malformed.push_back(f);
+  }
+  const Value release = Envelope("lock").changing("uuids", Value(Array{dr::Uuid::random()}));
+  std::thread flooder([&] {
+    for (size_t k = 0;; ++k) {
+      int fd = RawConnect(socketFolder);
+      if (fd < 0) continue;
+      char sink[4096];
+      if (SendAll(fd, malformed[k % malformed.size()])) {
+        while (::recv(fd, sink, sizeof sink, 0) > 0) {
+        }
+      }
+      ::close(fd);
+    }
+  });
+  std::thread deaf([&] {
+    for (;;) {
+      int fd = RawConnect(socketFolder);
+      if (fd < 0) continue;
+      for (uint64_t serial = 1;; ++serial) {
+        if (!SendAll(fd, *dr::drm1::EncodeFrame(serial, 0, dr::drm1::kFlagWantsReply, release))) {
+          break;
+        }
+      }
+      ::close(fd);
+    }
+  });
+  for (uint64_t k = 1;; ++k) {
+    int fd = RawConnect(socketFolder);
+    if (fd < 0) continue;
+    if (k % 2) SendAll(fd, *dr::drm1::EncodeFrame(k, 0, dr::drm1::kFlagWantsReply, release));
+    ::close(fd);
+  }
+}
+
+// Starts this program again as the hostile peers of the drd serving
+// `socketFolder`.
+pid_t StartHostilePeers(const std::string& socketFolder) {
+  char self[4096] = {};
+  if (::readlink("/proc/self/exe", self, sizeof self - 1) <= 0) Die("cannot find this program");
+  pid_t pid = ::fork();
+  if (pid < 0) Die("fork failed");
+  if (pid == 0) {
+    ::prctl(PR_SET_PDEATHSIG, SIGKILL);  // never outlive a load run that died
+    if (::getppid() == 1) ::_exit(1);
+    ::execl(self, self, "--hostile-peers", socketFolder.c_str(), static_cast<char*>(nullptr));
+    ::_exit(127);
+  }
+  return pid;
+}
+
 std::string Today() {
   std::time_t now = std::time(nullptr);
   char buffer[64];
@@ -402,6 +583,7 @@ Options Parse(int argc, char** argv) {
 }
 
 int Main(int argc, char** argv) {
+  if (argc == 3 && std::string(argv[1]) == "--hostile-peers") HostilePeers(argv[2]);
   const Options o = Parse(argc, argv);
   const Sizes z = o.smoke ? kSmoke : kFull;
   const std::string loadAtStart = LoadAverage();
@@ -420,7 +602,7 @@ int Main(int argc, char** argv) {
   std::optional<Drd> small;
   long smallPeakKiB = 0;
   double addRate = 0;
-  if (o.runs("W1") || o.runs("W3") || o.runs("W6")) {
+  if (o.runs("W1") || o.runs("W3") || o.runs("W6") || o.runs("W7")) {
     log("making " + std::to_string(z.w3Points * z.w3PerPoint) + " bundles");
     BundleSet set =
         MakeBundles(root.path() + "/apps-small", sdk, z.w3Apps, z.w3Points, z.w3PerPoint);
@@ -563,6 +745,64 @@ int Main(int argc, char** argv) {
                         Latency(allMicros), "", "", "", ""});
       }
     }
+    if (o.runs("W7")) {
+      log("W7");
+      Targets t;
+      const Value listing = Ask(*c, Envelope("match"), "match");
+      for (const Value& form : listing["matches"].array()) {
+        auto id = dr::Uuid::parse(form["uuid"].stringValue());
+        if (!id || !form["path"].isString()) Die("W7: a form without a UUID or path");
+        t.uuids.push_back(Value(*id));
+        t.paths.push_back(form["path"].stringValue());
+      }
+      if (static_cast<int>(t.paths.size()) < z.w7Clients) Die("W7: fewer plug-ins than clients");
+      const int total7 = z.w7Clients * z.w7Requests;
+      MixedLoad(small->socketFolder(), t, z.w3Points, z.w7Clients, std::max(6, z.w7Requests / 10));
+      const long baseKiB = small->residentKiB();
+      double cpu = small->cpuSeconds();
+      Clock::time_point t0 = Clock::now();
+      const Samples quiet =
+          MixedLoad(small->socketFolder(), t, z.w3Points, z.w7Clients, z.w7Requests);
+      const double quietSeconds = Micros(t0, Clock::now()) / 1e6;
+      const double quietCpu = small->cpuSeconds() - cpu;
+      const pid_t hostile = StartHostilePeers(small->socketFolder());
+      std::this_thread::sleep_for(std::chrono::milliseconds(500));  // let them get going
+      cpu = small->cpuSeconds();
+      t0 = Clock::now();
+      const Samples beset =
+          MixedLoad(small->socketFolder(), t, z.w3Points, z.w7Clients, z.w7Requests);
+      const double besetSeconds = Micros(t0, Clock::now()) / 1e6;
+      const double besetCpu = small->cpuSeconds() - cpu;
+      ::kill(hostile, SIGKILL);
+      ::waitpid(hostile, nullptr, 0);
+      const long peakLoadKiB = small->residentKiB();
+      // Memory once the hostile peers' connections are gone and drd idles.
+      std::this_thread::sleep_for(std::chrono::seconds(2));
+      const long afterKiB = small->residentKiB();
+      Ask(*c, Envelope("match"), "match");  // still serving
+      const double ratio50 = beset.quantile(0.5) / std::max(1.0, quiet.quantile(0.5));
+      const double ratio99 = beset.quantile(0.99) / std::max(1.0, quiet.quantile(0.99));
+      const std::string label = "W7 " + std::to_string(z.w7Clients) + " clients × " +
+                                std::to_string(z.w7Requests) + " mixed requests";
+      rows.push_back({label, "p50 alone → beside hostile peers",
+                      Latency(quiet.quantile(0.5)) + " → " + Latency(beset.quantile(0.5)), "", "",
+                      "≤ 2×", Verdict(judged, ratio50 <= 2) + " (" + Fixed(ratio50, 2) + "×)"});
+      rows.push_back({"", "p99 alone → beside hostile peers",
+                      Latency(quiet.quantile(0.99)) + " → " + Latency(beset.quantile(0.99)), "", "",
+                      "", Fixed(ratio99, 2) + "×"});
+      rows.push_back({"", "requests per second, alone → beside",
+                      Rate(total7 / quietSeconds) + " → " + Rate(total7 / besetSeconds), "", "", "",
+                      ""});
+      rows.push_back({"", "drd CPU per request (mean), alone → beside",
+                      Latency(quietCpu * 1e6 / total7) + " → " + Latency(besetCpu * 1e6 / total7),
+                      "", "", "", ""});
+      rows.push_back(
+          {"", "replies, each exactly once", std::to_string(2 * total7), "", "", "", ""});
+      const bool back = afterKiB <= baseKiB + baseKiB / 4;
+      rows.push_back({"", "VmRSS before → end of load → 2 s later",
+                      Mib(baseKiB) + " → " + Mib(peakLoadKiB) + " → " + Mib(afterKiB), "", "",
+                      "back to before", Verdict(judged, back)});
+    }
     smallPeakKiB = small->peakResidentKiB();
   }
 
@@ -671,7 +911,8 @@ int Main(int argc, char** argv) {
       " requests over " + std::to_string(z.w2Points) + " points × " + std::to_string(z.w2PerPoint) +
       " in " + std::to_string(z.w2Apps) + " apps; W3 " + std::to_string(z.w3Requests) +
       " requests; W4 " + std::to_string(z.w4Runs) + " starts; W6 " + std::to_string(z.w6Requests) +
-      " requests; each in " + std::to_string(z.rounds) +
+      " requests; W7 " + std::to_string(z.w7Clients) + " × " + std::to_string(z.w7Requests) +
+      " requests twice; W1-W6 each in " + std::to_string(z.rounds) +
       " rounds alternating with the floor and D-Bus";
   // The workloads in their order (the 1,000-plug-in drd ran W1, W3 and W6
   // first): rows after a workload's first row belong to it.
