@@ -83,7 +83,7 @@ void Discovery::setOutcome(size_t verdict, DiscoveryOutcome outcome, std::string
 
 bool Discovery::plugInMatches17732150Workaround(const DRDPlugIn& plugIn) const {
   const std::string path = plugIn.path().value_or("");
-  if (path.find(k17732150Path) == std::string::npos) return false;
+  if (!Is17732150Path(path)) return false;
   if (services_.log) {
     services_.log(Format("PlugIn matching for %@[%d] found a 17732150 PlugIn: %@",
                          host_.bundleIdentifier, host_.client->pid(), path));

@@ -10,6 +10,17 @@ namespace {
 
 bool IsDigit(char c) { return c >= '0' && c <= '9'; }
 
+// The texts an equality test can meet in `v`: a string, or an array's string
+// elements (others match nothing); none for another type.
+std::optional<std::vector<std::string_view>> TextsOf(const Value& v) {
+  if (std::optional<std::string_view> s = v.string()) return std::vector<std::string_view>{*s};
+  if (!v.isArray()) return std::nullopt;
+  std::vector<std::string_view> texts;
+  for (const Value& element : v.array())
+    if (std::optional<std::string_view> e = element.string()) texts.push_back(*e);
+  return texts;
+}
+
 // Whether evaluating `pattern` may do more than compare: a "?" operator asks
 // the type service (and an unknown one is logged), a dictionary is an
 // activation rule. Rules holding one are evaluated against every record.
@@ -30,17 +41,10 @@ bool MayHaveEffects(const Value& pattern) {
 // each without an operator or with "=". Any other operator, any text without
 // an equality key, or another type of pattern gives none.
 std::optional<std::vector<std::string>> EqualityOperands(const Value& pattern) {
-  std::vector<std::string_view> texts;
-  if (std::optional<std::string_view> s = pattern.string()) {
-    texts.push_back(*s);
-  } else if (pattern.isArray()) {
-    for (const Value& element : pattern.array())
-      if (std::optional<std::string_view> e = element.string()) texts.push_back(*e);
-  } else {
-    return std::nullopt;
-  }
+  std::optional<std::vector<std::string_view>> texts = TextsOf(pattern);
+  if (!texts) return std::nullopt;
   std::vector<std::string> keys;
-  for (std::string_view text : texts) {
+  for (std::string_view text : *texts) {
     if (!text.empty() && (text.front() == '<' || text.front() == '>')) return std::nullopt;
     if (!text.empty() && text.front() == '=') text.remove_prefix(1);
     std::optional<std::string> key = VersionEqualityKey(text);
@@ -78,7 +82,7 @@ PlugInSet::PlugInSet(std::vector<DRDPlugInPtr> records) : records_(std::move(rec
   for (uint32_t i = 0; i < records_.size(); ++i) {
     const DRDPlugIn* r = records_[i].get();
     if (r && !r->onSystemVolume() && !r->containingUrl() &&
-        r->path().value_or("").find(k17732150Path) != std::string::npos) {
+        Is17732150Path(r->path().value_or(""))) {
       internalFilters_.push_back(i);
     }
   }
@@ -94,16 +98,10 @@ PlugInSet::KeyIndex PlugInSet::buildIndex(std::string_view key) const {
     // through any of its string elements.
     keys.clear();
     bool keyed = true;
-    auto add = [&](std::string_view text) {
+    for (std::string_view text : TextsOf(value).value_or(std::vector<std::string_view>{})) {
       std::optional<std::string> k = VersionEqualityKey(text);
       if (k) keys.push_back(std::move(*k));
       keyed = keyed && k.has_value();
-    };
-    if (std::optional<std::string_view> s = value.string()) {
-      add(*s);
-    } else if (value.isArray()) {
-      for (const Value& element : value.array())
-        if (std::optional<std::string_view> e = element.string()) add(*e);
     }
     if (!keyed) {
       index.unkeyed.push_back(i);

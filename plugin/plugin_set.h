@@ -35,7 +35,10 @@ namespace dr {
 
 // Older hosts still find the internal filters that ship outside any
 // application under this folder.
-inline constexpr const char* k17732150Path = "Effecta/InternalFilters.app";
+inline constexpr std::string_view k17732150Path = "Effecta/InternalFilters.app";
+inline bool Is17732150Path(std::string_view path) {
+  return path.find(k17732150Path) != std::string_view::npos;
+}
 
 // A key under which two ASCII strings are equal exactly when
 // compareVersionString orders them the same: each run of digits stands for

@@ -96,6 +96,17 @@ PlugIns RegisterPlugIns(World& w, const std::string& prefix, int count) {
 
 // ---------------------------------------------------------------- crashes
 
+// Waits for a stream's first acknowledgement (or drd's end), lets the
+// stream run for a random while of up to `maxMs`, then SIGKILLs drd and
+// restarts it; false when that failed.
+bool KillMidStream(World& w, const std::atomic<int>& acks, std::mt19937& random, int maxMs) {
+  while (acks == 0 && Alive(w.drd().pid()))
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  std::this_thread::sleep_for(
+      std::chrono::milliseconds(std::uniform_int_distribution<int>(0, maxMs)(random)));
+  return w.kill9();
+}
+
 // Acknowledged "annotate" requests survive a SIGKILL at a random moment: a
 // writer thread sets "extension" = {"n": k} on plug-in k % count with
 // increasing k; after the crash each plug-in holds the last value drd
@@ -127,11 +138,7 @@ TEST(ReliabilityTest, AcknowledgedAnnotationsSurviveKill9) {
         ++acks;
       }
     });
-    while (acks == 0 && Alive(w.drd().pid()))
-      std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    std::this_thread::sleep_for(
-        std::chrono::milliseconds(std::uniform_int_distribution<int>(0, 300)(random)));
-    ASSERT_TRUE(w.kill9()) << w.log();
+    ASSERT_TRUE(KillMidStream(w, acks, random, 300)) << w.log();
     writer.join();
     acknowledged += static_cast<size_t>(acks);
 
@@ -197,11 +204,7 @@ TEST(ReliabilityTest, AcknowledgedRegistrationsSurviveKill9) {
         ++acks;
       }
     });
-    while (acks == 0 && Alive(w.drd().pid()))
-      std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    std::this_thread::sleep_for(
-        std::chrono::milliseconds(std::uniform_int_distribution<int>(0, 200)(random)));
-    ASSERT_TRUE(w.kill9()) << w.log();
+    ASSERT_TRUE(KillMidStream(w, acks, random, 200)) << w.log();
     adder.join();
 
     std::set<std::string> present;
