@@ -1,5 +1,6 @@
 #include "platform/drm1.h"
 
+#include <algorithm>
 #include <bit>
 #include <cstring>
 #include <string>
@@ -187,6 +188,40 @@ Status AppendText(std::string& out, std::string_view s, const char* what) {
   return Status::OK();
 }
 
+// The bytes Append writes for `v`, so that a large reply is built in one
+// allocation instead of growing (and copying) its buffer about twenty times.
+// Deeper nesting than the codec allows is not walked: Append refuses it.
+size_t EncodedSize(const Value& v, int depth) {
+  switch (v.type()) {
+    case Value::Type::kAbsent:
+    case Value::Type::kBool:
+      return 1;
+    case Value::Type::kInt:
+    case Value::Type::kUInt:
+    case Value::Type::kDouble:
+    case Value::Type::kDate:
+      return 1 + 8;
+    case Value::Type::kString:
+      return 1 + 4 + v.stringValue().size();
+    case Value::Type::kData:
+      return 1 + 4 + v.dataValue().size();
+    case Value::Type::kUuid:
+      return 1 + 16;
+    case Value::Type::kArray:
+    case Value::Type::kDictionary: {
+      size_t n = 1 + 4;
+      if (depth > kMaxDepth) return n;
+      if (v.isArray()) {
+        for (const Value& e : v.array()) n += EncodedSize(e, depth + 1);
+      } else {
+        for (const auto& [k, e] : v.dictionary()) n += 4 + k.size() + EncodedSize(e, depth + 1);
+      }
+      return n;
+    }
+  }
+  return 0;
+}
+
 Status Append(std::string& out, const Value& v, int depth) {
   if (out.size() > kMaxBodySize) return Unencodable("body larger than 16 MiB");
   switch (v.type()) {
@@ -278,6 +313,7 @@ Result<Value> DecodeBody(std::string_view body) { return BodyReader(body).readTo
 
 Result<std::string> EncodeValue(const Value& value) {
   std::string out;
+  out.reserve(std::min<size_t>(EncodedSize(value, 1), kMaxBodySize + 1));
   if (Status s = Append(out, value, 1); !s.ok()) return s.error();
   return out;
 }
@@ -285,7 +321,9 @@ Result<std::string> EncodeValue(const Value& value) {
 Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
                                 const Value& body) {
   if (!body.isDictionary()) return Unencodable("the body is not a dictionary");
-  std::string out(kHeaderSize, '\0');
+  std::string out;
+  out.reserve(kHeaderSize + std::min<size_t>(EncodedSize(body, 1), kMaxBodySize + 1));
+  out.resize(kHeaderSize);
   if (Status s = Append(out, body, 1); !s.ok()) return s.error();
   const size_t length = out.size() - kHeaderSize;
   if (length > kMaxBodySize) return Unencodable("body larger than 16 MiB");
