@@ -13,6 +13,7 @@
 #include "daemon/ipc_client.h"
 #include "daemon/server.h"
 #include "model/plugin_keys.h"
+#include "platform/file_system.h"
 #include "platform/message_keys.h"
 #include "platform/pdoc.h"
 #include "platform/probes.h"
@@ -45,13 +46,10 @@ constexpr RequestKind kRequests[] = {
     {"annotate", &Transaction::annotatePlugIns}, {"lock", &Transaction::lockDownPlugIns},
 };
 
-std::optional<std::string> CanonicalPath(const std::string& path) {
-  char* resolved = ::realpath(path.c_str(), nullptr);
-  if (!resolved) return std::nullopt;
-  std::string result(resolved);
-  ::free(resolved);
-  if (result.size() >= kMaxResolvedPath) return std::nullopt;
-  return result;
+std::optional<std::string> ResolvedPath(const std::string& path) {
+  Result<std::string> resolved = CanonicalPath(path);
+  if (!resolved.ok() || resolved->size() >= kMaxResolvedPath) return std::nullopt;
+  return std::move(resolved).value();
 }
 
 // A number as a message carries one: an integer or a floating-point value
@@ -142,7 +140,7 @@ bool Transaction::marshalPaths(const PathOperation& operation) {
       failMessage(kErrorBadPath, Format("absolute path required: %s", path));
       return false;
     }
-    std::optional<std::string> canonical = CanonicalPath(path);
+    std::optional<std::string> canonical = ResolvedPath(path);
     if (!operation(canonical ? *canonical : path, canonical.has_value())) return false;
   }
   return true;

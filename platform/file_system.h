@@ -91,4 +91,11 @@ class FileSystemWrapper : public FileSystem {
   FileSystem* target_;
 };
 
+// `path` with every symbolic link, "." and ".." resolved, absolute (what
+// realpath(3) answers). It asks the kernel for the path of the opened file,
+// three system calls, where realpath looks up each component on its own;
+// when /proc cannot tell (not mounted, a file deleted meanwhile) it falls
+// back to realpath. Errors: kPosixErrorDomain with the errno of the lookup.
+Result<std::string> CanonicalPath(const std::string& path);
+
 }  // namespace dr

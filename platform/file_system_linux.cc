@@ -5,7 +5,10 @@
 
 #include <cerrno>
 #include <climits>
+#include <cstdlib>
+#include <memory>
 #include <string>
+#include <string_view>
 
 #include "core/value.h"
 #include "platform/file_system.h"
@@ -181,6 +184,27 @@ class LinuxFileSystem final : public FileSystem {
 };
 
 }  // namespace
+
+Result<std::string> CanonicalPath(const std::string& path) {
+  if (path.find('\0') != std::string::npos) return PosixError(EINVAL, "path holds NUL");
+  const int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
+  if (fd < 0) return PosixError(errno, "realpath " + path);
+  char link[PATH_MAX];
+  const std::string self = "/proc/self/fd/" + std::to_string(fd);
+  const ssize_t n = ::readlink(self.c_str(), link, sizeof link);
+  ::close(fd);
+  constexpr std::string_view kDeleted = " (deleted)";
+  if (n > 0 && static_cast<size_t>(n) < sizeof link && link[0] == '/') {
+    std::string resolved(link, static_cast<size_t>(n));
+    // The kernel marks a file removed since it was opened; a name that
+    // truly ends so is told apart by realpath below.
+    if (!resolved.ends_with(kDeleted)) return resolved;
+  }
+  std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr),
+                                                       &std::free);
+  if (!resolved) return PosixError(errno, "realpath " + path);
+  return std::string(resolved.get());
+}
 
 FileSystem* FileSystem::Default() {
   static LinuxFileSystem* fs = new LinuxFileSystem();

@@ -9,6 +9,7 @@
 #include <memory>
 
 #include "core/format.h"
+#include "platform/file_system.h"
 #include "platform/pdoc.h"
 
 namespace dr::registry_internal {
@@ -185,10 +186,9 @@ std::string LexicalPath(std::string_view path) {
 }
 
 std::optional<std::string> CanonicalPath(const std::string& path) {
-  std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr),
-                                                       &std::free);
-  if (!resolved) return std::nullopt;
-  return std::string(resolved.get());
+  Result<std::string> resolved = dr::CanonicalPath(path);
+  if (!resolved.ok()) return std::nullopt;
+  return std::move(resolved).value();
 }
 
 bool LiesUnder(std::string_view path, std::string_view root) {

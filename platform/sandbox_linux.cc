@@ -32,6 +32,7 @@
 #include <optional>
 #include <string>
 
+#include "platform/file_system.h"
 #include "platform/sandbox.h"
 
 namespace dr {
@@ -226,10 +227,9 @@ class LinuxSandbox final : public Sandbox {
     if (path.find('\0') != std::string::npos) return PosixError(EINVAL, "path holds NUL");
     std::string granted = path;
     if (flags & kExtensionCanonicalPath) {
-      char* resolved = ::realpath(path.c_str(), nullptr);
-      if (resolved == nullptr) return PosixError(errno, "realpath " + path);
-      granted = resolved;
-      std::free(resolved);
+      Result<std::string> resolved = CanonicalPath(path);
+      if (!resolved.ok()) return resolved.error();
+      granted = std::move(resolved).value();
     } else if (path.empty() || path[0] != '/') {
       return PosixError(EINVAL, "relative path " + path);
     }

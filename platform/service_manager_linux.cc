@@ -17,6 +17,7 @@
 
 #include "core/log.h"
 #include "platform/bundle_reader.h"
+#include "platform/file_system.h"
 #include "platform/locations.h"
 #include "platform/pdoc.h"
 #include "platform/process_info.h"
@@ -158,9 +159,7 @@ class LinuxServiceManager final : public ServiceManager {
 
     ExternalServiceGrant grant;
     grant.hostPid = hostPid;
-    char* real = ::realpath(executablePath.c_str(), nullptr);
-    grant.executablePath = real ? std::string(real) : executablePath;
-    std::free(real);
+    grant.executablePath = CanonicalPath(executablePath).value_or(executablePath);
     grant.overlay = overlay;
     identify(grant);
 

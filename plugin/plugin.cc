@@ -9,11 +9,14 @@
 #include <cstdlib>
 #include <cstring>
 #include <limits>
+#include <optional>
+#include <string_view>
 
 #include "core/format.h"
 #include "core/log.h"
 #include "model/plugin_keys.h"
 #include "platform/code_signing.h"
+#include "platform/file_system.h"
 #include "platform/sandbox.h"
 #include "plugin/plugin_keys.h"
 
@@ -46,20 +49,12 @@ std::vector<std::string> ResourceNames(const Value& resources) {
   return names;
 }
 
-// Whether `path` stays inside the bundle at `bundlePath` once links and ".."
-// are resolved. A plug-in names its resources, so a name such as
-// "../../.ssh" must not win hosts a token for a file outside its bundle. A
-// path that cannot be resolved is left to the sandbox to refuse.
-bool WithinBundle(const std::string& path, const std::string& bundlePath) {
-  // The bundle itself (the resource "." every app extension shares) needs no
-  // look at the disk; discovery issues it for every plug-in it returns.
-  if (path == bundlePath) return true;
-  char resolved[PATH_MAX];
-  char bundle[PATH_MAX];
-  if (::realpath(path.c_str(), resolved) == nullptr) return true;
-  if (::realpath(bundlePath.c_str(), bundle) == nullptr) return false;
-  std::string_view r(resolved), b(bundle);
-  return r == b || (r.starts_with(b) && r.size() > b.size() && r[b.size()] == '/');
+// Whether the canonical path `resolved` is the bundle at the canonical path
+// `bundle` or lies inside it. A plug-in names its resources, so a name such as
+// "../../.ssh" must not win hosts a token for a file outside its bundle.
+bool WithinBundle(std::string_view resolved, std::string_view bundle) {
+  return resolved == bundle || (resolved.starts_with(bundle) && resolved.size() > bundle.size() &&
+                                resolved[bundle.size()] == '/');
 }
 
 }  // namespace
@@ -114,14 +109,24 @@ void DRDPlugIn::augmentForm(Dictionary& form) const {
 Value DRDPlugIn::issueResourceExtensions(const Value& resources) const {
   Dictionary tokens;
   const std::string bundlePath = url().value_or(std::string());
+  std::optional<Result<std::string>> bundle;  // canonical, found when first needed
   for (const std::string& name : ResourceNames(resources)) {
     std::string path = name == kAppExtensionSharedPath ? bundlePath : bundlePath + "/" + name;
     int errnum = ENOSYS;  // no sandbox service: nothing can be issued
-    if (!WithinBundle(path, bundlePath)) {
-      errnum = EACCES;
-    } else if (services_.sandbox != nullptr) {
-      Result<std::string> token = services_.sandbox->issueFileExtension(
-          kReadOnlyFileExtensionClass, path, kExtensionCanonicalPath);
+    if (services_.sandbox != nullptr) {
+      // Resolved once: the path checked is the path granted, even if a link
+      // in it changes meanwhile.
+      Result<std::string> resolved = CanonicalPath(path);
+      if (resolved.ok() && path != bundlePath) {
+        if (!bundle) bundle = CanonicalPath(bundlePath);
+        if (!bundle->ok() || !WithinBundle(*resolved, **bundle)) {
+          resolved = PosixError(EACCES, "outside its bundle " + path);
+        }
+      }
+      Result<std::string> token = resolved.ok()
+                                      ? services_.sandbox->issueFileExtension(
+                                            kReadOnlyFileExtensionClass, *resolved, /*flags=*/0)
+                                      : Result<std::string>(resolved.error());
       if (token.ok()) {
         tokens.insert_or_assign(name, Value(std::move(token).value()));
         continue;

@@ -1,6 +1,7 @@
 #include "platform/file_system.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -15,6 +16,7 @@ namespace {
 using registry_test::ModeOf;
 using registry_test::ReadBytes;
 using registry_test::TempFolder;
+using registry_test::WriteBytes;
 using Names = std::vector<std::string>;
 
 // The names in `folder`, to see that no temporary was left behind.
@@ -149,6 +151,49 @@ TEST(FileSystemTest, RemovesOnlyTheLeftoverTemporariesOfItsTarget) {
   // Nothing left: none removed; no folder: none either.
   EXPECT_EQ(*fs->removeLeftoverTemporaries(dir / "Annotations"), 0u);
   EXPECT_EQ(*fs->removeLeftoverTemporaries(dir / "missing/Annotations"), 0u);
+}
+
+// Canonical paths are granted in extension tokens and compared as registry
+// keys, so every way of naming a file must resolve as realpath(3) does.
+TEST(FileSystemTest, CanonicalPathResolvesAsRealpath) {
+  TempFolder dir;
+  WriteBytes(dir / "real/Plug.appex/Contents/Info.pdoc", "{}");
+  WriteBytes(dir / "real/name (deleted)", "a name the kernel also uses for a removed file");
+  std::filesystem::create_directory_symlink(dir / "real", dir / "link");
+  std::filesystem::create_directory_symlink("link", dir / "relative-link");
+  std::filesystem::create_symlink(dir / "missing", dir / "dangling");
+  ASSERT_EQ(::mkfifo((dir / "real/fifo").c_str(), 0600), 0);  // must not block
+  const std::string plugIn = dir / "real/Plug.appex";
+  struct Row {
+    std::string path;
+    std::string canonical;  // empty: fails with `errnum`
+    int errnum;
+  } rows[] = {
+      {plugIn, plugIn, 0},
+      {dir / "link/Plug.appex", plugIn, 0},
+      {dir / "relative-link/Plug.appex/", plugIn, 0},
+      {dir / "real/./Plug.appex/Contents/..", plugIn, 0},
+      {dir / "link/../real/Plug.appex", plugIn, 0},
+      {dir / "real/name (deleted)", dir / "real/name (deleted)", 0},
+      {dir / "real/fifo", dir / "real/fifo", 0},
+      {"/", "/", 0},
+      {dir / "real/missing", "", ENOENT},
+      {dir / "dangling", "", ENOENT},
+      {dir / "real/Plug.appex/Contents/Info.pdoc/x", "", ENOTDIR},
+      {"", "", ENOENT},
+      {std::string("/tm\0p", 5), "", EINVAL},
+  };
+  for (const Row& row : rows) {
+    Result<std::string> resolved = CanonicalPath(row.path);
+    if (row.canonical.empty()) {
+      ASSERT_FALSE(resolved) << row.path;
+      EXPECT_EQ(resolved.error().domain(), kPosixErrorDomain) << row.path;
+      EXPECT_EQ(resolved.error().code(), row.errnum) << row.path;
+    } else {
+      ASSERT_TRUE(resolved) << row.path << ": " << resolved.error().description();
+      EXPECT_EQ(*resolved, row.canonical) << row.path;
+    }
+  }
 }
 
 }  // namespace
