@@ -327,8 +327,11 @@ void Transaction::matchPlugIns() {
     addAnnotationForPlugInIn(p, form);
   };
   if (Policy* policy = s.options().policy) {
-    hooks.mayUse = [policy, pid](const Value& form) {
-      return policy->mayProcessUsePlugIn(pid, form[kFormIdentifierKey].stringValue());
+    // One judge per request: the host (its executable and Info file) and the
+    // policy file are looked at once, not once per form.
+    hooks.mayUse = [policy, pid, judge = Policy::PlugInJudge()](const Value& form) mutable {
+      if (!judge) judge = policy->judgeForProcess(pid);
+      return judge(form[kFormIdentifierKey].stringValue());
     };
   }
   hooks.log = [&s](const std::string& line) { s.log("%@", line); };

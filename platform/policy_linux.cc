@@ -1,10 +1,11 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <memory>
 #include <mutex>
 #include <optional>
-#include <set>
 #include <string>
+#include <string_view>
 #include <tuple>
 
 #include "core/log.h"
@@ -34,13 +35,14 @@ struct FileState {
   bool operator==(const FileState&) const = default;
 };
 
-// The identifiers of `list` that are strings; other elements are ignored.
-std::set<std::string, std::less<>> Identifiers(const Value& list) {
-  std::set<std::string, std::less<>> out;
+// Whether `list` holds the string `identifier`; elements that are not
+// strings are ignored. Asked once per plug-in of a discovery, so nothing is
+// built.
+bool ListHolds(const Value& list, std::string_view identifier) {
   for (const Value& v : list.array()) {
-    if (auto s = v.string()) out.emplace(*s);
+    if (v.isString() && v.stringValue() == identifier) return true;
   }
-  return out;
+  return false;
 }
 
 class FilePolicy final : public Policy {
@@ -49,14 +51,16 @@ class FilePolicy final : public Policy {
       : options_(std::move(options)), processes_(processes), fs_(fs) {}
 
   bool mayHostUsePlugIn(std::string_view host, std::string_view plugIn) override {
-    std::lock_guard<std::mutex> lock(mu_);
-    refresh();
-    if (Identifiers(policy_[kDeniedPlugInsKey]).contains(plugIn)) return false;
-    if (host.empty()) return true;
-    return !Identifiers(policy_[kDeniedPlugInsByHostKey][host]).contains(plugIn);
+    return Allows(*current(), host, plugIn);
   }
 
-  bool mayProcessUsePlugIn(pid_t pid, std::string_view plugIn) override {
+  PlugInJudge judgeForProcess(pid_t pid) override {
+    return [policy = current(), host = hostOfProcess(pid)](std::string_view plugIn) {
+      return Allows(*policy, host, plugIn);
+    };
+  }
+
+  std::string hostOfProcess(pid_t pid) override {
     std::string host;
     if (Result<std::string> exe = processes_->executablePath(pid); exe.ok()) {
       if (std::optional<std::string> bundle = BundleOfExecutable(*exe)) {
@@ -65,10 +69,24 @@ class FilePolicy final : public Policy {
         if (info.ok()) host = (*info)[kBundleIdentifierKey].stringValue();
       }
     }
-    return mayHostUsePlugIn(host, plugIn);
+    return host;
   }
 
  private:
+  static bool Allows(const Value& policy, std::string_view host, std::string_view plugIn) {
+    if (ListHolds(policy[kDeniedPlugInsKey], plugIn)) return false;
+    if (host.empty()) return true;
+    return !ListHolds(policy[kDeniedPlugInsByHostKey][host], plugIn);
+  }
+
+  // The policy in force now, kept by the caller while it judges: a new
+  // version replaces the pointer, never the value under it.
+  std::shared_ptr<const Value> current() {
+    std::lock_guard<std::mutex> lock(mu_);
+    refresh();
+    return policy_;
+  }
+
   // REQUIRES: mu_ held. Reads the file again when it is not the version
   // read last time.
   void refresh() {
@@ -84,7 +102,7 @@ class FilePolicy final : public Policy {
     seen_ = state;
     read_ = true;
     if (!state.exists) {  // no file: the administrator set no policy
-      policy_ = Value();
+      policy_ = std::make_shared<const Value>();
       return;
     }
     Result<std::string> bytes = fs_->readFile(options_.path, kMaxPolicyBytes);
@@ -101,7 +119,7 @@ class FilePolicy final : public Policy {
                 options_.path, value.error());
       return;
     }
-    policy_ = std::move(value).value();
+    policy_ = std::make_shared<const Value>(std::move(value).value());
   }
 
   PolicyOptions options_;
@@ -110,7 +128,7 @@ class FilePolicy final : public Policy {
   std::mutex mu_;
   bool read_ = false;
   FileState seen_;
-  Value policy_;  // absent: nothing denied
+  std::shared_ptr<const Value> policy_ = std::make_shared<const Value>();  // absent: nothing denied
 };
 
 }  // namespace

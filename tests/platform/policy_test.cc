@@ -89,6 +89,19 @@ TEST_F(PolicyTest, ProcessIsJudgedAsTheHostOfItsBundle) {
   EXPECT_FALSE(policy_->mayProcessUsePlugIn(host.pid(), "com.example.private"));
   EXPECT_TRUE(policy_->mayProcessUsePlugIn(loose.pid(), "com.example.private"));
   EXPECT_FALSE(policy_->mayProcessUsePlugIn(loose.pid(), "com.example.bad"));
+
+  // A judge answers the same for its process, by the policy in force when it
+  // was made: one discovery sees one version of the file.
+  Policy::PlugInJudge judge = policy_->judgeForProcess(host.pid());
+  EXPECT_FALSE(judge("com.example.private"));
+  EXPECT_FALSE(judge("com.example.bad"));
+  EXPECT_TRUE(judge("com.example.good"));
+  write(Value{{"DeniedPlugIns", Value(Array{Value("com.example.good")})}});
+  EXPECT_FALSE(judge("com.example.private"));
+  EXPECT_TRUE(judge("com.example.good"));
+  Policy::PlugInJudge next = policy_->judgeForProcess(host.pid());
+  EXPECT_TRUE(next("com.example.private"));
+  EXPECT_FALSE(next("com.example.good"));
 }
 
 }  // namespace

@@ -89,7 +89,7 @@ class FakePolicy : public Policy {
   std::map<pid_t, std::string> hostsByPid;
 
   bool mayHostUsePlugIn(std::string_view host, std::string_view plugIn) override;
-  bool mayProcessUsePlugIn(pid_t pid, std::string_view plugIn) override;
+  std::string hostOfProcess(pid_t pid) override;
 };
 
 }  // namespace dr::testing
