@@ -164,7 +164,11 @@ class BodyReader {
           if (!key) return key.error();
           Result<Value> v = read(depth + 1);
           if (!v) return v;
-          if (!d.try_emplace(std::move(*key), std::move(*v)).second) {
+          // Encoders write keys in ascending order (a map's), so the usual
+          // key goes at the end without a search.
+          if (d.empty() || d.rbegin()->first < *key) {
+            d.emplace_hint(d.end(), std::move(*key), std::move(*v));
+          } else if (!d.try_emplace(std::move(*key), std::move(*v)).second) {
             return ProtocolError("duplicate key");
           }
         }
