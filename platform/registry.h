@@ -47,12 +47,17 @@ struct RegistryApplication {
   bool operator==(const RegistryApplication&) const = default;
 };
 
-// The stored files of one registered bundle, shared by all its entries. The
-// bytes are parsed when a dictionary is first asked for (once, thread-safe),
-// so loading many entries parses nothing.
+// The stored files of one registered bundle, shared by all its entries:
+// either their dictionaries, already parsed (at registration, or decoded from
+// the database's parsed copy), or their bytes, parsed when a dictionary is
+// first asked for (once, thread-safe) and then released.
 class RegistryBundleFiles {
  public:
   RegistryBundleFiles(std::string infoBytes, std::optional<std::string> entitlementsBytes);
+  // Dictionaries already parsed: `info` absent or a dictionary,
+  // `entitlements` a dictionary.
+  struct Parsed {};
+  RegistryBundleFiles(Parsed, Value info, Value entitlements);
 
   // The information dictionary (Contents/Info.pdoc); absent when the stored
   // bytes no longer read as a dictionary.

@@ -2,17 +2,23 @@
 //
 //   bundles(id, path UNIQUE, content_hash, info, entitlements, bundle_identifier,
 //           bundle_version, display_name, short_name, registered, system_volume,
-//           app_path, app_name)                       one row per registered bundle
+//           app_path, app_name, parsed)               one row per registered bundle
 //   plugins(uuid PRIMARY KEY, bundle_id -> bundles.id, identifier, multiple)
 //                                                     one row per plug-in
 //
 // The information and entitlements dictionaries are stored as the bytes read
 // from the bundle, not re-encoded: the same bytes are what the content hash
 // covers, what the parser accepted at registration, and what an author wrote
-// (JSON stays JSON), and storing them costs no encoding step. They live once
-// per bundle, not once per plug-in, and are parsed only when an entry's
-// dictionaries are first used. Everything lookups and the daemon's logs need
-// (UUID, identifiers, paths, version, flags, date, names) is a column.
+// (JSON stays JSON). They live once per bundle, not once per plug-in.
+// Everything lookups and the daemon's logs need (UUID, identifiers, paths,
+// version, flags, date, names) is a column.
+//
+// "parsed" (since version 2) is a binary copy of what the bytes parse to
+// (registry_cache.h), made at registration: opening decodes it, which is many
+// times cheaper than parsing the XML of every bundle. It is only a cache. A
+// copy that is missing (NULL), damaged or made from other bytes is ignored
+// and the bytes are parsed when an entry's dictionaries are first used; the
+// bytes stay the store of record.
 //
 // The schema is versioned by PRAGMA user_version; kMigrations[v] takes a
 // database from version v to v + 1, each step in its own transaction, so a
@@ -26,16 +32,26 @@
 
 #include <cerrno>
 #include <cstring>
+#include <functional>
 #include <map>
+#include <system_error>
+#include <thread>
 
 #include "core/format.h"
+#include "platform/registry_cache.h"
 
 namespace dr::registry_internal {
 namespace {
 
-constexpr const char* kMigrations[] = {
+struct Migration {
+  const char* sql;
+  // Then fills the parsed copies of the rows that have none.
+  bool fillParsedCopies;
+};
+
+constexpr Migration kMigrations[] = {
     // 0 -> 1: the first schema.
-    R"sql(
+    {R"sql(
 CREATE TABLE bundles (
   id INTEGER PRIMARY KEY,
   path TEXT NOT NULL UNIQUE,
@@ -59,6 +75,10 @@ CREATE TABLE plugins (
 );
 CREATE INDEX plugins_by_bundle ON plugins(bundle_id);
 )sql",
+     false},
+    // 1 -> 2: the parsed copy of each bundle's files, made for the rows there
+    // are, so that the next open already decodes them.
+    {"ALTER TABLE bundles ADD COLUMN parsed BLOB;", true},
 };
 constexpr int kSchemaVersion = static_cast<int>(std::size(kMigrations));
 
@@ -94,6 +114,13 @@ std::optional<std::string> ColumnText(sqlite3_stmt* s, int column) {
   if (sqlite3_column_type(s, column) == SQLITE_NULL) return std::nullopt;
   const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(s, column));
   return std::string(text ? text : "", static_cast<size_t>(sqlite3_column_bytes(s, column)));
+}
+
+// The blob or text in `column`, valid until the statement steps again.
+std::string_view ColumnView(sqlite3_stmt* s, int column) {
+  const auto* bytes = static_cast<const char*>(sqlite3_column_blob(s, column));
+  const auto size = static_cast<size_t>(sqlite3_column_bytes(s, column));
+  return bytes ? std::string_view(bytes, size) : std::string_view();
 }
 
 std::string ColumnBlob(sqlite3_stmt* s, int column) {
@@ -276,10 +303,13 @@ Status RegistryDatabase::migrate() {
     }
     if (Status s = checkVersion(version, objects); !s) return fail(s);
     if (version == kSchemaVersion) return exec("COMMIT", "cannot update the schema");
-    if (Status s = exec(kMigrations[version],
+    if (Status s = exec(kMigrations[version].sql,
                         Format("cannot update the schema to version %d", version + 1));
         !s) {
       return fail(s);
+    }
+    if (kMigrations[version].fillParsedCopies) {
+      if (Status s = fillParsedCopies(); !s) return fail(s);
     }
     if (Status s = exec(Format("PRAGMA user_version = %d", version + 1).c_str(),
                         "cannot update the schema version");
@@ -288,6 +318,37 @@ Status RegistryDatabase::migrate() {
     }
     if (Status s = exec("COMMIT", "cannot update the schema"); !s) return fail(s);
   }
+}
+
+Status RegistryDatabase::fillParsedCopies() {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(
+      db_, "SELECT id, info, entitlements FROM bundles WHERE parsed IS NULL", -1, &raw, nullptr);
+  if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
+  // The copies are all made before the first is written: the table is not
+  // changed under the running query.
+  std::vector<std::pair<int64_t, std::string>> copies;
+  {
+    Statement select(raw);
+    while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
+      const std::string_view info = ColumnView(raw, 1);
+      std::optional<std::string_view> entitlements;
+      if (sqlite3_column_type(raw, 2) != SQLITE_NULL) entitlements = ColumnView(raw, 2);
+      if (auto copy = EncodeParsedCopy(ParseFiles(info, entitlements), info, entitlements)) {
+        copies.emplace_back(sqlite3_column_int64(raw, 0), std::move(*copy));
+      }
+    }
+    if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the bundles");
+  }
+  rc = sqlite3_prepare_v2(db_, "UPDATE bundles SET parsed = ?1 WHERE id = ?2", -1, &raw, nullptr);
+  if (rc != SQLITE_OK) return errorOf(rc, "cannot prepare a statement");
+  Statement update(raw);
+  for (const auto& [id, copy] : copies) {
+    BindBlob(raw, 1, copy);
+    sqlite3_bind_int64(raw, 2, id);
+    if (rc = update.run(); rc != SQLITE_DONE) return errorOf(rc, "cannot store a parsed copy");
+  }
+  return Status::OK();
 }
 
 Status RegistryDatabase::prepareAll() {
@@ -303,8 +364,8 @@ Status RegistryDatabase::prepareAll() {
       {&deleteBundle_, "DELETE FROM bundles WHERE path = ?1"},
       {&insertBundle_,
        "INSERT INTO bundles (path, content_hash, info, entitlements, bundle_identifier, "
-       "bundle_version, display_name, short_name, registered, system_volume, app_path, app_name) "
-       "VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12)"},
+       "bundle_version, display_name, short_name, registered, system_volume, app_path, app_name, "
+       "parsed) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13)"},
       {&insertPlugIn_,
        "INSERT INTO plugins (uuid, bundle_id, identifier, multiple) VALUES (?1, ?2, ?3, ?4)"},
   };
@@ -317,16 +378,72 @@ Status RegistryDatabase::prepareAll() {
   return Status::OK();
 }
 
+Status RegistryDatabase::decodeParsedCopies(std::vector<PendingCopy>& pending,
+                                            std::vector<BundleRow>& rows) {
+  // Decoding is most of the work of loading; two threads share it (each row
+  // is written by one of them only). A copy that fails to decode is rare
+  // (its checksum matched): its row's bytes are read again and parsed later.
+  std::vector<size_t> failed[2];
+  auto decode = [&](size_t first, std::vector<size_t>& failures) {
+    for (size_t i = first; i < pending.size(); i += 2) {
+      BundleRow& row = rows[pending[i].row];
+      row.bundle.parsed = DecodeParsedValues(pending[i].values);
+      if (!row.bundle.parsed) failures.push_back(pending[i].row);
+      std::string().swap(pending[i].values);
+    }
+  };
+  std::thread helper;
+  if (pending.size() >= 64) {
+    try {
+      helper = std::thread(decode, 1, std::ref(failed[1]));
+    } catch (const std::system_error&) {
+      // No thread to be had: this one decodes everything.
+    }
+  }
+  decode(0, failed[0]);
+  if (helper.joinable()) {
+    helper.join();
+  } else {
+    decode(1, failed[1]);
+  }
+  pending.clear();
+  if (failed[0].empty() && failed[1].empty()) return Status::OK();
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db_, "SELECT info, entitlements FROM bundles WHERE id = ?1", -1, &raw,
+                              nullptr);
+  if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
+  Statement select(raw);
+  for (const auto& list : failed) {
+    for (size_t index : list) {
+      ScannedBundle& b = rows[index].bundle;
+      sqlite3_bind_int64(raw, 1, rows[index].id);
+      if ((rc = sqlite3_step(raw)) != SQLITE_ROW) return errorOf(rc, "cannot read the bundles");
+      b.infoBytes = ColumnBlob(raw, 0);
+      if (sqlite3_column_type(raw, 1) != SQLITE_NULL) b.entitlementsBytes = ColumnBlob(raw, 1);
+      sqlite3_reset(raw);
+    }
+  }
+  return Status::OK();
+}
+
 Result<std::vector<BundleRow>> RegistryDatabase::loadAll() {
   std::vector<BundleRow> rows;
+  std::vector<PendingCopy> pending;
   std::map<int64_t, size_t> indexOf;
+  // Rows are large: growing the vector step by step moved every row about
+  // fourteen times for 10,000 bundles.
+  int count = 0;
+  int rc = ReadInt(db_, "SELECT count(*) FROM bundles", &count);
+  if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
+  rows.reserve(static_cast<size_t>(count));
+  pending.reserve(static_cast<size_t>(count));
   sqlite3_stmt* raw = nullptr;
-  int rc = sqlite3_prepare_v2(db_,
-                              "SELECT id, path, content_hash, info, entitlements, "
-                              "bundle_identifier, bundle_version, display_name, short_name, "
-                              "registered, system_volume, app_path, app_name "
-                              "FROM bundles ORDER BY id",
-                              -1, &raw, nullptr);
+  rc = sqlite3_prepare_v2(db_,
+                          "SELECT id, path, content_hash, info, entitlements, "
+                          "bundle_identifier, bundle_version, display_name, short_name, "
+                          "registered, system_volume, app_path, app_name, parsed "
+                          "FROM bundles ORDER BY id",
+                          -1, &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
   {
     Statement bundles(raw);
@@ -336,8 +453,21 @@ Result<std::vector<BundleRow>> RegistryDatabase::loadAll() {
       ScannedBundle& b = row.bundle;
       b.path = ColumnText(raw, 1).value_or("");
       b.contentHash = ColumnBlob(raw, 2);
-      b.infoBytes = ColumnBlob(raw, 3);
-      if (sqlite3_column_type(raw, 4) != SQLITE_NULL) b.entitlementsBytes = ColumnBlob(raw, 4);
+      // A parsed copy made from these bytes stands for them, which are then
+      // not kept: the entry needs only the dictionaries.
+      const std::string_view info = ColumnView(raw, 3);
+      std::optional<std::string_view> entitlements;
+      if (sqlite3_column_type(raw, 4) != SQLITE_NULL) entitlements = ColumnView(raw, 4);
+      std::optional<std::string_view> values;
+      if (sqlite3_column_type(raw, 13) != SQLITE_NULL) {
+        values = CheckedParsedValues(ColumnView(raw, 13), info, entitlements);
+      }
+      if (values) {
+        pending.push_back({rows.size(), std::string(*values)});
+      } else {
+        b.infoBytes = std::string(info);
+        if (entitlements) b.entitlementsBytes = std::string(*entitlements);
+      }
       b.bundleIdentifier = ColumnText(raw, 5);
       b.bundleVersion = ColumnText(raw, 6);
       b.displayName = ColumnText(raw, 7);
@@ -352,6 +482,7 @@ Result<std::vector<BundleRow>> RegistryDatabase::loadAll() {
     }
     if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the bundles");
   }
+  if (Status s = decodeParsedCopies(pending, rows); !s) return s.error();
   rc = sqlite3_prepare_v2(db_,
                           "SELECT bundle_id, uuid, identifier, multiple FROM plugins "
                           "ORDER BY bundle_id, identifier",
@@ -412,6 +543,11 @@ Status RegistryDatabase::runChange(const std::string& removePath, BundleRow* ins
   } else {
     sqlite3_bind_null(s, 11);
     sqlite3_bind_null(s, 12);
+  }
+  if (b.parsedCopy) {
+    BindBlob(s, 13, *b.parsedCopy);
+  } else {
+    sqlite3_bind_null(s, 13);
   }
   if (int rc = insertBundle_->run(); rc != SQLITE_DONE) {
     return errorOf(rc, "cannot store a bundle");

@@ -58,6 +58,15 @@ class RegistryDatabase {
   Status checkIntegrity();
   Status checkVersion(int version, int objects) const;
   Status migrate();
+  Status fillParsedCopies();
+  // The checked values of a row's parsed copy, still to be decoded.
+  struct PendingCopy {
+    size_t row;          // index in the rows being loaded
+    std::string values;  // CheckedParsedValues of the copy
+  };
+  // Sets each pending row's parsed dictionaries; a row whose copy does not
+  // decode gets its bytes instead.
+  Status decodeParsedCopies(std::vector<PendingCopy>& pending, std::vector<BundleRow>& rows);
   Status prepareAll();
   Status runChange(const std::string& removePath, BundleRow* insert);
 

@@ -7,8 +7,8 @@
 
 #include "core/format.h"
 #include "platform/locations.h"
-#include "platform/pdoc.h"
 #include "platform/registry.h"
+#include "platform/registry_cache.h"
 #include "platform/registry_scan.h"
 
 namespace dr {
@@ -17,16 +17,17 @@ RegistryBundleFiles::RegistryBundleFiles(std::string infoBytes,
                                          std::optional<std::string> entitlementsBytes)
     : infoBytes_(std::move(infoBytes)), entitlementsBytes_(std::move(entitlementsBytes)) {}
 
+RegistryBundleFiles::RegistryBundleFiles(Parsed, Value info, Value entitlements)
+    : info_(std::move(info)), entitlements_(std::move(entitlements)) {
+  std::call_once(parsed_, [] {});  // nothing left to parse
+}
+
 void RegistryBundleFiles::parse() const {
   std::call_once(parsed_, [this] {
-    // The bytes were checked at registration; a stored file that no longer
-    // reads (a changed parser, a tampered database) yields no dictionary, and
-    // the daemon then skips the plug-in.
-    if (auto info = pdoc::Parse(infoBytes_); info && info->isDictionary()) info_ = *info;
-    entitlements_ = Value::EmptyDictionary();
-    if (entitlementsBytes_) {
-      if (auto e = pdoc::Parse(*entitlementsBytes_); e && e->isDictionary()) entitlements_ = *e;
-    }
+    registry_internal::ParsedFiles parsed =
+        registry_internal::ParseFiles(infoBytes_, entitlementsBytes_);
+    info_ = std::move(parsed.info);
+    entitlements_ = std::move(parsed.entitlements);
     // The parsed values are all that is read from now on.
     std::string().swap(infoBytes_);
     entitlementsBytes_.reset();

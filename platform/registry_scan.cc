@@ -55,26 +55,32 @@ const Value& TopOf(const Value& info, bool* oldStyle) {
   return AbsentValue();
 }
 
-std::string HashFiles(const std::string& info, const std::optional<std::string>& entitlements) {
+}  // namespace
+
+std::string HashFiles(std::string_view info, std::optional<std::string_view> entitlements,
+                      std::optional<std::string_view> more, size_t bytes) {
   static const int sodiumReady = sodium_init();  // thread-safe, once
   (void)sodiumReady;
   crypto_generichash_state state;
-  crypto_generichash_init(&state, nullptr, 0, crypto_generichash_BYTES);
+  crypto_generichash_init(&state, nullptr, 0, bytes);
   // Length-prefixed, so that no two pairs of files hash the same input.
-  auto add = [&](std::string_view bytes) {
-    uint64_t size = bytes.size();
+  auto add = [&](std::string_view piece) {
+    uint64_t size = piece.size();
     crypto_generichash_update(&state, reinterpret_cast<const unsigned char*>(&size), sizeof size);
-    crypto_generichash_update(&state, reinterpret_cast<const unsigned char*>(bytes.data()),
-                              bytes.size());
+    crypto_generichash_update(&state, reinterpret_cast<const unsigned char*>(piece.data()),
+                              piece.size());
   };
   add(info);
   const unsigned char hasEntitlements = entitlements.has_value() ? 1 : 0;
   crypto_generichash_update(&state, &hasEntitlements, 1);
   if (entitlements) add(*entitlements);
-  std::string out(crypto_generichash_BYTES, '\0');
+  if (more) add(*more);
+  std::string out(bytes, '\0');
   crypto_generichash_final(&state, reinterpret_cast<unsigned char*>(out.data()), out.size());
   return out;
 }
+
+namespace {
 
 // The plug-ins a top dictionary declares, or the reason it declares none.
 Result<std::vector<ScannedPlugIn>> PlugInsOf(const std::string& url, const Value& info,
@@ -244,6 +250,10 @@ Result<ScannedBundle> ScanBundle(const std::string& url,
     if (LiesUnder(out.path, root)) out.onSystemVolume = true;
   }
   out.containingApplication = ContainingApplicationOf(out.path, fs);
+  // What the files read as now is what their stored bytes read as later.
+  if (!entitlements.isPresent()) entitlements = Value::EmptyDictionary();
+  out.parsed = ParsedFiles{std::move(info), std::move(entitlements)};
+  out.parsedCopy = EncodeParsedCopy(*out.parsed, out.infoBytes, out.entitlementsBytes);
   return out;
 }
 

@@ -12,6 +12,7 @@
 #include "core/status.h"
 #include "platform/file_system.h"
 #include "platform/registry.h"
+#include "platform/registry_cache.h"
 
 namespace dr::registry_internal {
 
@@ -34,11 +35,22 @@ struct ScannedBundle {
   bool onSystemVolume = false;
   std::optional<RegistryApplication> containingApplication;
   std::vector<ScannedPlugIn> plugIns;  // never empty; ascending identifiers
+  // The files' dictionaries when known: parsed at registration, or decoded
+  // from the database's parsed copy (the bytes are then not loaded).
+  std::optional<ParsedFiles> parsed;
+  // The parsed copy to store beside the bytes; nothing stores none.
+  std::optional<std::string> parsedCopy;
 };
 
 // Reads and checks the bundle at `url` (an absolute path).
 Result<ScannedBundle> ScanBundle(const std::string& url,
                                  const std::vector<std::string>& systemRoots, FileSystem* fs);
+
+// The content hash of a bundle's stored files (BLAKE2b, `bytes` long), each
+// length-prefixed; `more`, when given, is hashed after them (a parsed copy's
+// checksum covers the files and the copy).
+std::string HashFiles(std::string_view info, std::optional<std::string_view> entitlements,
+                      std::optional<std::string_view> more = std::nullopt, size_t bytes = 32);
 
 // `path` made absolute-normal without touching the disk: "." and empty
 // components dropped, ".." taken back, no trailing slash. Empty for a

@@ -1,10 +1,11 @@
 // The registry on SQLite.
 //
 // The database file is the store of record; an in-memory index of every entry,
-// loaded at open, answers the lookups. Loading reads columns and the stored
-// dictionary bytes but parses nothing: an entry's dictionaries are parsed when
-// first used. The registry assumes it is the only writer of its file (the
-// daemon owns it); a change made by another process is seen at the next open.
+// loaded at open, answers the lookups. Loading reads columns and decodes each
+// bundle's parsed copy; a bundle without a sound copy keeps its bytes, which
+// are parsed when its entries' dictionaries are first used. The registry
+// assumes it is the only writer of its file (the daemon owns it); a change
+// made by another process is seen at the next open.
 //
 // Threads: writes (register, unregister) are serialized by writeMu_, which is
 // held across the transaction, the index update and the queuing of the
@@ -211,8 +212,11 @@ class SqliteRegistry final : public Registry {
   // REQUIRES: indexMu_ held exclusively and writeMu_ held (or at load).
   RegistryEntries insertIntoIndex(BundleRow row) {
     registry_internal::ScannedBundle& b = row.bundle;
-    auto files =
-        std::make_shared<const RegistryBundleFiles>(std::move(b.infoBytes), b.entitlementsBytes);
+    auto files = b.parsed ? std::make_shared<const RegistryBundleFiles>(
+                                RegistryBundleFiles::Parsed{}, std::move(b.parsed->info),
+                                std::move(b.parsed->entitlements))
+                          : std::make_shared<const RegistryBundleFiles>(
+                                std::move(b.infoBytes), std::move(b.entitlementsBytes));
     Bundle bundle{b.path, b.contentHash, {}};
     for (size_t i = 0; i < b.plugIns.size(); ++i) {
       RegistryEntry::Fields f;

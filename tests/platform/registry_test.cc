@@ -14,6 +14,7 @@
 #include <tuple>
 
 #include "core/format.h"
+#include "platform/pdoc.h"
 #include "tests/support/registry_bundles.h"
 
 namespace dr {
@@ -501,7 +502,7 @@ TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
       {"another program's database", "", "CREATE TABLE notes (text TEXT)", kRegistryCorrupt,
        "the file holds another kind of database; it was left as it is"},
       {"a newer schema", good, "PRAGMA user_version = 99", kRegistryStorage,
-       "schema version 99 is newer than this program knows (1); it was left as it is"},
+       "schema version 99 is newer than this program knows (2); it was left as it is"},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
@@ -515,6 +516,154 @@ TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
     EXPECT_TRUE(text.starts_with("registry database \"" + DatabasePath() + "\": ")) << text;
     EXPECT_NE(text.find(row.text), std::string::npos) << text;
     EXPECT_EQ(ReadBytes(DatabasePath()), damaged);
+  }
+}
+
+// Runs a query that answers one integer on the database at `path`.
+int64_t QueryInt(const std::string& path, const char* sql) {
+  sqlite3* db = nullptr;
+  sqlite3_stmt* s = nullptr;
+  int64_t out = -1;
+  if (sqlite3_open(path.c_str(), &db) == SQLITE_OK &&
+      sqlite3_prepare_v2(db, sql, -1, &s, nullptr) == SQLITE_OK && sqlite3_step(s) == SQLITE_ROW) {
+    out = sqlite3_column_int64(s, 0);
+  }
+  sqlite3_finalize(s);
+  sqlite3_close(db);
+  return out;
+}
+
+// What each stored bundle's bytes parse to, by path.
+std::map<std::string, std::pair<Value, Value>> ParsedRows(const std::string& path) {
+  std::map<std::string, std::pair<Value, Value>> out;
+  sqlite3* db = nullptr;
+  sqlite3_stmt* s = nullptr;
+  EXPECT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
+  EXPECT_EQ(sqlite3_prepare_v2(db, "SELECT path, info, entitlements FROM bundles", -1, &s, nullptr),
+            SQLITE_OK);
+  auto parse = [&](int column) {
+    std::string_view bytes(static_cast<const char*>(sqlite3_column_blob(s, column)),
+                           static_cast<size_t>(sqlite3_column_bytes(s, column)));
+    auto v = pdoc::Parse(bytes);
+    return v && v->isDictionary() ? *v : Value();
+  };
+  while (sqlite3_step(s) == SQLITE_ROW) {
+    Value entitlements =
+        sqlite3_column_type(s, 2) == SQLITE_NULL ? Value::EmptyDictionary() : parse(2);
+    if (entitlements.isAbsent()) entitlements = Value::EmptyDictionary();
+    out[reinterpret_cast<const char*>(sqlite3_column_text(s, 0))] = {parse(1), entitlements};
+  }
+  sqlite3_finalize(s);
+  sqlite3_close(db);
+  return out;
+}
+
+// Three bundles: one plain with entitlements, one of two plug-ins, one with
+// no entitlements. Answers their paths.
+std::vector<std::string> RegisterThree(Registry& registry, const TempFolder& dir) {
+  const std::vector<std::string> paths = {
+      MakeBundle(dir / "a.appex", PlugInInfo("a"), Value{{"com.example.e", true}}),
+      MakeBundle(dir / "m.appex", ThreePlugIns(), Value{{"com.example.e", "x"}}),
+      MakeBundle(dir / "n.appex", PlugInInfo("n").changing("BNBundleName", "Ñame")),
+  };
+  for (const std::string& path : paths) EXPECT_TRUE(registry.registerBundle(path).ok()) << path;
+  return paths;
+}
+
+TEST_F(RegistryTest, DatabaseOfTheFirstSchemaOpensWithTheSameEntriesAndGainsParsedCopies) {
+  auto registry = Open();
+  RegisterThree(*registry, dir_);
+  EXPECT_EQ(QueryInt(DatabasePath(), "SELECT count(*) FROM bundles WHERE parsed IS NULL"), 0);
+  // The file as the first schema left it: no parsed copies, version 1.
+  const RegistryEntries before = registry->allEntries();
+  registry.reset();
+  ASSERT_EQ(
+      RunSql(DatabasePath(), "ALTER TABLE bundles DROP COLUMN parsed; PRAGMA user_version = 1"),
+      SQLITE_OK);
+  ASSERT_EQ(QueryInt(DatabasePath(),
+                     "SELECT count(*) FROM pragma_table_info('bundles') "
+                     "WHERE name = 'parsed'"),
+            0);
+  registry = Open();
+  ASSERT_NE(registry, nullptr);
+  EXPECT_EQ(QueryInt(DatabasePath(), "PRAGMA user_version"), 2);
+  EXPECT_EQ(QueryInt(DatabasePath(), "SELECT count(*) FROM bundles WHERE parsed IS NULL"), 0);
+  ASSERT_EQ(UuidsOf(registry->allEntries()), UuidsOf(before));
+  for (const RegistryEntryPtr& e : before) {
+    SCOPED_TRACE(e->description());
+    RegistryEntryPtr again = registry->entryForUuid(e->uuid());
+    EXPECT_EQ(again->infoDictionary(), e->infoDictionary());
+    EXPECT_EQ(again->plugInDictionary(), e->plugInDictionary());
+    EXPECT_EQ(again->entitlements(), e->entitlements());
+    EXPECT_EQ(again->displayName(), e->displayName());
+  }
+  ExpectKeptAcrossReopening(registry);
+}
+
+TEST_F(RegistryTest, ManyBundlesDecodedOnTwoThreadsReadAsRegistered) {
+  // Enough bundles for opening to share the decoding between two threads,
+  // some of them without a parsed copy, so both kinds interleave.
+  auto registry = Open();
+  for (int i = 0; i < 100; ++i) {
+    const Value info = i % 3 == 0 ? ThreePlugIns().changing("BNBundleIdentifier", Format("b%d", i))
+                                  : PlugInInfo(Format("p%d", i));
+    ASSERT_TRUE(registry
+                    ->registerBundle(MakeBundle(dir_ / Format("b%d.appex", i), info,
+                                                i % 2 == 0 ? Value{{"e", i}} : Value()))
+                    .ok());
+  }
+  ASSERT_EQ(RunSql(DatabasePath(), "UPDATE bundles SET parsed = NULL WHERE id % 7 = 0"), SQLITE_OK);
+  ExpectKeptAcrossReopening(registry);
+}
+
+TEST_F(RegistryTest, ParsedCopyThatIsMissingDamagedOrStaleGivesWayToTheStoredBytes) {
+  const std::string a = dir_ / "a.appex";
+  const std::string m = dir_ / "m.appex";
+  const struct {
+    const char* name;
+    std::string sql;  // run on the closed database
+  } rows[] = {
+      {"untouched", ""},
+      {"no copy", "UPDATE bundles SET parsed = NULL"},
+      {"empty copy", "UPDATE bundles SET parsed = X''"},
+      {"another magic", "UPDATE bundles SET parsed = X'00' || substr(parsed, 2)"},
+      {"cut short", "UPDATE bundles SET parsed = substr(parsed, 1, length(parsed) - 3)"},
+      {"a byte of the values changed",
+       "UPDATE bundles SET parsed = substr(parsed, 1, 30) || X'41' || substr(parsed, 32)"},
+      {"copy of another bundle",
+       "UPDATE bundles SET parsed = (SELECT parsed FROM bundles WHERE path = '" + m +
+           "') WHERE path = '" + a + "'"},
+      {"information bytes replaced",
+       "UPDATE bundles SET info = (SELECT info FROM bundles WHERE path = '" + m +
+           "') WHERE path = '" + a + "'"},
+      {"information bytes no longer a document", "UPDATE bundles SET info = X'3C3C'"},
+      {"entitlements removed", "UPDATE bundles SET entitlements = NULL"},
+      {"entitlements no longer a dictionary",
+       "UPDATE bundles SET entitlements = CAST('<pdoc><true/></pdoc>' AS BLOB)"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    std::filesystem::remove_all(dir_ / "data");
+    auto registry = Open();
+    RegisterThree(*registry, dir_);
+    registry.reset();
+    if (!row.sql.empty()) {
+      ASSERT_EQ(RunSql(DatabasePath(), row.sql.c_str()), SQLITE_OK);
+    }
+    const auto expected = ParsedRows(DatabasePath());
+    registry = Open();
+    ASSERT_NE(registry, nullptr);
+    ASSERT_EQ(registry->allEntries().size(), 5u);
+    for (const RegistryEntryPtr& e : registry->allEntries()) {
+      SCOPED_TRACE(e->description());
+      const auto& [info, entitlements] = expected.at(e->url());
+      EXPECT_EQ(e->infoDictionary(), info);
+      EXPECT_EQ(e->infoDictionary().isAbsent(), info.isAbsent());
+      EXPECT_EQ(e->entitlements(), entitlements);
+      EXPECT_EQ(e->plugInDictionary(), e->multiple()
+                                           ? info["UXExtension"]["Multiple"][e->plugInIdentifier()]
+                                           : info["UXExtension"]);
+    }
   }
 }
 
