@@ -91,6 +91,11 @@ bool Connection::isOpen() const {
   return state_->fd >= 0;
 }
 
+int Connection::descriptor() const {
+  std::lock_guard<std::mutex> lock(state_->mu);
+  return state_->fd;
+}
+
 Status Connection::State::fail(int64_t code, std::string description) {
   if (fd >= 0) ::close(fd);
   fd = -1;

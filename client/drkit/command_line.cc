@@ -137,8 +137,8 @@ const std::vector<VerbSpec>& Verbs() {
        "Holds every plug-in of the application at each --app PATH, or the plug-in\n"
        "bundle at each --plugin PATH (options may repeat; the two do not mix).\n"
        "Prints the hold's token and keeps the hold until SIGINT or SIGTERM, or\n"
-       "until standard input ends. Refused while a plug-in of an application is\n"
-       "running.\n"},
+       "until standard input ends. Ends with status 1 if drd goes away (the hold\n"
+       "goes with it). Refused while a plug-in of an application is running.\n"},
       {"release",
        {},
        1,

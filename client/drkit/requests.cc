@@ -161,16 +161,24 @@ int RunHold(const Invocation& inv, Io& io) {
   }
   io.out << token->string() << std::endl;
 
-  // Kept until a signal comes or standard input ends.
+  // Kept until a signal comes or standard input ends, or drd goes away: the
+  // hold lives in drd, so a drkit that stayed would hold nothing.
   char buffer[4096];
   bool stdinOpen = true;
+  const int connection = (*c)->connection().descriptor();
   for (;;) {
-    struct pollfd fds[2] = {{signals, POLLIN, 0}, {STDIN_FILENO, POLLIN, 0}};
-    int ready = ::poll(fds, stdinOpen ? 2 : 1, -1);
+    struct pollfd fds[3] = {
+        {signals, POLLIN, 0}, {connection, POLLIN | POLLRDHUP, 0}, {STDIN_FILENO, POLLIN, 0}};
+    int ready = ::poll(fds, stdinOpen ? 3 : 2, -1);
     if (ready < 0 && errno == EINTR) continue;
     if (ready < 0 || (fds[0].revents & POLLIN)) break;
-    if (stdinOpen && fds[1].revents) {
-      if (fds[1].revents & POLLNVAL) {
+    if (fds[1].revents) {
+      ::close(signals);
+      io.err << "drkit: drd closed the connection; the hold is gone\n";
+      return 1;
+    }
+    if (stdinOpen && fds[2].revents) {
+      if (fds[2].revents & POLLNVAL) {
         stdinOpen = false;  // no standard input at all: wait for a signal
         continue;
       }

@@ -237,6 +237,19 @@ TEST_F(DrkitTest, HoldLastsUntilInputEndsOrASignalOrARelease) {
   Ran nothing = drkit({"hold", "--plugin", root() + "/Apps/Host.app"});
   EXPECT_EQ(nothing.status, 1);
   EXPECT_EQ(nothing.err, "drkit: no plug-in at path:" + root() + "/Apps/Host.app (drd error 9)\n");
+  {
+    // The hold dies with drd; a drkit that kept waiting would claim a hold
+    // nobody keeps.
+    Child holder(ClientBinaryPath("drkit"), {"hold", "--plugin", a}, DrkitEnvironment(root()));
+    ASSERT_TRUE(Uuid::parse(holder.readLine())) << holder.err();
+    ASSERT_TRUE(drd_->signal(SIGKILL));
+    drd_->waitForExit();
+    EXPECT_EQ(holder.wait(), 1);
+    EXPECT_EQ(holder.err(), "drkit: drd closed the connection; the hold is gone\n");
+    drd_ = std::make_unique<DrdProcess>(root(), std::vector<std::string>{"-v"});
+    ASSERT_TRUE(drd_->waitUntilServing()) << drd_->standardError();
+    EXPECT_EQ(ok({"match"}), listed);
+  }
 }
 
 TEST_F(DrkitTest, ExclusionsHidePlugInsAndKeepTheRestOfTheFile) {

@@ -64,6 +64,13 @@ class DRD_EXPORT Connection {
   // False once drd closed the connection or broke the protocol.
   bool isOpen() const;
 
+  // The connection's socket, for a caller that waits in poll() between
+  // requests (-1 once the connection is known dead). drd sends nothing
+  // unasked, so between requests it turns readable only when drd closes the
+  // connection (or dies). Owned by the Connection: read, write or close it
+  // only through the members above.
+  int descriptor() const;
+
  private:
   struct State;  // the socket and the frame decoder, kept out of this header
   explicit Connection(int fd);
