@@ -22,6 +22,9 @@ constexpr WorkaroundHost kWorkaroundHosts[] = {
     {"com.corvel.OdelloApp", "10.2"},
 };
 
+// Each client's line on the service queue; never reused, unlike pids.
+std::atomic<uint64_t> gNextClientId{1};
+
 }  // namespace
 
 bool Needs17732150Workaround(std::string_view identifier, std::string_view version) {
@@ -47,7 +50,10 @@ std::shared_ptr<DRDIpcClient> DRDIpcClient::initWithConnectionServer(
 
 DRDIpcClient::DRDIpcClient(std::shared_ptr<PeerConnection> connection,
                            std::shared_ptr<DRDServer> server)
-    : connection_(connection), server_(std::move(server)), token_(connection->auditToken()) {
+    : connection_(connection),
+      server_(std::move(server)),
+      token_(connection->auditToken()),
+      id_(gNextClientId.fetch_add(1)) {
   const ServerOptions& options = server_->options();
   Result<std::string> executable = options.processInfo->executablePath(token_.pid);
   if (executable) {
@@ -55,7 +61,7 @@ DRDIpcClient::DRDIpcClient(std::shared_ptr<PeerConnection> connection,
   }
   server_->debug("client %d %s", token_.pid, executable ? *executable : std::string());
   probes::ClientNew(token_.pid);
-  task_ = options.codeSigning->taskForPid(token_.pid);
+  task_ = options.codeSigning->taskForPidWithExecutable(token_.pid, executable);
 }
 
 void DRDIpcClient::handleEvent(const ConnectionEvent& event) {
@@ -78,7 +84,7 @@ void DRDIpcClient::handleMessage(const PeerMessage& message) {
   }
   std::shared_ptr<Transaction> transaction =
       Transaction::initWithRequestForClient(message, shared_from_this());
-  server_->submitWork([self = shared_from_this(), transaction] {
+  server_->submitWork(id_, [self = shared_from_this(), transaction] {
     self->requestCount_++;
     if (self->requestCount_ % 1000 == 0) {
       self->server_->debug("client %d used %u requests so far", self->pid(), self->requestCount_);
@@ -94,6 +100,7 @@ void DRDIpcClient::dead() {
   server_->debug("client %d is dead", pid());
   setAcceptWork(false);
   probes::ClientDone(pid());
+  server_->noteActivity();  // its buffers and queued replies are freed soon
 }
 
 Value DRDIpcClient::entitlementValueForKey(std::string_view key) const {

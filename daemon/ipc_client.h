@@ -2,11 +2,12 @@
 // connection, pid, the bundle of its executable and its entitlements.
 //
 // Each message of the connection becomes a Transaction submitted to the
-// server's service queue; the end of the connection stops further work. The
-// connection holds the one lasting reference to its client (its context), so
-// a client lives as long as its connection plus any Transaction of it. Events
-// arrive on the connection's own thread, requests run on the service queue;
-// every member is safe to call from either.
+// server's service queue, in this client's line (clients take turns); the
+// end of the connection stops further work. The connection holds the one
+// lasting reference to its client (its context), so a client lives as long
+// as its connection plus any Transaction of it. Events arrive on the
+// connection's own thread, requests run on the service queue; every member
+// is safe to call from either.
 #pragma once
 
 #include <sys/types.h>
@@ -64,6 +65,11 @@ class DRDIpcClient : public PlugInClient, public std::enable_shared_from_this<DR
   void setAcceptWork(bool accept) { acceptWork_.store(accept); }
   // REQUIRES: on the service queue.
   uint32_t requestCount() const { return requestCount_; }
+  // Whether a hold of this client was ever put in force (set by the server
+  // before it adds one), so that the end of a client that never placed one
+  // need not wait for the server's hold list.
+  void notePlacedHold() { placedHold_.store(true); }
+  bool placedHold() const { return placedHold_.load(); }
 
  private:
   DRDIpcClient(std::shared_ptr<PeerConnection> connection, std::shared_ptr<DRDServer> server);
@@ -73,12 +79,14 @@ class DRDIpcClient : public PlugInClient, public std::enable_shared_from_this<DR
   const std::weak_ptr<PeerConnection> connection_;
   const std::shared_ptr<DRDServer> server_;
   const AuditToken token_;
+  const uint64_t id_;                 // this client's line on the service queue
   std::shared_ptr<DRBundle> bundle_;  // set at construction only
   std::atomic<bool> acceptWork_{true};
   std::shared_ptr<const SigningTask> task_;  // set at construction only
   std::once_flag once17732150Workaround_;
   std::atomic<bool> needs17732150Workaround_{false};
   uint32_t requestCount_ = 0;  // on the service queue only
+  std::atomic<bool> placedHold_{false};
 };
 
 }  // namespace dr

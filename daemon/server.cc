@@ -49,6 +49,7 @@ void DRDServer::accept(std::shared_ptr<PeerConnection> connection) {
     std::erase_if(connections_, [](const auto& c) { return c.expired(); });
     connections_.push_back(connection);
   }
+  noteActivity();
   // The connection keeps the client alive; nothing here holds it.
   DRDIpcClient::initWithConnectionServer(std::move(connection),
                                          std::static_pointer_cast<DRDServer>(shared_from_this()));
@@ -86,7 +87,12 @@ void DRDServer::shutdown(std::chrono::milliseconds flushTimeout) {
   }
 }
 
-void DRDServer::submitWork(std::function<void()> work) { mainQueue_.async(std::move(work)); }
+void DRDServer::submitWork(uint64_t source, std::function<void()> work) {
+  serviceTurns_.submit(source, std::move(work));
+  noteActivity();
+}
+
+void DRDServer::noteActivity() { trimmer_.activity(); }
 
 void DRDServer::removedPlugIns(const RegistryEntries& entries) {
   for (const RegistryEntryPtr& entry : entries) {
@@ -109,6 +115,7 @@ bool DRDServer::holdOnPlugIn(const DRDPlugIn& plugIn) {
 }
 
 void DRDServer::addHold(std::shared_ptr<DRDPlugInHold> hold) {
+  if (std::shared_ptr<DRDIpcClient> client = hold->client()) client->notePlacedHold();
   syncQueue_.sync([&] {
     holds_.push_back(std::move(hold));
     postAnnotationChange();
@@ -127,6 +134,10 @@ void DRDServer::unholdToken(const Uuid& token) {
 }
 
 void DRDServer::unholdClient(const DRDIpcClient& client) {
+  // Most clients never place a hold; a peer connecting in a loop would
+  // otherwise line up every dying connection here, ahead of the service
+  // queue's own hold checks.
+  if (!client.placedHold()) return;
   syncQueue_.sync([&] {
     for (;;) {
       auto it = std::find_if(holds_.begin(), holds_.end(),
