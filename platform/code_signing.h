@@ -63,6 +63,15 @@ class CodeSigning {
   // Never null; a process that is gone gives a task whose lookups fail.
   virtual std::shared_ptr<const SigningTask> taskForPid(pid_t pid) = 0;
 
+  // taskForPid for a caller that has just read `pid`'s executable (or failed
+  // to) through the same ProcessInfo: the same task without reading /proc
+  // again, which the daemon does for every connection. The default reads
+  // again.
+  virtual std::shared_ptr<const SigningTask> taskForPidWithExecutable(
+      pid_t pid, const Result<std::string>& /*executable*/) {
+    return taskForPid(pid);
+  }
+
   // The entitlements dictionary of the program at `executablePath`: an empty
   // dictionary for a free-standing program or a bundle without entitlements;
   // an error when the bundle's file cannot be read or is not a dictionary.

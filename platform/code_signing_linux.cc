@@ -19,7 +19,11 @@ class LinuxCodeSigning final : public CodeSigning {
   LinuxCodeSigning(ProcessInfo* processes, FileSystem* fs) : processes_(processes), fs_(fs) {}
 
   std::shared_ptr<const SigningTask> taskForPid(pid_t pid) override {
-    Result<std::string> exe = processes_->executablePath(pid);
+    return taskForPidWithExecutable(pid, processes_->executablePath(pid));
+  }
+
+  std::shared_ptr<const SigningTask> taskForPidWithExecutable(
+      pid_t pid, const Result<std::string>& exe) override {
     if (!exe.ok()) return std::make_shared<ReadSigningTask>(pid, exe.error());
     return std::make_shared<ReadSigningTask>(pid, entitlementsForExecutable(*exe));
   }

@@ -9,15 +9,16 @@
 // connections, not for all of them. At most kMaxWaitingConnections wait
 // for their turn; beyond that new peers stay in the socket's backlog until
 // the queue catches up, so a peer connecting in a loop cannot exhaust the
-// daemon's descriptors. Each PeerConnection reads DRM1 frames
-// on a thread of its own and delivers its events to its handler one at a
-// time, in order: a message per frame, and a final kConnectionInvalid when
-// the peer hangs up, breaks the protocol (logged, and only that connection
-// closes) or is cancelled. Replies are queued per connection: one with
-// nothing queued before it is written at once by the sender, as far as the
-// socket takes it without waiting, and the rest by the connection's thread,
-// so sending never blocks the caller; a peer whose queue passes
-// kMaxQueuedReplyBytes is closed, and one with
+// daemon's descriptors. Each PeerConnection reads DRM1 frames on a thread of
+// its own (a few threads whose connection ended wait a while to serve the
+// next one, instead of a thread made per connection) and delivers its events
+// to its handler one at a time, in order: a message per frame, and a final
+// kConnectionInvalid when the peer hangs up, breaks the protocol (logged,
+// and only that connection closes) or is cancelled. Replies are queued per
+// connection: one with nothing queued before it is written at once by the
+// sender, as far as the socket takes it without waiting, and the rest by the
+// connection's thread, so sending never blocks the caller; a peer whose
+// queue passes kMaxQueuedReplyBytes is closed, and one with
 // kMaxUnansweredRequests requests in flight is not read until they are
 // answered.
 //

@@ -168,6 +168,50 @@ TEST_F(MessageServiceTest, ProtocolErrorClosesOnlyThatConnectionAndReleasesItsCo
   EXPECT_EQ(context_.use_count(), 2);
 }
 
+// Connections one after another are read on threads that served earlier
+// ones: nothing a connection left behind (a cut frame, a protocol error, an
+// unanswered request) may reach the next one, and each still ends with its
+// one connection-invalid event and lets go of its context.
+TEST_F(MessageServiceTest, ConnectionsOneAfterAnotherStartClean) {
+  auto listener = EchoListener();
+  ASSERT_TRUE(listener);
+  ScopedLogCapture log;
+  const std::string request = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Value{{"n", 1}});
+  struct Leftover {
+    const char* name;
+    std::string bytes;  // sent after the answered request, before hanging up
+  };
+  const std::vector<Leftover> leftovers = {
+      {"nothing", ""},
+      {"half a header", request.substr(0, drm1::kHeaderSize / 2)},
+      {"a header without its body", request.substr(0, drm1::kHeaderSize)},
+      {"a frame without its last byte", request.substr(0, request.size() - 1)},
+      {"bad magic", "DRM2" + std::string(28, '\0')},
+      {"an unanswered request", *drm1::EncodeFrame(2, 0, drm1::kFlagWantsReply, Value{{"n", 2}})},
+  };
+  int ended = 0;
+  for (int round = 0; round < 5; ++round) {
+    for (const Leftover& leftover : leftovers) {
+      SCOPED_TRACE(leftover.name);
+      Peer peer(listener->path());
+      ASSERT_TRUE(peer.connected());
+      const uint64_t serial = static_cast<uint64_t>(100 + ended);
+      peer.sendRequest(serial, Value{{"n", serial}});
+      std::optional<drm1::Frame> reply = peer.receive();
+      ASSERT_TRUE(reply);
+      EXPECT_EQ(reply->header.replyTo, serial);
+      EXPECT_EQ(reply->body, (Value{{"n", serial}, {"echo", true}}));
+      if (!leftover.bytes.empty()) peer.sendRaw(leftover.bytes);
+      ++ended;
+    }
+  }
+  for (int i = 0; i < 500 && (*invalid_ < ended || context_.use_count() > 1); ++i) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_EQ(*invalid_, ended);
+  EXPECT_EQ(context_.use_count(), 1) << "a finished connection kept its context";
+}
+
 TEST_F(MessageServiceTest, ReplacesAStaleSocketButNeverALiveOneOrAnotherFile) {
   // A live listener holds the name.
   auto live = EchoListener();
