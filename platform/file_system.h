@@ -92,7 +92,9 @@ class FileSystemWrapper : public FileSystem {
 };
 
 // `path` with every symbolic link, "." and ".." resolved, absolute (what
-// realpath(3) answers). It asks the kernel for the path of the opened file,
+// realpath(3) answers). A path already written canonically that the kernel
+// resolves without meeting a symbolic link is answered as it is (two system
+// calls); otherwise it asks the kernel for the path of the opened file,
 // three system calls, where realpath looks up each component on its own;
 // when /proc cannot tell (not mounted, a file deleted meanwhile) it falls
 // back to realpath. Errors: kPosixErrorDomain with the errno of the lookup.

@@ -1,8 +1,11 @@
 #include <dirent.h>
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
@@ -183,10 +186,48 @@ class LinuxFileSystem final : public FileSystem {
   }
 };
 
+// Whether `path` is written the way realpath answers: absolute, with no
+// empty, "." or ".." component and no slash at the end.
+bool IsWrittenCanonically(std::string_view path) {
+  if (path.empty() || path[0] != '/') return false;
+  if (path.size() == 1) return true;
+  for (size_t start = 1; start <= path.size();) {
+    const size_t end = std::min(path.find('/', start), path.size());
+    const std::string_view component = path.substr(start, end - start);
+    if (component.empty() || component == "." || component == "..") return false;
+    start = end + 1;
+  }
+  return true;
+}
+
+// Whether `path` names a file reached without any symbolic link: the kernel
+// refuses the lookup (openat2 with RESOLVE_NO_SYMLINKS) at the first link.
+// Such a path, written canonically, is its own canonical path, found in two
+// system calls instead of three. False also where openat2 is missing (before
+// Linux 5.6), and from then on without asking.
+bool ReachedWithoutLinks(const std::string& path) {
+  static std::atomic<bool> missing{false};
+  if (missing.load(std::memory_order_relaxed)) return false;
+  struct open_how how = {};
+  how.flags = O_PATH | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+  const long fd = ::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how);
+  if (fd < 0) {
+    if (errno == ENOSYS) missing.store(true, std::memory_order_relaxed);
+    return false;
+  }
+  ::close(static_cast<int>(fd));
+  return true;
+}
+
 }  // namespace
 
 Result<std::string> CanonicalPath(const std::string& path) {
   if (path.find('\0') != std::string::npos) return PosixError(EINVAL, "path holds NUL");
+  // Registered bundles are stored under their canonical paths, so this is
+  // the usual case; a link, a missing file or any other refusal is left to
+  // the lookup below, which tells why.
+  if (IsWrittenCanonically(path) && ReachedWithoutLinks(path)) return path;
   const int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
   if (fd < 0) return PosixError(errno, "realpath " + path);
   char link[PATH_MAX];

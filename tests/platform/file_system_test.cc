@@ -171,6 +171,9 @@ TEST(FileSystemTest, CanonicalPathResolvesAsRealpath) {
   } rows[] = {
       {plugIn, plugIn, 0},
       {dir / "link/Plug.appex", plugIn, 0},
+      {dir / "link", dir / "real", 0},
+      {dir.path() + "//real///Plug.appex", plugIn, 0},
+      {"/proc/self/root", "/", 0},
       {dir / "relative-link/Plug.appex/", plugIn, 0},
       {dir / "real/./Plug.appex/Contents/..", plugIn, 0},
       {dir / "link/../real/Plug.appex", plugIn, 0},
