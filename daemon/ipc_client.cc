@@ -96,9 +96,11 @@ void DRDIpcClient::handleMessage(const PeerMessage& message) {
 void DRDIpcClient::dying() { server_->debug("client %d termination imminent", pid()); }
 
 void DRDIpcClient::dead() {
+  // Before the holds are released: a hold its last requests place after
+  // this sees that the client is gone (DRDServer::addHold).
+  setAcceptWork(false);
   server_->unholdClient(*this);
   server_->debug("client %d is dead", pid());
-  setAcceptWork(false);
   probes::ClientDone(pid());
   server_->noteActivity();  // its buffers and queued replies are freed soon
 }

@@ -115,11 +115,16 @@ bool DRDServer::holdOnPlugIn(const DRDPlugIn& plugIn) {
 }
 
 void DRDServer::addHold(std::shared_ptr<DRDPlugInHold> hold) {
-  if (std::shared_ptr<DRDIpcClient> client = hold->client()) client->notePlacedHold();
+  std::shared_ptr<DRDIpcClient> client = hold->client();
+  if (client) client->notePlacedHold();
   syncQueue_.sync([&] {
     holds_.push_back(std::move(hold));
     postAnnotationChange();
   });
+  // A request still ran after its connection ended. The client's end
+  // released its holds before this one was in the list, or releases it
+  // now: it stopped accepting work before it released them.
+  if (client && !client->acceptWork()) unholdClient(*client);
 }
 
 void DRDServer::unholdToken(const Uuid& token) {

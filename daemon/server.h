@@ -121,7 +121,9 @@ class DRDServer : public DRDatabase, public DRDatabaseDelegate {
 
   // Whether some hold in force blocks `plugIn`.
   bool holdOnPlugIn(const DRDPlugIn& plugIn);
-  // Puts `hold` in force and posts the annotation change.
+  // Puts `hold` in force and posts the annotation change. A hold whose
+  // client's connection has ended meanwhile is released again at once, as
+  // the client's other holds were.
   void addHold(std::shared_ptr<DRDPlugInHold> hold);
   // Releases the hold with `token`, if any (logged, change posted); any
   // client may release any hold.

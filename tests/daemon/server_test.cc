@@ -5,11 +5,18 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
 #include <chrono>
+#include <cstring>
+#include <future>
 #include <thread>
 
 #include "core/log.h"
 #include "daemon/ipc_client.h"
+#include "platform/drm1.h"
 #include "platform/message_service.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_services.h"
@@ -113,6 +120,55 @@ TEST_F(ServerTest, UninstallStopsInstancesAndLogsOnlyRealFailures) {
   }
   EXPECT_EQ(removals, std::vector<std::string>{"PLUGIN REMOVAL:com.example.refused RESULT:1"});
   EXPECT_EQ(serviceManager_.removals.size(), 3u) << "every uninstalled plug-in is stopped";
+}
+
+// A "lock" whose connection ends while the request runs, after its client was
+// still found alive: the client's end releases its holds first, finding none,
+// and the hold placed afterwards must not outlive it (nobody could release it
+// but a restart).
+TEST_F(ServerTest, HoldOfAClientThatEndedWhileItsRequestRanIsReleased) {
+  const std::string app = folder_ / "Host.app";
+  MakeBundle(app, Value{{"BNBundleIdentifier", "com.example.host"}});
+  const std::string path =
+      MakeBundle(app + "/Contents/PlugIns/held.appex", Info("com.example.held"),
+                 Value{{"com.corvel.security.app-sandbox", true}});
+  ASSERT_FALSE(server_->addPlugIn(path).has_value());
+  DRDPlugInPtr held = server_->findPlugInAtPath(path);
+  ASSERT_TRUE(held);
+  server_->setVerbose(1);
+  server_->resume();
+  ScopedLogCapture log;
+  // The request stops at its busy check, past the check that its client lives.
+  std::promise<void> reached, go;
+  serviceManager_.onBusyQuery = [&reached, f = go.get_future().share()] {
+    reached.set_value();
+    f.wait();
+  };
+
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  ASSERT_GE(fd, 0);
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  const std::string socketPath = folder_ / "sockets/com.example.drd";
+  std::strncpy(addr.sun_path, socketPath.c_str(), sizeof addr.sun_path - 1);
+  ASSERT_EQ(::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr), 0);
+  const Value lock{{"request", "lock"},
+                   {"version", uint64_t{2}},
+                   {"flags", uint64_t{1}},
+                   {"paths", Value(Array{Value(app)})}};
+  const std::string frame = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, lock);
+  ASSERT_EQ(::write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  ASSERT_EQ(reached.get_future().wait_for(5s), std::future_status::ready);
+  ::close(fd);
+  for (int i = 0; i < 500 && !log.contains("is dead"); ++i) std::this_thread::sleep_for(10ms);
+  ASSERT_TRUE(log.contains("is dead"));
+
+  go.set_value();
+  server_->mainQueue().sync([] {});
+  EXPECT_TRUE(log.contains("hold request granted")) << "the request ran to its end";
+  EXPECT_TRUE(server_->holds().empty());
+  EXPECT_FALSE(server_->holdOnPlugIn(*held));
+  EXPECT_TRUE(log.contains("for dead client pid"));
 }
 
 TEST_F(ServerTest, HoldsBlockUntilEachIsReleased) {

@@ -5,6 +5,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
@@ -32,6 +33,9 @@ class FakeServiceManager : public ServiceManager {
   std::vector<BusyExtensionInstance> instances;
   std::optional<Error> busyError;
   std::vector<std::vector<std::string>> busyQueries;
+  // Called first by busyExtensionInstances, on the asking thread: lets a test
+  // hold a request at that point.
+  std::function<void()> onBusyQuery;
 
   // (identifier, version) → what removeExternalServiceInstance answers;
   // kNoInstanceRunning for anything not listed.
@@ -58,6 +62,7 @@ class FakeServiceManager : public ServiceManager {
 
   Result<std::vector<BusyExtensionInstance>> busyExtensionInstances(
       const std::vector<std::string>& bundleIdentifiers) override {
+    if (onBusyQuery) onBusyQuery();
     busyQueries.push_back(bundleIdentifiers);
     if (busyError) return *busyError;
     std::vector<BusyExtensionInstance> out;
