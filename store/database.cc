@@ -155,16 +155,20 @@ void DRDatabase::registryChanged() { registryChanges_.fetch_add(1, std::memory_o
 std::optional<Error> DRDatabase::addPlugIn(const std::string& url) {
   // Whatever the outcome, the registry may have changed by now; its events
   // come later, while the caller may discover at once.
-  const bool ok = options_.registry->registerBundle(url).ok();
+  const Status status = options_.registry->registerBundle(url);
   registryChanged();
-  if (ok) return std::nullopt;
+  if (status.ok()) return std::nullopt;
+  // The reply names only the path; the registry's reason (a broken bundle,
+  // a database held by another process, a full disk) goes to the log.
+  SystemLog("%@", status);
   return DRMakeError(kDRErrorRegistrar, "Registrar failed to register the plug-in");
 }
 
 std::optional<Error> DRDatabase::removePlugIn(const std::string& url) {
-  const bool ok = options_.registry->unregisterBundle(url).ok();
+  const Status status = options_.registry->unregisterBundle(url);
   registryChanged();
-  if (ok) return std::nullopt;
+  if (status.ok()) return std::nullopt;
+  SystemLog("%@", status);
   return DRMakeError(kDRErrorRegistrar, "Registrar failed to deregister the plug-in");
 }
 

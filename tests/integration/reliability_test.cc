@@ -27,6 +27,7 @@
 #include <thread>
 
 #include <gtest/gtest.h>
+#include <sqlite3.h>
 
 #include "platform/drm1.h"
 #include "platform/pdoc.h"
@@ -381,6 +382,34 @@ TEST(ReliabilityTest, UnwritableAnnotationFolderKeepsChangesInMemory) {
               form["identifier"].stringValue() == p.ids[0] ? 1 : 2)
         << form["identifier"].stringValue();
   }
+}
+
+// Another process holds the registry database: a registration waits for it,
+// then gets a clear error reply, and drd goes on answering; once the database
+// is free again the same registration goes through.
+TEST(ReliabilityTest, LockedRegistryGivesAnErrorReplyAndDrdStaysUp) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "locked", 1);
+  sqlite3* other = nullptr;
+  ASSERT_EQ(sqlite3_open(w.path("registry/r.sqlite3").c_str(), &other), SQLITE_OK);
+  std::unique_ptr<sqlite3, decltype(&sqlite3_close)> closer(other, &sqlite3_close);
+  ASSERT_EQ(sqlite3_exec(other, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
+
+  const std::string path = w.makePlugIn("system/late.appex", "com.example.late");
+  Value reply = w.add({path});
+  EXPECT_EQ(ErrorCode(reply), 2u) << ErrorText(reply);
+  EXPECT_FALSE(ErrorText(reply).empty());
+  EXPECT_NE(w.log().find("database is locked"), std::string::npos) << w.log();
+  reply = w.call(Request("remove", {{"paths", Value(Array{Value(p.paths[0])})}}));
+  EXPECT_EQ(ErrorCode(reply), 9u) << ErrorText(reply);
+  EXPECT_EQ(w.match().size(), 1u) << "what was registered is still offered";
+
+  ASSERT_EQ(sqlite3_exec(other, "ROLLBACK", nullptr, nullptr, nullptr), SQLITE_OK);
+  reply = w.add({path});
+  EXPECT_EQ(ErrorCode(reply), 0u) << ErrorText(reply);
+  EXPECT_EQ(w.match().size(), 2u);
+  ASSERT_TRUE(Alive(w.drd().pid()));
 }
 
 // Garbage in the files drd reads (an extension point's SDK dictionary, the
