@@ -24,6 +24,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <climits>
@@ -61,13 +62,13 @@ bool ValidClass(std::string_view c) {
   return true;
 }
 
-std::string Hex(const uint8_t* bytes, size_t n) {
+// Writes the lower-case hex of `n` bytes at `out` (2n characters). Tokens
+// carry paths in hex, so this runs for every byte of every path granted.
+char* WriteHex(char* out, const uint8_t* bytes, size_t n) {
   static constexpr char kDigits[] = "0123456789abcdef";
-  std::string out;
-  out.reserve(2 * n);
   for (size_t i = 0; i < n; ++i) {
-    out += kDigits[bytes[i] >> 4];
-    out += kDigits[bytes[i] & 0xf];
+    *out++ = kDigits[bytes[i] >> 4];
+    *out++ = kDigits[bytes[i] & 0xf];
   }
   return out;
 }
@@ -90,15 +91,21 @@ std::optional<std::string> Unhex(std::string_view hex) {
 }
 
 // The MAC of a token, from the HMAC state already keyed with the key (which
-// saves hashing the key's pads again for every token).
+// saves hashing the key's pads again for every token). mac-input is fed in
+// its pieces rather than copied together first.
 std::array<uint8_t, kMacBytes> Mac(const crypto_auth_hmacsha256_state& keyed, std::string_view cls,
                                    std::string_view path) {
-  std::string input;
-  input.reserve(kTokenMagic.size() + cls.size() + path.size() + 2);
-  input.append(kTokenMagic).append(1, '\0').append(cls).append(1, '\0').append(path);
+  static constexpr unsigned char kNul = 0;
+  auto update = [](crypto_auth_hmacsha256_state& state, std::string_view bytes) {
+    crypto_auth_hmacsha256_update(&state, reinterpret_cast<const unsigned char*>(bytes.data()),
+                                  bytes.size());
+  };
   crypto_auth_hmacsha256_state state = keyed;
-  crypto_auth_hmacsha256_update(&state, reinterpret_cast<const unsigned char*>(input.data()),
-                                input.size());
+  update(state, kTokenMagic);
+  crypto_auth_hmacsha256_update(&state, &kNul, 1);
+  update(state, cls);
+  crypto_auth_hmacsha256_update(&state, &kNul, 1);
+  update(state, path);
   std::array<uint8_t, kMacBytes> mac;
   crypto_auth_hmacsha256_final(&state, mac.data());
   sodium_memzero(&state, sizeof state);
@@ -225,22 +232,28 @@ class LinuxSandbox final : public Sandbox {
                                          uint32_t flags) override {
     if (!ValidClass(extensionClass)) return PosixError(EINVAL, "extension class");
     if (path.find('\0') != std::string::npos) return PosixError(EINVAL, "path holds NUL");
-    std::string granted = path;
+    std::string resolvedPath;
+    std::string_view granted = path;
     if (flags & kExtensionCanonicalPath) {
       Result<std::string> resolved = CanonicalPath(path);
       if (!resolved.ok()) return resolved.error();
-      granted = std::move(resolved).value();
+      resolvedPath = std::move(resolved).value();
+      granted = resolvedPath;
     } else if (path.empty() || path[0] != '/') {
       return PosixError(EINVAL, "relative path " + path);
     }
     Result<crypto_auth_hmacsha256_state> keyed = loadKey();
     if (!keyed.ok()) return keyed.error();
     std::array<uint8_t, kMacBytes> mac = Mac(*keyed, extensionClass, granted);
-    std::string token(kTokenMagic);
-    token.append(1, kTokenSeparator).append(extensionClass).append(1, kTokenSeparator);
-    token += Hex(reinterpret_cast<const uint8_t*>(granted.data()), granted.size());
-    token.append(1, kTokenSeparator);
-    token += Hex(mac.data(), mac.size());
+    // Written in place into a string of the token's final size.
+    std::string token(
+        kTokenMagic.size() + extensionClass.size() + 2 * granted.size() + 2 * mac.size() + 3,
+        kTokenSeparator);
+    char* out = token.data();
+    out = std::copy(kTokenMagic.begin(), kTokenMagic.end(), out) + 1;
+    out = std::copy(extensionClass.begin(), extensionClass.end(), out) + 1;
+    out = WriteHex(out, reinterpret_cast<const uint8_t*>(granted.data()), granted.size()) + 1;
+    WriteHex(out, mac.data(), mac.size());
     return token;
   }
 
