@@ -147,25 +147,18 @@ void Discovery::examine(const DRDPlugInPtr& candidate) {
       return;
     }
   }
-  std::optional<Error> error;
-  Value form = p.exportForm(&error);
-  if (error && services_.log) {
-    services_.log(Format("error matching %@: %@", p.path(), *error));
-  }
-  if (!form.isDictionary()) {
-    setOutcome(verdict, DiscoveryOutcome::kNoForm, error ? error->description() : std::string());
-    return;
-  }
   if (!resolveDuplicates(candidate, verdict)) return;
 
-  Dictionary entries = form.dictionary();
+  // The form's entries straight from the record (exporting never fails), so
+  // that the annotations and tokens are added without copying the form.
+  Dictionary entries = p.formEntries();
   if (services_.addAnnotation) {
     services_.addAnnotation(p, entries);
   } else {
     entries[kAnnotationsFormKey] = Value::EmptyDictionary();
   }
   p.augmentForm(entries);
-  form = Value(std::move(entries));
+  const Value form(std::move(entries));
   const size_t position = accepted_.size();
   accepted_.push_back({candidate, verdict, form});
   if (const Value& id = form[kFormIdentifierKey]; id.isString()) {

@@ -29,34 +29,48 @@ std::optional<std::string> StringOf(const Value& v) {
   return s ? std::optional<std::string>(std::string(*s)) : std::nullopt;
 }
 
-Value ValueOf(const std::optional<std::string>& s) { return s ? Value(*s) : Value(); }
-
 // A dictionary, or absent for anything else.
 Value DictionaryOf(const Value& v) { return v.isDictionary() ? v : Value(); }
 
 }  // namespace
 
 Value DRPlugInCore::exportForm(std::optional<Error>* /*error*/) const {
+  return Value(formEntries());
+}
+
+// One lock for the whole form rather than one per property (a form is made
+// for every plug-in a match returns), which also makes the form one
+// consistent picture of the record. The keys go in ascending order, each at
+// the end of the map.
+Dictionary DRPlugInCore::formEntries() const {
+  // Absent annotations read as this one shared empty dictionary, not a new
+  // node per form.
+  static const Value kNoAnnotations = Value::EmptyDictionary();
   Dictionary form;
-  form[kFormHubProtocolVersionKey] = hubProtocolVersion();
-  form[kFormPathKey] = ValueOf(path());
-  form[kFormSystemResidentKey] = onSystemVolume();
-  form[kFormIdentifierKey] = ValueOf(identifier());
+  auto add = [&form](const char* key, Value value) {
+    if (value.isPresent()) form.emplace_hint(form.end(), key, std::move(value));
+  };
+  std::lock_guard<std::mutex> lock(mu_);
+  add(kFormAnnotationsKey, annotations_.isDictionary() ? annotations_ : kNoAnnotations);
+  // Copied only when there is something to leave out.
+  add(kFormBundleInfoKey, bundleInfoDictionary_.has(kBNBundleInfoPdocURLKey)
+                              ? bundleInfoDictionary_.changing(kBNBundleInfoPdocURLKey, Value())
+                              : bundleInfoDictionary_);
+  add(kFormContainingPathKey, containingUrl_);
+  add(kFormHubProtocolVersionKey, hubProtocolVersion_);
+  add(kFormIdentifierKey, identifier_);
+  add(kFormInfoKey, plugInDictionary_);
+  add(kFormLastModifiedKey, lastModified_);
+  add(kFormLocalizedContainingNameKey, localizedContainingName_);
+  add(kFormLocalizedNameKey, localizedName_);
+  add(kFormLocalizedShortNameKey, localizedShortName_);
+  add(kFormPathKey, url_);
+  add(kFormSystemResidentKey, onSystemVolume_);
+  if (uuid_) add(kFormUuidKey, uuid_->string());
   // A record whose canonicalisation was skipped may have no version; the key
   // still carries a string, the empty one, which orders before every version.
-  form[kFormVersionKey] = version().value_or("");
-  form[kFormBundleInfoKey] = bundleInfoDictionary().changing(kBNBundleInfoPdocURLKey, Value());
-  form[kFormInfoKey] = plugInDictionary();
-  std::optional<Uuid> id = uuid();
-  if (id) form[kFormUuidKey] = id->string();
-  form[kFormLastModifiedKey] = lastModified();
-  Value notes = annotations();
-  form[kFormAnnotationsKey] = notes.isDictionary() ? notes : Value::EmptyDictionary();
-  form[kFormContainingPathKey] = ValueOf(containingPath());
-  form[kFormLocalizedContainingNameKey] = ValueOf(localizedContainingName());
-  form[kFormLocalizedNameKey] = ValueOf(localizedName());
-  form[kFormLocalizedShortNameKey] = ValueOf(localizedShortName());
-  return Value(std::move(form));  // absent entries drop out
+  add(kFormVersionKey, versionOf(plugInDictionary_).value_or(""));
+  return form;
 }
 
 std::shared_ptr<DRPlugInCore> DRPlugInCore::initWithForm(const Value& form) {

@@ -83,8 +83,10 @@ void DRPlugInCore::setPlugInDictionary(const Value& pd) {
 
 Value DRPlugInCore::attributes() const { return plugInDictionary()[kUXExtensionAttributesKey]; }
 
-std::optional<std::string> DRPlugInCore::version() const {
-  Value v = attributes()[kUXExtensionVersionKey];
+std::optional<std::string> DRPlugInCore::version() const { return versionOf(plugInDictionary()); }
+
+std::optional<std::string> DRPlugInCore::versionOf(const Value& plugInDictionary) {
+  const Value& v = plugInDictionary[kUXExtensionAttributesKey][kUXExtensionVersionKey];
   // A version written as a number (JSON Info.pdoc files allow it) reads as
   // its decimal text, so it still orders and travels as a version string.
   if (v.isString()) return v.stringValue();

@@ -223,6 +223,9 @@ class DRPlugInCore {
   // The record as a form (a new dictionary). Never fails; `error` is left
   // untouched. REQUIRES: identifier, url, plugInDictionary and uuid present.
   Value exportForm(std::optional<Error>* error = nullptr) const;
+  // The same form as a mutable dictionary, for a caller that adds entries
+  // before wrapping it (no absent values in it).
+  Dictionary formEntries() const;
   // annotations := form["annotations"]; absent (or not a dictionary) clears.
   void updateFromForm(const Value& form);
 
@@ -238,6 +241,8 @@ class DRPlugInCore {
     std::swap(field, value);  // the old value dies outside the lock
   }
   const Uuid& requireUuid(const std::optional<Uuid>& uuid) const;
+  // version() of a plug-in dictionary.
+  static std::optional<std::string> versionOf(const Value& plugInDictionary);
 
   mutable std::mutex mu_;
   bool onSystemVolume_ = false;
