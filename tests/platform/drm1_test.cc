@@ -5,6 +5,7 @@
 #include <cstring>
 #include <limits>
 #include <string>
+#include <vector>
 
 namespace dr::drm1 {
 namespace {
@@ -182,6 +183,65 @@ TEST(Drm1Test, RefusesToEncodeWhatPeersWouldRefuse) {
   Value deep = Value(true);
   for (int i = 0; i < kMaxDepth; ++i) deep = Value(Array{deep});
   EXPECT_FALSE(EncodeFrame(1, 0, 0, Value{{"k", deep}}));
+}
+
+// Text is read eight bytes at a time, so a NUL or a byte that is not UTF-8
+// is placed at each position of a word, across words and in the tail, in a
+// value and in a key. A string holding both is refused for its NUL.
+TEST(Drm1Test, RefusesTextWhereverTheBadByteFalls) {
+  const std::string ascii = "abcdefghijklmnopqrstuvw";  // 23 bytes: two words and a tail
+  struct Row {
+    std::string text;
+    const char* refusal;  // nullptr: encoded
+  };
+  std::vector<Row> rows = {{ascii, nullptr},
+                           {"", nullptr},
+                           {ascii + "\xC3\xA9" + ascii, nullptr},
+                           {"\x7F" + ascii, nullptr},
+                           {ascii + "\xFF" + std::string(1, '\0'), "holds NUL"}};
+  for (size_t at : {0, 1, 7, 8, 9, 15, 16, 22}) {
+    std::string withNul = ascii, notUtf8 = ascii;
+    withNul[at] = '\0';
+    notUtf8[at] = '\x80';
+    rows.push_back({withNul, "holds NUL"});
+    rows.push_back({notUtf8, "is not UTF-8"});
+  }
+  for (const Row& row : rows) {
+    for (const Value& body : {Value{{"k", row.text}}, Value{{row.text, 1}}}) {
+      Result<std::string> f = EncodeFrame(1, 0, 0, body);
+      if (!row.refusal) {
+        ASSERT_TRUE(f) << f.error().description();
+        EXPECT_EQ(DecodeWhole(*f).value_or(Value()), body);
+        continue;
+      }
+      ASSERT_FALSE(f) << body.description();
+      EXPECT_EQ(f.error().code(), kUnencodable);
+      EXPECT_NE(f.error().description().find(row.refusal), std::string::npos)
+          << f.error().description();
+    }
+  }
+}
+
+// A body of up to 16 MiB is encoded whole, one byte more is refused: at the
+// limit less the header, at the limit, and past it.
+TEST(Drm1Test, EncodesBodiesUpTo16MiB) {
+  // {"k": "<padding>"}: 5 + 4 + 1 + 1 + 4 bytes around the padding.
+  constexpr size_t kAround = 15;
+  struct Row {
+    size_t bodySize;
+    bool encoded;
+  } rows[] = {{kMaxBodySize - kHeaderSize, true}, {kMaxBodySize, true}, {kMaxBodySize + 1, false}};
+  for (const Row& row : rows) {
+    const Value body{{"k", std::string(row.bodySize - kAround, 'x')}};
+    Result<std::string> f = EncodeFrame(1, 0, 0, body);
+    ASSERT_EQ(f.ok(), row.encoded) << row.bodySize;
+    if (row.encoded) {
+      EXPECT_EQ(f->size(), kHeaderSize + row.bodySize);
+      EXPECT_EQ(DecodeWhole(*f).value_or(Value()), body);
+    } else {
+      EXPECT_EQ(f.error().code(), kUnencodable);
+    }
+  }
 }
 
 }  // namespace
