@@ -209,16 +209,9 @@ bool IsPlainAscii(std::string_view s) {
   return true;
 }
 
-Status AppendText(std::string& out, std::string_view s, const char* what) {
-  if (Status st = CheckText(s, what); !st.ok()) return st;
-  Store(out, static_cast<uint32_t>(s.size()));
-  out.append(s);
-  return Status::OK();
-}
-
-// The bytes Append writes for `v`, so that a large reply is built in one
+// The bytes ValueWriter writes for `v`, so that a large reply is built in one
 // allocation instead of growing (and copying) its buffer about twenty times.
-// Deeper nesting than the codec allows is not walked: Append refuses it.
+// Deeper nesting than the codec allows is not walked: the writer refuses it.
 size_t EncodedSize(const Value& v, int depth) {
   switch (v.type()) {
     case Value::Type::kAbsent:
@@ -250,82 +243,44 @@ size_t EncodedSize(const Value& v, int depth) {
   return 0;
 }
 
-Status Append(std::string& out, const Value& v, int depth) {
-  if (out.size() > kMaxBodySize) return Unencodable("body larger than 16 MiB");
-  switch (v.type()) {
-    case Value::Type::kAbsent:
-      out += static_cast<char>(kTagNull);
-      return Status::OK();
-    case Value::Type::kBool:
-      out += static_cast<char>(v.boolValue() ? kTagTrue : kTagFalse);
-      return Status::OK();
-    case Value::Type::kInt:
-      out += static_cast<char>(kTagInt);
-      Store(out, v.intValue());
-      return Status::OK();
-    case Value::Type::kUInt:
-      out += static_cast<char>(kTagUInt);
-      Store(out, v.uintValue());
-      return Status::OK();
-    case Value::Type::kDouble:
-      out += static_cast<char>(kTagDouble);
-      Store(out, v.doubleValue());
-      return Status::OK();
-    case Value::Type::kDate:
-      out += static_cast<char>(kTagDate);
-      Store(out, v.date()->seconds);
-      return Status::OK();
-    case Value::Type::kString:
-      out += static_cast<char>(kTagString);
-      return AppendText(out, v.stringValue(), "string");
-    case Value::Type::kData: {
-      const Data& d = v.dataValue();
-      if (d.size() > kMaxBodySize) return Unencodable("data too long");
-      out += static_cast<char>(kTagData);
-      Store(out, static_cast<uint32_t>(d.size()));
-      out.append(reinterpret_cast<const char*>(d.data()), d.size());
-      return Status::OK();
-    }
-    case Value::Type::kUuid:
-      out += static_cast<char>(kTagUuid);
-      out.append(reinterpret_cast<const char*>(v.uuid()->bytes.data()), 16);
-      return Status::OK();
-    case Value::Type::kArray:
-    case Value::Type::kDictionary:
-      if (depth > kMaxDepth) {
-        return Unencodable("nesting deeper than " + std::to_string(kMaxDepth) + " levels");
-      }
-      if (v.isArray()) {
-        out += static_cast<char>(kTagArray);
-        Store(out, static_cast<uint32_t>(v.array().size()));
-        for (const Value& e : v.array()) {
-          if (Status s = Append(out, e, depth + 1); !s.ok()) return s;
-        }
-      } else {
-        out += static_cast<char>(kTagDictionary);
-        Store(out, static_cast<uint32_t>(v.dictionary().size()));
-        for (const auto& [k, e] : v.dictionary()) {
-          if (Status s = AppendText(out, k, "key"); !s.ok()) return s;
-          if (Status s = Append(out, e, depth + 1); !s.ok()) return s;
-        }
-      }
-      return Status::OK();
-  }
-  return Unencodable("unknown value type");
-}
-
-// Append for a value whose whole encoding is known to fit the body limit,
-// written through a pointer into a buffer of exactly EncodedSize bytes
-// rather than appended piece by piece. It refuses what Append refuses, in
-// the same order, and nothing else: within the limit Append's size check
-// never fires, and it writes nothing past a refused container, which is
-// where EncodedSize stops counting.
-class FittingWriter {
+// Writes into a buffer already sized to hold the whole encoding (of a body
+// known to fit the limit), through a pointer.
+class FittingSink {
  public:
-  explicit FittingWriter(char* out) : p_(out) {}
+  explicit FittingSink(char* out) : p_(out) {}
   char* end() const { return p_; }
+  static constexpr bool overLimit() { return false; }
+  void put(const void* from, size_t n) {
+    if (n != 0) std::memcpy(p_, from, n);
+    p_ += n;
+  }
+
+ private:
+  char* p_;
+};
+
+// Appends to a string, for a body that may pass the limit: it stops with an
+// error at the first value that starts beyond it.
+class GrowingSink {
+ public:
+  explicit GrowingSink(std::string& out) : out_(out) {}
+  bool overLimit() const { return out_.size() > kMaxBodySize; }
+  void put(const void* from, size_t n) { out_.append(static_cast<const char*>(from), n); }
+
+ private:
+  std::string& out_;
+};
+
+// The encoder of values, over either sink; both refuse the same values with
+// the same errors, in the same order, except that only the growing sink
+// meets the limit.
+template <typename Sink>
+class ValueWriter {
+ public:
+  explicit ValueWriter(Sink& sink) : sink_(sink) {}
 
   Status value(const Value& v, int depth) {
+    if (sink_.overLimit()) return Unencodable("body larger than 16 MiB");
     switch (v.type()) {
       case Value::Type::kAbsent:
         tag(kTagNull);
@@ -354,14 +309,15 @@ class FittingWriter {
         return text(v.stringValue(), "string");
       case Value::Type::kData: {
         const Data& d = v.dataValue();
+        if (d.size() > kMaxBodySize) return Unencodable("data too long");
         tag(kTagData);
         raw(static_cast<uint32_t>(d.size()));
-        bytes(d.data(), d.size());
+        sink_.put(d.data(), d.size());
         return Status::OK();
       }
       case Value::Type::kUuid:
         tag(kTagUuid);
-        bytes(v.uuid()->bytes.data(), 16);
+        sink_.put(v.uuid()->bytes.data(), 16);
         return Status::OK();
       case Value::Type::kArray:
       case Value::Type::kDictionary:
@@ -390,42 +346,38 @@ class FittingWriter {
   }
 
  private:
-  void tag(uint8_t t) { *p_++ = static_cast<char>(t); }
+  void tag(uint8_t t) { sink_.put(&t, 1); }
   template <typename T>
   void raw(T v) {
-    std::memcpy(p_, &v, sizeof v);
-    p_ += sizeof v;
-  }
-  void bytes(const void* from, size_t n) {
-    if (n != 0) std::memcpy(p_, from, n);
-    p_ += n;
+    sink_.put(&v, sizeof v);
   }
   Status text(std::string_view s, const char* what) {
-    if (!IsPlainAscii(s)) {
+    if (s.size() > kMaxBodySize || !IsPlainAscii(s)) {
       if (Status st = CheckText(s, what); !st.ok()) return st;
     }
     raw(static_cast<uint32_t>(s.size()));
-    bytes(s.data(), s.size());
+    sink_.put(s.data(), s.size());
     return Status::OK();
   }
 
-  char* p_;
+  Sink& sink_;
 };
 
 // `value` encoded after `prefix` bytes (left as they are in `out`, which
 // holds at least that many), the buffer sized once.
 Status Encode(std::string& out, size_t prefix, const Value& value) {
   const size_t size = EncodedSize(value, 1);
-  // Append's size check counts the prefix too.
+  // The growing sink's limit counts the prefix too.
   if (prefix + size <= kMaxBodySize) {
     out.resize(prefix + size);
-    FittingWriter writer(out.data() + prefix);
-    if (Status s = writer.value(value, 1); !s.ok()) return s;
-    out.resize(static_cast<size_t>(writer.end() - out.data()));
+    FittingSink sink(out.data() + prefix);
+    if (Status s = ValueWriter<FittingSink>(sink).value(value, 1); !s.ok()) return s;
+    out.resize(static_cast<size_t>(sink.end() - out.data()));
     return Status::OK();
   }
   out.reserve(prefix + std::min<size_t>(size, kMaxBodySize + 1));
-  return Append(out, value, 1);
+  GrowingSink sink(out);
+  return ValueWriter<GrowingSink>(sink).value(value, 1);
 }
 
 }  // namespace
