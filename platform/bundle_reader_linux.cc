@@ -47,11 +47,10 @@ class LinuxBundleHandle final : public BundleHandle {
  public:
   LinuxBundleHandle() = default;
 
-  // A handle for the bundle (or free-standing executable) at `bundlePath`,
-  // which exists.
-  explicit LinuxBundleHandle(std::string bundlePath) : bundlePath_(std::move(bundlePath)) {
-    bool dir = false;
-    if (!Exists(*bundlePath_, &dir) || !dir) return;  // a free-standing executable
+  // A handle for the bundle (a folder) or free-standing executable at
+  // `bundlePath`, which exists.
+  LinuxBundleHandle(std::string bundlePath, bool isDirectory) : bundlePath_(std::move(bundlePath)) {
+    if (!isDirectory) return;  // a free-standing executable
     Result<Value> info = pdoc::ReadFile(*bundlePath_ + std::string(kInfoFile));
     if (info.ok() && info->isDictionary()) info_ = *info;
     std::optional<std::string_view> exe = info_[kExecutableKey].string();
@@ -81,18 +80,23 @@ class LinuxBundleHandle final : public BundleHandle {
 class LinuxBundleReader final : public BundleReader {
  public:
   std::shared_ptr<const BundleHandle> bundleAtPath(const std::string& path, Mode mode) override {
+    // Every connection asks for its peer's bundle, so the path is looked at
+    // once: the name's shape first, then one stat.
     std::string p = TrimSlashes(path);
-    if (p.empty() || !Exists(p)) return std::make_shared<LinuxBundleHandle>();
-    if (mode == Mode::kBundlePath) return std::make_shared<LinuxBundleHandle>(p);
-
+    if (mode == Mode::kBundlePath) {
+      bool dir = false;
+      if (p.empty() || !Exists(p, &dir)) return std::make_shared<LinuxBundleHandle>();
+      return std::make_shared<LinuxBundleHandle>(p, dir);
+    }
     // <bundle>/Contents/Exec/<file>
     std::string_view exec, file, contents, execName, bundle, contentsName;
-    if (!IsFile(p) || !SplitLast(p, &exec, &file) || !SplitLast(exec, &contents, &execName) ||
+    if (!SplitLast(p, &exec, &file) || !SplitLast(exec, &contents, &execName) ||
         execName != "Exec" || !SplitLast(contents, &bundle, &contentsName) ||
-        contentsName != "Contents" || bundle.empty()) {
+        contentsName != "Contents" || bundle.empty() || !IsFile(p)) {
       return std::make_shared<LinuxBundleHandle>();
     }
-    return std::make_shared<LinuxBundleHandle>(std::string(bundle));
+    // A folder holds the file, so the bundle is one.
+    return std::make_shared<LinuxBundleHandle>(std::string(bundle), /*isDirectory=*/true);
   }
 
   std::shared_ptr<const BundleHandle> mainBundle() override {
