@@ -1,7 +1,13 @@
 #include "core/queue.h"
 
+#include <sys/resource.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <atomic>
+#include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <vector>
 
 #include "core/log.h"
@@ -17,10 +23,30 @@ struct CurrentQueueScope {
   ~CurrentQueueScope() { tCurrentQueues.pop_back(); }
 };
 
+// How far background threads' nice value is above the process's: their
+// share of a busy processor falls to about a tenth of a default thread's.
+constexpr int kBackgroundNice = 10;
+
 }  // namespace
 
-SerialQueue::SerialQueue(std::string label)
-    : label_(std::move(label)), state_(std::make_shared<State>()) {}
+void EnterBackgroundPriority() {
+  const pid_t tid = ::gettid();
+  errno = 0;
+  const int nice = ::getpriority(PRIO_PROCESS, static_cast<id_t>(tid));
+  if (nice == -1 && errno != 0) return;
+  if (::setpriority(PRIO_PROCESS, static_cast<id_t>(tid), std::min(nice + kBackgroundNice, 19)) !=
+      0) {
+    static std::atomic<bool> logged{false};
+    if (!logged.exchange(true)) {
+      SystemLog("cannot lower a background thread's priority: %s", std::strerror(errno));
+    }
+  }
+}
+
+SerialQueue::SerialQueue(std::string label, QueuePriority priority)
+    : label_(std::move(label)), state_(std::make_shared<State>()) {
+  state_->priority = priority;
+}
 
 SerialQueue::~SerialQueue() {
   std::thread worker;
@@ -88,6 +114,7 @@ void SerialQueue::sync(const std::function<void()>& work) {
 }
 
 void SerialQueue::runWorker(std::shared_ptr<State> s) {
+  if (s->priority == QueuePriority::kBackground) EnterBackgroundPriority();
   std::unique_lock<std::mutex> lock(s->mu);
   for (;;) {
     s->cv.wait(lock, [&] {

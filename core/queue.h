@@ -28,9 +28,19 @@
 
 namespace dr {
 
+// How a queue's thread competes for the processor with drd's other threads.
+// Linux has no classes of service for threads, but a thread may lower its
+// own priority (raise its nice value) without privileges: background work
+// gives way to the default's whenever both are ready to run.
+enum class QueuePriority { kDefault, kBackground };
+
+// Lowers the calling thread's priority to that of background queues (nice 10
+// above the process's), for threads that are not a queue's (a listener's).
+void EnterBackgroundPriority();
+
 class SerialQueue {
  public:
-  explicit SerialQueue(std::string label);
+  explicit SerialQueue(std::string label, QueuePriority priority = QueuePriority::kDefault);
   ~SerialQueue();
   SerialQueue(const SerialQueue&) = delete;
   SerialQueue& operator=(const SerialQueue&) = delete;
@@ -76,6 +86,7 @@ class SerialQueue {
     std::deque<std::pair<uint64_t, std::function<void()>>> pending;  // guarded by mu
     bool stopping = false;                                           // guarded by mu
     std::thread worker;                                              // guarded by mu
+    QueuePriority priority = QueuePriority::kDefault;                // set once
   };
   static void runWorker(std::shared_ptr<State> state);
   // Gives the turn to the next ticket and wakes its holder. REQUIRES: mu held.

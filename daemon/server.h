@@ -151,9 +151,9 @@ class DRDServer : public DRDatabase, public DRDatabaseDelegate {
 
   ServerOptions options_;
   std::atomic<uint32_t> verbose_{0};
-  SerialQueue ipcQueue_{"ipc"};
-  // Serial like every SerialQueue; the platform gives its threads no
-  // quality-of-service classes.
+  // New connections are taken in the background: under a flood of them the
+  // clients' requests on the service queue go first.
+  SerialQueue ipcQueue_{"ipc", QueuePriority::kBackground};
   SerialQueue mainQueue_{"service"};
   SerialQueue syncQueue_{"serverSync"};
   TurnQueue serviceTurns_{&mainQueue_};                // the clients' requests, in turns

@@ -145,6 +145,9 @@ class Listener {
 
   // Each new peer connection goes to `handler` on the event queue.
   void setEventHandler(std::function<void(std::shared_ptr<PeerConnection>)> handler);
+  // Starts accepting, on a thread of background priority: under a flood of
+  // connections the work of the ones already made goes first, and the flood
+  // waits in the socket's backlog.
   void resume();
   // Stops accepting; connections already made carry on.
   void stop();

@@ -449,6 +449,7 @@ void Listener::stop() {
 }
 
 void Listener::acceptLoop() {
+  EnterBackgroundPriority();
   while (!stopping_) {
     // A peer connecting faster than connections are handed over would
     // otherwise hold an unbounded number of descriptors here; beyond the

@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/resource.h>
+#include <unistd.h>
+
 #include <atomic>
 #include <thread>
 #include <vector>
@@ -96,6 +99,30 @@ TEST(SerialQueueTest, SyncRunsOnTheCallersThreadAndKnowsItsQueue) {
   a.sync([] {});
   EXPECT_TRUE(onWorker);
   EXPECT_EQ(a.syncResult([] { return 42; }), 42);
+}
+
+// A background queue's own thread runs at a lower priority than the thread
+// that made it, and so does work it runs; a default queue's does not, and a
+// sync() entry runs at its caller's priority.
+TEST(SerialQueueTest, BackgroundQueuesRunTheirWorkAtLowerPriority) {
+  auto niceHere = [] { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); };
+  const int caller = niceHere();
+  if (caller >= 19) GTEST_SKIP() << "already at the lowest priority";
+  struct Row {
+    QueuePriority priority;
+    bool lower;
+  };
+  for (const Row row :
+       {Row{QueuePriority::kDefault, false}, Row{QueuePriority::kBackground, true}}) {
+    SerialQueue q("priority", row.priority);
+    std::atomic<int> onWorker{-100};
+    q.async([&] { onWorker = niceHere(); });
+    int inSync = -100;
+    q.sync([&] { inSync = niceHere(); });
+    EXPECT_EQ(onWorker.load() > caller, row.lower) << onWorker << " vs " << caller;
+    EXPECT_EQ(inSync, caller);
+  }
+  EXPECT_EQ(niceHere(), caller) << "the caller's own priority is left alone";
 }
 
 TEST(SerialQueueTest, DestructionRunsQueuedWork) {
