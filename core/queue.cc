@@ -30,12 +30,18 @@ constexpr int kBackgroundNice = 10;
 }  // namespace
 
 void EnterBackgroundPriority() {
-  const pid_t tid = ::gettid();
+  // Relative to the process's main thread, so that a thread made by a
+  // background one (and so already lowered) is not lowered twice.
   errno = 0;
-  const int nice = ::getpriority(PRIO_PROCESS, static_cast<id_t>(tid));
+  const int base = ::getpriority(PRIO_PROCESS, static_cast<id_t>(::getpid()));
+  if (base == -1 && errno != 0) return;
+  const auto tid = static_cast<id_t>(::gettid());
+  errno = 0;
+  const int nice = ::getpriority(PRIO_PROCESS, tid);
   if (nice == -1 && errno != 0) return;
-  if (::setpriority(PRIO_PROCESS, static_cast<id_t>(tid), std::min(nice + kBackgroundNice, 19)) !=
-      0) {
+  const int target = std::min(base + kBackgroundNice, 19);
+  if (nice >= target) return;
+  if (::setpriority(PRIO_PROCESS, tid, target) != 0) {
     static std::atomic<bool> logged{false};
     if (!logged.exchange(true)) {
       SystemLog("cannot lower a background thread's priority: %s", std::strerror(errno));
@@ -43,9 +49,16 @@ void EnterBackgroundPriority() {
   }
 }
 
+// The thread is made here rather than at first use: a thread starts with the
+// priority of the thread that makes it, and may not raise its own, so the
+// queue's thread must not come from whichever thread (a background one, say)
+// happens to submit first.
 SerialQueue::SerialQueue(std::string label, QueuePriority priority)
     : label_(std::move(label)), state_(std::make_shared<State>()) {
-  state_->priority = priority;
+  state_->worker = std::thread([state = state_, priority] {
+    if (priority == QueuePriority::kBackground) EnterBackgroundPriority();
+    runWorker(state);
+  });
 }
 
 SerialQueue::~SerialQueue() {
@@ -70,7 +83,6 @@ void SerialQueue::async(std::function<void()> work) {
   {
     std::lock_guard<std::mutex> lock(state_->mu);
     state_->pending.emplace_back(state_->nextTicket++, std::move(work));
-    if (!state_->worker.joinable()) state_->worker = std::thread(runWorker, state_);
   }
   state_->cv.notify_one();
 }
@@ -114,7 +126,6 @@ void SerialQueue::sync(const std::function<void()>& work) {
 }
 
 void SerialQueue::runWorker(std::shared_ptr<State> s) {
-  if (s->priority == QueuePriority::kBackground) EnterBackgroundPriority();
   std::unique_lock<std::mutex> lock(s->mu);
   for (;;) {
     s->cv.wait(lock, [&] {

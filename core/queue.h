@@ -1,7 +1,7 @@
 // SerialQueue: a labelled serial work queue.
 //
 // Work submitted to one queue runs one item at a time, in submission order.
-// async() runs work on the queue's own thread (started on first use). sync()
+// async() runs work on the queue's own thread (started with the queue). sync()
 // waits until everything submitted before it has run, then runs its work
 // inline on the caller's thread while the queue is held, so a synchronous
 // entry costs no thread hop. isCurrent() tells whether the calling thread is
@@ -28,18 +28,21 @@
 
 namespace dr {
 
-// How a queue's thread competes for the processor with drd's other threads.
-// Linux has no classes of service for threads, but a thread may lower its
-// own priority (raise its nice value) without privileges: background work
-// gives way to the default's whenever both are ready to run.
-enum class QueuePriority { kDefault, kBackground };
-
-// Lowers the calling thread's priority to that of background queues (nice 10
-// above the process's), for threads that are not a queue's (a listener's).
+// Lowers the calling thread's priority for background work: its nice value
+// becomes 10 above the process's main thread's (once: a thread already that
+// low is left alone), so it gives way to drd's other threads whenever both
+// are ready to run. Linux has no classes of service for threads, but a
+// thread may lower its own priority without privileges (not raise it again:
+// threads it makes start as low).
 void EnterBackgroundPriority();
+
+// Whether a queue's thread does background work (EnterBackgroundPriority).
+enum class QueuePriority { kDefault, kBackground };
 
 class SerialQueue {
  public:
+  // Starts the queue's thread, with the calling thread's priority, lowered
+  // for a background queue.
   explicit SerialQueue(std::string label, QueuePriority priority = QueuePriority::kDefault);
   ~SerialQueue();
   SerialQueue(const SerialQueue&) = delete;
@@ -86,7 +89,6 @@ class SerialQueue {
     std::deque<std::pair<uint64_t, std::function<void()>>> pending;  // guarded by mu
     bool stopping = false;                                           // guarded by mu
     std::thread worker;                                              // guarded by mu
-    QueuePriority priority = QueuePriority::kDefault;                // set once
   };
   static void runWorker(std::shared_ptr<State> state);
   // Gives the turn to the next ticket and wakes its holder. REQUIRES: mu held.

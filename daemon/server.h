@@ -151,8 +151,8 @@ class DRDServer : public DRDatabase, public DRDatabaseDelegate {
 
   ServerOptions options_;
   std::atomic<uint32_t> verbose_{0};
-  // New connections are taken in the background: under a flood of them the
-  // clients' requests on the service queue go first.
+  // New clients are set up in the background: under a flood of connections
+  // the requests of the clients already there go first.
   SerialQueue ipcQueue_{"ipc", QueuePriority::kBackground};
   SerialQueue mainQueue_{"service"};
   SerialQueue syncQueue_{"serverSync"};

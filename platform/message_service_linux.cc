@@ -70,6 +70,9 @@ class ReaderThreads {
       }
     }
     std::thread([this, job = std::move(job)]() mutable {
+      // Reading connections gives way to running the requests read: a peer
+      // flooding drd with connections or frames waits, not the clients.
+      EnterBackgroundPriority();
       job();
       job = nullptr;  // release what the job holds before waiting
       serveMore();

@@ -5,6 +5,7 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <thread>
 #include <vector>
@@ -101,28 +102,37 @@ TEST(SerialQueueTest, SyncRunsOnTheCallersThreadAndKnowsItsQueue) {
   EXPECT_EQ(a.syncResult([] { return 42; }), 42);
 }
 
-// A background queue's own thread runs at a lower priority than the thread
-// that made it, and so does work it runs; a default queue's does not, and a
-// sync() entry runs at its caller's priority.
-TEST(SerialQueueTest, BackgroundQueuesRunTheirWorkAtLowerPriority) {
+// A thread that enters background priority runs lower than the others; a
+// queue keeps the priority of the thread that made it, also when work first
+// reaches it from a background thread (threads start as low as their maker),
+// and a background queue's thread runs lower.
+TEST(SerialQueueTest, BackgroundThreadsLowerOnlyThemselves) {
   auto niceHere = [] { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); };
   const int caller = niceHere();
   if (caller >= 19) GTEST_SKIP() << "already at the lowest priority";
-  struct Row {
-    QueuePriority priority;
-    bool lower;
-  };
-  for (const Row row :
-       {Row{QueuePriority::kDefault, false}, Row{QueuePriority::kBackground, true}}) {
-    SerialQueue q("priority", row.priority);
-    std::atomic<int> onWorker{-100};
-    q.async([&] { onWorker = niceHere(); });
-    int inSync = -100;
-    q.sync([&] { inSync = niceHere(); });
-    EXPECT_EQ(onWorker.load() > caller, row.lower) << onWorker << " vs " << caller;
-    EXPECT_EQ(inSync, caller);
-  }
-  EXPECT_EQ(niceHere(), caller) << "the caller's own priority is left alone";
+  SerialQueue q("made by a default thread");
+  int background = -100, onQueue = -100;
+  std::thread([&] {
+    EnterBackgroundPriority();
+    EnterBackgroundPriority();  // once is enough: not lowered twice
+    background = niceHere();
+    std::atomic<bool> ran{false};
+    q.async([&] {
+      onQueue = niceHere();
+      ran = true;
+    });
+    while (!ran) std::this_thread::yield();
+  }).join();
+  EXPECT_EQ(background, std::min(caller + 10, 19));
+  EXPECT_EQ(onQueue, caller);
+  EXPECT_EQ(niceHere(), caller);
+
+  SerialQueue low("background", QueuePriority::kBackground);
+  int onLow = -100, inSync = -100;
+  low.async([&] { onLow = niceHere(); });
+  low.sync([&] { inSync = niceHere(); });
+  EXPECT_EQ(onLow, std::min(caller + 10, 19));
+  EXPECT_EQ(inSync, caller) << "sync() runs on its caller's thread";
 }
 
 TEST(SerialQueueTest, DestructionRunsQueuedWork) {
