@@ -37,8 +37,6 @@ const char* DiscoveryOutcomeName(DiscoveryOutcome outcome) {
       return "excluded by the user";
     case DiscoveryOutcome::kNotAuthorized:
       return "not authorized for the host";
-    case DiscoveryOutcome::kNoForm:
-      return "its description could not be made";
     case DiscoveryOutcome::kSuperseded:
       return "superseded by another copy";
     case DiscoveryOutcome::kVetoed:
@@ -155,7 +153,7 @@ void Discovery::examine(const DRDPlugInPtr& candidate) {
   if (services_.addAnnotation) {
     services_.addAnnotation(p, entries);
   } else {
-    entries[kAnnotationsFormKey] = Value::EmptyDictionary();
+    entries[kAnnotationsFormKey] = DRPlugInCore::NoAnnotations();
   }
   p.augmentForm(entries);
   const Value form(std::move(entries));

@@ -56,7 +56,6 @@ enum class DiscoveryOutcome {
   kRulesMismatch,       // does not satisfy the host's rules
   kExcluded,            // matches one of the user's exclusions
   kNotAuthorized,       // the host may not use it (detail: the reason)
-  kNoForm,              // its form could not be made (detail: the error)
   kSuperseded,          // another copy of the same identifier won
   kVetoed,              // the administrator's policy denies it to the host
 };

@@ -412,11 +412,9 @@ void Transaction::annotatePlugIns() {
 }
 
 void Transaction::addAnnotationForPlugInIn(const DRDPlugIn& plugIn, Dictionary& form) {
-  // Most plug-ins have no annotations: they share one empty dictionary
-  // rather than a new node per form.
-  static const Value kNoAnnotations = Value::EmptyDictionary();
   Value annotation = server().annotationForPlugIn(plugIn);
-  form[kAnnotationsKey] = annotation.isDictionary() ? std::move(annotation) : kNoAnnotations;
+  form[kAnnotationsKey] =
+      annotation.isDictionary() ? std::move(annotation) : DRPlugInCore::NoAnnotations();
 }
 
 // ---- Holds --------------------------------------------------------------

@@ -34,6 +34,11 @@ Value DictionaryOf(const Value& v) { return v.isDictionary() ? v : Value(); }
 
 }  // namespace
 
+const Value& DRPlugInCore::NoAnnotations() {
+  static const Value empty = Value::EmptyDictionary();
+  return empty;
+}
+
 Value DRPlugInCore::exportForm(std::optional<Error>* /*error*/) const {
   return Value(formEntries());
 }
@@ -43,15 +48,12 @@ Value DRPlugInCore::exportForm(std::optional<Error>* /*error*/) const {
 // consistent picture of the record. The keys go in ascending order, each at
 // the end of the map.
 Dictionary DRPlugInCore::formEntries() const {
-  // Absent annotations read as this one shared empty dictionary, not a new
-  // node per form.
-  static const Value kNoAnnotations = Value::EmptyDictionary();
   Dictionary form;
   auto add = [&form](const char* key, Value value) {
     if (value.isPresent()) form.emplace_hint(form.end(), key, std::move(value));
   };
   std::lock_guard<std::mutex> lock(mu_);
-  add(kFormAnnotationsKey, annotations_.isDictionary() ? annotations_ : kNoAnnotations);
+  add(kFormAnnotationsKey, annotations_.isDictionary() ? annotations_ : NoAnnotations());
   // Copied only when there is something to leave out.
   add(kFormBundleInfoKey, bundleInfoDictionary_.has(kBNBundleInfoPdocURLKey)
                               ? bundleInfoDictionary_.changing(kBNBundleInfoPdocURLKey, Value())

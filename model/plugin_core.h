@@ -226,6 +226,9 @@ class DRPlugInCore {
   // The same form as a mutable dictionary, for a caller that adds entries
   // before wrapping it (no absent values in it).
   Dictionary formEntries() const;
+  // What a form's "annotations" holds for a plug-in without any: one shared
+  // empty dictionary rather than a new node per form.
+  static const Value& NoAnnotations();
   // annotations := form["annotations"]; absent (or not a dictionary) clears.
   void updateFromForm(const Value& form);
 
