@@ -2,6 +2,7 @@
 
 #include <sys/random.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <cmath>
@@ -148,10 +149,70 @@ std::string Uuid::string() const {
   return s;
 }
 
+size_t Dictionary::lowerIndex(std::string_view key) const {
+  size_t lo = 0, hi = entries_.size();
+  while (lo < hi) {
+    size_t mid = lo + (hi - lo) / 2;
+    if (entries_[mid].first.view() < key) {
+      lo = mid + 1;
+    } else {
+      hi = mid;
+    }
+  }
+  return lo;
+}
+
+size_t Dictionary::findIndex(std::string_view key) const {
+  size_t i = lowerIndex(key);
+  return i < entries_.size() && entries_[i].first == key ? i : entries_.size();
+}
+
+bool DictionaryBuilder::contains(std::string_view key) const {
+  if (!ascending_) return seen_.contains(key);
+  // Keys so far ascend: the last is the usual one to compare with.
+  if (entries_.empty() || entries_.back().first < key) return false;
+  auto it = std::lower_bound(entries_.begin(), entries_.end(), key,
+                             [](const auto& entry, std::string_view k) { return entry.first < k; });
+  return it != entries_.end() && it->first == key;
+}
+
+bool DictionaryBuilder::add(Key key, Value value) {
+  if (ascending_ && !entries_.empty() && !(entries_.back().first < key)) {
+    if (contains(key)) return false;
+    // From here on the keys are out of order: keep a set of them.
+    ascending_ = false;
+    seen_.reserve(entries_.size() * 2);
+    for (const auto& entry : entries_) seen_.insert(entry.first.view());
+  }
+  // The set holds views of the keys' texts, which stay put when a key is
+  // moved (into the entries, or as they grow or are sorted).
+  if (!ascending_ && !seen_.insert(key.view()).second) return false;
+  entries_.emplace_back(std::move(key), std::move(value));
+  return true;
+}
+
+Dictionary DictionaryBuilder::finish() {
+  if (!ascending_) {
+    std::sort(entries_.begin(), entries_.end(),
+              [](const auto& a, const auto& b) { return a.first < b.first; });
+  }
+  Dictionary d;
+  d.entries_ = std::move(entries_);
+  entries_.clear();
+  ascending_ = true;
+  seen_.clear();
+  return d;
+}
+
 Value::Value(Array a) : v_(std::make_shared<const Array>(std::move(a))) {}
 
+Value::Value(std::initializer_list<std::pair<Key, Value>> entries) : Value(Dictionary(entries)) {}
+
+Value Value::EmptyDictionary() { return Value(Dictionary{}); }
+
 Value::Value(Dictionary d) {
-  std::erase_if(d, [](const auto& entry) { return entry.second.isAbsent(); });
+  erase_if(d, [](const auto& entry) { return entry.second.isAbsent(); });
+  d.shrink_to_fit();
   v_ = std::make_shared<const Dictionary>(std::move(d));
 }
 
@@ -302,7 +363,7 @@ Value Value::changing(std::string_view key, const Value& value) const {
     auto it = copy.find(key);
     if (it != copy.end()) copy.erase(it);
   } else {
-    copy.insert_or_assign(std::string(key), value);
+    copy.insert_or_assign(Key(key), value);
   }
   return Value(std::move(copy));
 }

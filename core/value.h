@@ -24,13 +24,15 @@
 #include <concepts>
 #include <cstdint>
 #include <functional>
-#include <map>
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_set>
 #include <variant>
 #include <vector>
+
+#include "core/key.h"
 
 namespace dr {
 
@@ -60,9 +62,7 @@ struct Uuid {
 
 using Data = std::vector<uint8_t>;
 using Array = std::vector<Value>;
-// std::less<> compares std::string bytewise as unsigned char, which is the
-// ascending byte order drd enumerates in; it also allows string_view lookups.
-using Dictionary = std::map<std::string, Value, std::less<>>;
+class Dictionary;
 
 class Value {
  public:
@@ -101,11 +101,12 @@ class Value {
   Value(Array a);
   // Absent entries of `d` are dropped.
   Value(Dictionary d);
-  Value(std::initializer_list<std::pair<const std::string, Value>> entries)
-      : Value(Dictionary(entries)) {}
+  // A dictionary of `entries`; of two entries with the same key the first
+  // is kept.
+  Value(std::initializer_list<std::pair<Key, Value>> entries);
 
   // An empty dictionary and an empty array (each a new node).
-  static Value EmptyDictionary() { return Value(Dictionary{}); }
+  static Value EmptyDictionary();
   static Value EmptyArray() { return Value(Array{}); }
 
   Type type() const { return static_cast<Type>(v_.index()); }
@@ -182,5 +183,155 @@ class Value {
 
 // An absent value with static storage, for returning references.
 const Value& AbsentValue();
+
+// A dictionary's entries, in ascending byte order of their keys, held in one
+// block rather than a node each: dictionaries are read far more often than
+// changed, most hold a handful of keys, and there are hundreds of thousands
+// of them in a large registry. The interface is the part of std::map's that
+// drd uses, with its meaning (an insert never replaces an existing entry,
+// insert_or_assign does; keys compare as unsigned bytes), except that any
+// insert or erase moves the entries after it, so iterators and references
+// into a dictionary are good only until it next changes.
+class Dictionary {
+ public:
+  using key_type = Key;
+  using mapped_type = Value;
+  using value_type = std::pair<Key, Value>;
+  using size_type = size_t;
+  using iterator = std::vector<value_type>::iterator;
+  using const_iterator = std::vector<value_type>::const_iterator;
+  using reverse_iterator = std::vector<value_type>::reverse_iterator;
+  using const_reverse_iterator = std::vector<value_type>::const_reverse_iterator;
+
+  Dictionary() = default;
+  // Of two entries with the same key, the first is kept.
+  Dictionary(std::initializer_list<value_type> entries)
+      : Dictionary(entries.begin(), entries.end()) {}
+  template <typename It>
+  Dictionary(It first, It last);
+
+  iterator begin() { return entries_.begin(); }
+  iterator end() { return entries_.end(); }
+  const_iterator begin() const { return entries_.begin(); }
+  const_iterator end() const { return entries_.end(); }
+  const_iterator cbegin() const { return entries_.begin(); }
+  const_iterator cend() const { return entries_.end(); }
+  reverse_iterator rbegin() { return entries_.rbegin(); }
+  reverse_iterator rend() { return entries_.rend(); }
+  const_reverse_iterator rbegin() const { return entries_.rbegin(); }
+  const_reverse_iterator rend() const { return entries_.rend(); }
+
+  size_t size() const { return entries_.size(); }
+  bool empty() const { return entries_.empty(); }
+  void clear() { entries_.clear(); }
+  // Room for `n` entries without moving the block again.
+  void reserve(size_t n) { entries_.reserve(n); }
+  // Gives back the room beyond the entries when that is more than a quarter
+  // of them (a dictionary is made once and then kept).
+  void shrink_to_fit() {
+    if (entries_.capacity() - entries_.size() > entries_.size() / 4) entries_.shrink_to_fit();
+  }
+
+  // The first entry whose key is not below `key`.
+  iterator lower_bound(std::string_view key) { return begin() + lowerIndex(key); }
+  const_iterator lower_bound(std::string_view key) const { return begin() + lowerIndex(key); }
+  iterator find(std::string_view key) { return begin() + findIndex(key); }
+  const_iterator find(std::string_view key) const { return begin() + findIndex(key); }
+  bool contains(std::string_view key) const { return findIndex(key) != size(); }
+  size_t count(std::string_view key) const { return contains(key) ? 1 : 0; }
+
+  // The value under `key`, inserted absent when there is none.
+  Value& operator[](std::string_view key) { return try_emplace(Key(key)).first->second; }
+
+  // Inserts `key` with a value made of `args` unless `key` is present; the
+  // entry under `key`, and whether it is new.
+  template <typename... Args>
+  std::pair<iterator, bool> try_emplace(Key key, Args&&... args) {
+    size_t i = lowerIndex(key);
+    if (i < size() && entries_[i].first == key) return {begin() + i, false};
+    return {entries_.emplace(begin() + i, std::piecewise_construct,
+                             std::forward_as_tuple(std::move(key)),
+                             std::forward_as_tuple(std::forward<Args>(args)...)),
+            true};
+  }
+  template <typename V>
+  std::pair<iterator, bool> emplace(Key key, V&& value) {
+    return try_emplace(std::move(key), std::forward<V>(value));
+  }
+  std::pair<iterator, bool> insert(value_type entry) {
+    return try_emplace(std::move(entry.first), std::move(entry.second));
+  }
+  template <typename V>
+  std::pair<iterator, bool> insert_or_assign(Key key, V&& value) {
+    auto [it, inserted] = try_emplace(std::move(key), std::forward<V>(value));
+    if (!inserted) it->second = std::forward<V>(value);
+    return {it, inserted};
+  }
+  // As emplace; cheap when the key belongs just before `hint`, as when
+  // entries come in ascending order with `hint` at the end.
+  template <typename V>
+  iterator emplace_hint(const_iterator hint, Key key, V&& value) {
+    const size_t h = static_cast<size_t>(hint - cbegin());
+    if ((h == size() || key < entries_[h].first) && (h == 0 || entries_[h - 1].first < key)) {
+      return entries_.emplace(begin() + h, std::move(key), std::forward<V>(value));
+    }
+    return try_emplace(std::move(key), std::forward<V>(value)).first;
+  }
+
+  iterator erase(const_iterator it) { return entries_.erase(it); }
+  iterator erase(const_iterator first, const_iterator last) { return entries_.erase(first, last); }
+  size_t erase(std::string_view key) {
+    size_t i = findIndex(key);
+    if (i == size()) return 0;
+    entries_.erase(begin() + i);
+    return 1;
+  }
+  template <typename Pred>
+  friend size_t erase_if(Dictionary& d, Pred pred) {
+    return std::erase_if(d.entries_, pred);
+  }
+
+  bool operator==(const Dictionary& other) const { return entries_ == other.entries_; }
+
+ private:
+  friend class DictionaryBuilder;
+
+  size_t lowerIndex(std::string_view key) const;
+  size_t findIndex(std::string_view key) const;
+
+  std::vector<value_type> entries_;
+};
+
+// Makes a dictionary of entries that come in any order, as a parser or a
+// decoder meets them, in O(n log n) for any input: entries that come in
+// ascending order (the usual case, and the only one of drd's own writers)
+// are added at the end; from the first that is out of order on, a set of the
+// keys seen finds duplicates, and the entries are sorted once at the end.
+// Inserting each entry at its place instead would cost O(n^2) moves for a
+// large dictionary in descending order.
+class DictionaryBuilder {
+ public:
+  // Whether an entry with `key` was added.
+  bool contains(std::string_view key) const;
+  // Adds the entry unless one with `key` was added; false when one was (and
+  // this one is dropped).
+  bool add(Key key, Value value);
+  size_t size() const { return entries_.size(); }
+  void reserve(size_t n) { entries_.reserve(n); }
+  // The dictionary of the entries added; the builder is left empty.
+  Dictionary finish();
+
+ private:
+  std::vector<Dictionary::value_type> entries_;
+  bool ascending_ = true;
+  std::unordered_set<std::string_view> seen_;  // once not ascending: every key
+};
+
+template <typename It>
+Dictionary::Dictionary(It first, It last) {
+  DictionaryBuilder builder;
+  for (; first != last; ++first) builder.add(first->first, first->second);
+  *this = builder.finish();
+}
 
 }  // namespace dr

@@ -97,7 +97,7 @@ Result<std::vector<ScannedPlugIn>> PlugInsOf(const std::string& url, const Value
         return Refused(url,
                        Format("plug-in \"%@\" of \"Multiple\" is not a dictionary", identifier));
       }
-      out.push_back({identifier, true});
+      out.push_back({identifier.str(), true});
     }
     return out;
   }

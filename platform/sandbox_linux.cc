@@ -48,7 +48,7 @@ constexpr size_t kMacBytes = crypto_auth_hmacsha256_BYTES;
 constexpr size_t kMaxTokenLength = 2 * PATH_MAX + kMaxClassLength + 2 * kMacBytes + 16;
 constexpr const char* kKeyFileName = "sandbox.key";
 
-using Key = std::array<uint8_t, kKeyBytes>;
+using MacKey = std::array<uint8_t, kKeyBytes>;
 
 static_assert(kKeyBytes == 32 && kMacBytes == 32);
 
@@ -112,13 +112,13 @@ std::array<uint8_t, kMacBytes> Mac(const crypto_auth_hmacsha256_state& keyed, st
   return mac;
 }
 
-crypto_auth_hmacsha256_state Keyed(const Key& key) {
+crypto_auth_hmacsha256_state Keyed(const MacKey& key) {
   crypto_auth_hmacsha256_state state;
   crypto_auth_hmacsha256_init(&state, key.data(), key.size());
   return state;
 }
 
-std::array<uint8_t, kMacBytes> Mac(const Key& key, std::string_view cls, std::string_view path) {
+std::array<uint8_t, kMacBytes> Mac(const MacKey& key, std::string_view cls, std::string_view path) {
   crypto_auth_hmacsha256_state keyed = Keyed(key);
   std::array<uint8_t, kMacBytes> mac = Mac(keyed, cls, path);
   sodium_memzero(&keyed, sizeof keyed);
@@ -132,7 +132,7 @@ std::string ParentOf(const std::string& path) {
 }
 
 // Reads and checks the key file.
-Result<Key> ReadKey(const std::string& path) {
+Result<MacKey> ReadKey(const std::string& path) {
   int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
   if (fd < 0) return PosixError(errno, "open " + path);
   struct stat st;
@@ -145,7 +145,7 @@ Result<Key> ReadKey(const std::string& path) {
     ::close(fd);
     return PosixError(EPERM, "unsafe key file " + path);
   }
-  Key key;
+  MacKey key;
   ssize_t n;
   do {
     n = ::pread(fd, key.data(), key.size(), 0);
@@ -179,15 +179,15 @@ Status MakeKeyFolder(const std::string& dir) {
   return Status::OK();
 }
 
-Result<Key> MakeKey(const std::string& path) {
-  Result<Key> existing = ReadKey(path);
+Result<MacKey> MakeKey(const std::string& path) {
+  Result<MacKey> existing = ReadKey(path);
   if (existing.ok() || existing.error().code() != ENOENT) return existing;
   if (Status s = MakeKeyFolder(ParentOf(path)); !s.ok()) return s;
 
   std::string tmp = path + ".XXXXXX";
   int fd = ::mkostemp(tmp.data(), O_CLOEXEC);
   if (fd < 0) return PosixError(errno, "create " + tmp);
-  Key key;
+  MacKey key;
   randombytes_buf(key.data(), key.size());
   ssize_t n = ::fchmod(fd, 0600) == 0 ? ::write(fd, key.data(), key.size()) : -1;
   bool written = n == static_cast<ssize_t>(key.size()) && ::fsync(fd) == 0;
@@ -265,7 +265,7 @@ class LinuxSandbox final : public Sandbox {
     std::lock_guard<std::mutex> lock(mu_);
     if (!keyed_) {
       InitSodium();
-      Result<Key> key = MakeKey(options_.keyPath);
+      Result<MacKey> key = MakeKey(options_.keyPath);
       if (!key.ok()) return key.error();  // not kept: the next call tries again
       keyed_ = Keyed(*key);
     }
@@ -316,7 +316,7 @@ Result<std::string> consumeExtension(std::string_view token, const SandboxOption
   if (!mac || mac->size() != kMacBytes) return Refused(kExtensionMalformed, "bad signature");
 
   InitSodium();
-  Result<Key> key = ReadKey(options.keyPath);
+  Result<MacKey> key = ReadKey(options.keyPath);
   if (!key.ok()) return key.error();
   std::array<uint8_t, kMacBytes> expected = Mac(*key, cls, *path);
   if (sodium_memcmp(expected.data(), mac->data(), kMacBytes) != 0) {

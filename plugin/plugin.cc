@@ -44,7 +44,7 @@ std::vector<std::string> ResourceNames(const Value& resources) {
     for (const Value& element : resources.array())
       if (auto e = element.string()) names.emplace_back(*e);
   } else if (resources.isDictionary()) {
-    for (const auto& [key, unused] : resources.dictionary()) names.push_back(key);
+    for (const auto& [key, unused] : resources.dictionary()) names.emplace_back(key);
   }
   return names;
 }

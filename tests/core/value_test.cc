@@ -4,6 +4,8 @@
 
 #include <cmath>
 #include <limits>
+#include <map>
+#include <random>
 
 namespace dr {
 namespace {
@@ -89,9 +91,101 @@ TEST(ValueTest, DictionariesEnumerateKeysInAscendingByteOrder) {
   for (const char* k : {"b", "a", "\xc3\xa9", "B", "", "aa"}) d[k] = 1;
   const Value dict(d);
   std::vector<std::string> keys;
-  for (const auto& [k, v] : dict.dictionary()) keys.push_back(k);
+  for (const auto& [k, v] : dict.dictionary()) keys.emplace_back(k);
   // Bytes above 0x7F sort after ASCII: compared as unsigned.
   EXPECT_EQ(keys, (std::vector<std::string>{"", "B", "a", "aa", "b", "\xc3\xa9"}));
+}
+
+TEST(ValueTest, DictionaryChangesAsAnOrderedMapWould) {
+  // Random inserts, assignments, hinted inserts and erases against std::map
+  // as the model: same entries, same order, same answers.
+  std::map<std::string, int> model;
+  Dictionary d;
+  std::mt19937 random(7);
+  auto key = [&] { return "k" + std::to_string(random() % 40); };
+  for (int step = 0; step < 4000; ++step) {
+    const std::string k = key();
+    const int v = static_cast<int>(random() % 1000);
+    switch (random() % 7) {
+      case 0: {
+        auto [it, inserted] = d.emplace(k, v);
+        EXPECT_EQ(inserted, model.emplace(k, v).second);
+        EXPECT_EQ(it->first, k);
+        break;
+      }
+      case 1:
+        EXPECT_EQ(d.insert_or_assign(k, v).second, model.insert_or_assign(k, v).second);
+        break;
+      case 2:
+        d[k] = v;
+        model[k] = v;
+        break;
+      case 3: {
+        // A hint anywhere: right or wrong, the entry lands in order.
+        auto hint = d.begin() + static_cast<ptrdiff_t>(random() % (d.size() + 1));
+        EXPECT_EQ(d.emplace_hint(hint, k, v)->first, k);
+        model.emplace(k, v);
+        break;
+      }
+      case 4:
+        EXPECT_EQ(d.erase(k), model.erase(k));
+        break;
+      case 5:
+        if (!d.empty()) {
+          auto it = d.begin() + static_cast<ptrdiff_t>(random() % d.size());
+          model.erase(it->first.str());
+          d.erase(it);
+        }
+        break;
+      case 6:
+        EXPECT_EQ(d.contains(k), model.count(k) == 1);
+        EXPECT_EQ(d.find(k) == d.end(), !model.contains(k));
+        break;
+    }
+    ASSERT_EQ(d.size(), model.size()) << step;
+    auto m = model.begin();
+    for (const auto& [dk, dv] : d) {
+      ASSERT_EQ(dk, m->first) << step;
+      ASSERT_EQ(dv.intValue(), m->second) << step;
+      ++m;
+    }
+  }
+  // Of two entries with the same key, the first is kept, as std::map does.
+  const Dictionary made{{"b", 1}, {"a", 2}, {"b", 3}};
+  EXPECT_EQ(Value(made), (Value{{"a", 2}, {"b", 1}}));
+}
+
+TEST(ValueTest, DictionaryBuilderTakesKeysInAnyOrderButEachOnce) {
+  const struct {
+    std::vector<std::string> keys;
+    std::vector<bool> added;
+  } rows[] = {
+      {{"a", "b", "c"}, {true, true, true}},
+      {{"c", "b", "a"}, {true, true, true}},
+      {{"a", "a"}, {true, false}},
+      {{"b", "c", "a", "b"}, {true, true, true, false}},  // duplicate after disorder
+      {{"b", "a", "c", "a", "c"}, {true, true, true, false, false}},
+      {{"", "\xc3\xa9", "B", ""}, {true, true, true, false}},
+  };
+  for (const auto& row : rows) {
+    DictionaryBuilder builder;
+    std::map<std::string, int> model;  // the first value of each key
+    for (size_t i = 0; i < row.keys.size(); ++i) {
+      EXPECT_EQ(builder.contains(row.keys[i]), model.contains(row.keys[i]));
+      EXPECT_EQ(builder.add(row.keys[i], static_cast<int>(i)), row.added[i]) << i;
+      model.emplace(row.keys[i], static_cast<int>(i));
+      EXPECT_TRUE(builder.contains(row.keys[i]));
+    }
+    const Dictionary d = builder.finish();
+    ASSERT_EQ(d.size(), model.size());
+    auto m = model.begin();
+    for (const auto& [k, v] : d) {
+      EXPECT_EQ(k, m->first);
+      EXPECT_EQ(v.intValue(), m->second);
+      ++m;
+    }
+    EXPECT_EQ(builder.size(), 0u);
+  }
 }
 
 TEST(ValueTest, CopiesShareNodesAndChangesMakeNewOnes) {

@@ -186,8 +186,8 @@ TEST_F(PlugInTest, FormGetsOneTokenPerDeclaredResource) {
     EXPECT_EQ(form.size(), row.names ? 2u : 1u);
     Names keys;
     for (const auto& [name, token] : form["extensions"].dictionary()) {
-      const std::string relative = row.granted.empty() ? name : row.granted[keys.size()];
-      keys.push_back(name);
+      const std::string relative = row.granted.empty() ? name.str() : row.granted[keys.size()];
+      keys.push_back(name.str());
       Result<std::string> granted = consumeExtension(token.stringValue(), options);
       EXPECT_EQ(granted.value_or(""), relative == "." ? bundle : bundle + "/" + relative);
     }
