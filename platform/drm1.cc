@@ -45,6 +45,23 @@ void Store(std::string& out, T v) {
   out.append(buf, sizeof v);
 }
 
+// Whether `s` is ASCII without NUL, the usual text of a message, in one pass
+// eight bytes at a time. False sends `s` to the full checks, which tell why.
+bool IsPlainAscii(std::string_view s) {
+  constexpr uint64_t kOnes = 0x0101010101010101ull, kHighs = 0x8080808080808080ull;
+  size_t i = 0;
+  for (uint64_t word; i + 8 <= s.size(); i += 8) {
+    std::memcpy(&word, s.data() + i, 8);
+    // No byte at or above 0x80, and (for such bytes exactly) none that is 0.
+    if ((word & kHighs) != 0 || ((word - kOnes) & kHighs) != 0) return false;
+  }
+  for (; i < s.size(); ++i) {
+    const auto c = static_cast<unsigned char>(s[i]);
+    if (c == 0 || c >= 0x80) return false;
+  }
+  return true;
+}
+
 // Reads one value from `in` at `pos`. Every length and count is checked
 // against the bytes left before anything is reserved or copied.
 class BodyReader {
@@ -80,7 +97,8 @@ class BodyReader {
     return Load<uint32_t>(p);
   }
 
-  Result<std::string> text(const char* what) {
+  // The text at the read position, a view into the body.
+  Result<std::string_view> text(const char* what) {
     std::optional<uint32_t> n = u32();
     if (!n) return ProtocolError(std::string("truncated ") + what + " length");
     const char* p;
@@ -89,11 +107,12 @@ class BodyReader {
                            " bytes exceeds the body");
     }
     std::string_view s(p, *n);
+    if (IsPlainAscii(s)) return s;
     if (s.find('\0') != std::string_view::npos) {
       return ProtocolError(std::string(what) + " holds NUL");
     }
     if (!IsUtf8(s)) return ProtocolError(std::string(what) + " is not UTF-8");
-    return std::string(s);
+    return s;
   }
 
   Result<Value> read(int depth) {
@@ -117,9 +136,9 @@ class BodyReader {
         if (tag == kTagDouble) return Value(Load<double>(p));
         return Value(Date{Load<double>(p)});
       case kTagString: {
-        Result<std::string> s = text("string");
+        Result<std::string_view> s = text("string");
         if (!s) return s.error();
-        return Value(std::move(*s));
+        return Value(*s);
       }
       case kTagData: {
         std::optional<uint32_t> n = u32();
@@ -148,9 +167,13 @@ class BodyReader {
         if (*n > left() / least) {
           return ProtocolError("count of " + std::to_string(*n) + " exceeds the body");
         }
+        // Room for the elements is made as they come beyond the first few
+        // thousand, so that a count the body could hold but does not fill
+        // costs no more than the body.
+        const size_t room = std::min<size_t>(*n, 4096);
         if (tag == kTagArray) {
           Array a;
-          a.reserve(*n);
+          a.reserve(room);
           for (uint32_t i = 0; i < *n; ++i) {
             Result<Value> v = read(depth + 1);
             if (!v) return v;
@@ -158,21 +181,16 @@ class BodyReader {
           }
           return Value(std::move(a));
         }
-        Dictionary d;
+        DictionaryBuilder d;
+        d.reserve(room);
         for (uint32_t i = 0; i < *n; ++i) {
-          Result<std::string> key = text("key");
+          Result<std::string_view> key = text("key");
           if (!key) return key.error();
           Result<Value> v = read(depth + 1);
           if (!v) return v;
-          // Encoders write keys in ascending order (a map's), so the usual
-          // key goes at the end without a search.
-          if (d.empty() || d.rbegin()->first < *key) {
-            d.emplace_hint(d.end(), std::move(*key), std::move(*v));
-          } else if (!d.try_emplace(std::move(*key), std::move(*v)).second) {
-            return ProtocolError("duplicate key");
-          }
+          if (!d.add(Key(*key), std::move(*v))) return ProtocolError("duplicate key");
         }
-        return Value(std::move(d));
+        return Value(d.finish());
       }
       default:
         return ProtocolError("unknown tag " + std::to_string(tag));
@@ -190,23 +208,6 @@ Status CheckText(std::string_view s, const char* what) {
   if (s.find('\0') != std::string_view::npos) return Unencodable(std::string(what) + " holds NUL");
   if (!IsUtf8(s)) return Unencodable(std::string(what) + " is not UTF-8");
   return Status::OK();
-}
-
-// Whether `s` is ASCII without NUL, the usual text of a reply, in one pass
-// eight bytes at a time. False sends `s` to CheckText, which tells why.
-bool IsPlainAscii(std::string_view s) {
-  constexpr uint64_t kOnes = 0x0101010101010101ull, kHighs = 0x8080808080808080ull;
-  size_t i = 0;
-  for (uint64_t word; i + 8 <= s.size(); i += 8) {
-    std::memcpy(&word, s.data() + i, 8);
-    // No byte at or above 0x80, and (for such bytes exactly) none that is 0.
-    if ((word & kHighs) != 0 || ((word - kOnes) & kHighs) != 0) return false;
-  }
-  for (; i < s.size(); ++i) {
-    const auto c = static_cast<unsigned char>(s[i]);
-    if (c == 0 || c >= 0x80) return false;
-  }
-  return true;
 }
 
 // The bytes ValueWriter writes for `v`, so that a large reply is built in one

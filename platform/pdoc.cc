@@ -222,7 +222,7 @@ struct Frame {
   std::string name{};
   std::string text{};                // keys and scalars
   Array array{};                     // kArray
-  Dictionary dict{};                 // kDict
+  DictionaryBuilder dict{};          // kDict
   std::optional<std::string> key{};  // kDict: a key waiting for its value
   Value value{};                     // kRoot: the document's value
 };
@@ -405,7 +405,7 @@ class XmlReader {
       }
       case Kind::kDict:
         if (frame.key) return Fail("key \"" + Quote(*frame.key) + "\" has no value");
-        value = Value(std::move(frame.dict));
+        value = Value(frame.dict.finish());
         break;
       case Kind::kArray:
         value = Value(std::move(frame.array));
@@ -471,7 +471,7 @@ class XmlReader {
         parent.value = std::move(value);
         break;
       case Kind::kDict:
-        parent.dict.emplace(std::move(*parent.key), std::move(value));
+        parent.dict.add(Key(*parent.key), std::move(value));
         parent.key.reset();
         break;
       case Kind::kArray:
@@ -564,7 +564,7 @@ class JsonReader : public nlohmann::json_sax<json> {
   bool Close() {
     Frame frame = std::move(stack_.back());
     stack_.pop_back();
-    if (frame.kind == Kind::kDict) return Deliver(Value(std::move(frame.dict)));
+    if (frame.kind == Kind::kDict) return Deliver(Value(frame.dict.finish()));
     return Deliver(Value(std::move(frame.array)));
   }
 
@@ -577,7 +577,7 @@ class JsonReader : public nlohmann::json_sax<json> {
     if (top.kind == Kind::kArray) {
       top.array.push_back(std::move(value));
     } else {
-      top.dict.emplace(std::move(*top.key), std::move(value));
+      top.dict.add(Key(*top.key), std::move(value));
       top.key.reset();
     }
     return true;

@@ -129,6 +129,10 @@ TEST(Drm1Test, RefusesFramesThatBreakTheRules) {
        "key holds NUL"},
       {Frame(Tag(kTagDictionary) + U32(2) + Str("k") + Tag(kTagTrue) + Str("k") + Tag(kTagFalse)),
        "duplicate key"},
+      // Keys out of order are allowed, but not twice.
+      {Frame(Tag(kTagDictionary) + U32(3) + Str("k") + Tag(kTagTrue) + Str("b") + Tag(kTagTrue) +
+             Str("k") + Tag(kTagFalse)),
+       "duplicate key"},
       {Frame(OneEntry(Nested(kMaxDepth + 1))), "deeper than 64"},
   };
   for (const auto& row : rows) {

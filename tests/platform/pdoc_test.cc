@@ -177,6 +177,7 @@ TEST(PdocTest, RefusesMalformedAndHostileInput) {
       {Nested("{\"a\":", "}", 100000), "nesting deeper"},
       {Nested("[", "]", kMaxDepth + 1), "nesting deeper"},
       {"{\"a\": 1, \"a\": 2}", "duplicate key \"a\""},
+      {"{\"c\": 1, \"a\": 2, \"c\": 3}", "duplicate key \"c\""},
       {"{\"a\": null}", "null is not allowed"},
       {"[1] x", ""},
       {"{\"a\": 1", ""},
