@@ -115,11 +115,10 @@ class LinuxServiceManager final : public ServiceManager {
   explicit LinuxServiceManager(const ServiceManagerOptions& options)
       : registry_(options.registry),
         processInfo_(options.processInfo ? options.processInfo : ProcessInfo::Default()),
-        bundleReader_(options.bundleReader ? options.bundleReader : BundleReader::Default()) {
-    BundleRecords registered = registeredBundles();
-    std::lock_guard lock(mu_);
-    remember(registered);
-  }
+        bundleReader_(options.bundleReader ? options.bundleReader : BundleReader::Default()),
+        // What is registered now is learnt when first needed: the entries are
+        // kept, not yet turned into records, as drd starts faster without.
+        startupEntries_(registry_ ? registry_->allEntries() : std::vector<RegistryEntryPtr>{}) {}
 
   Result<Value> sdkDictionary(const std::string& identifier) override {
     // An identifier names one file inside a folder, never a path elsewhere.
@@ -170,9 +169,8 @@ class LinuxServiceManager final : public ServiceManager {
              (::kill(g.hostPid, 0) != 0 && errno == ESRCH);
     });
     if (grant.bundlePath) {
-      auto& versions = known_[*grant.bundlePath];
-      if (grant.bundleIdentifier)
-        versions.emplace(*grant.bundleIdentifier, grant.bundleVersion.value_or(""));
+      remember({});
+      learn(*grant.bundlePath, grant.bundleIdentifier, grant.bundleVersion);
     }
     grants_.push_back(std::move(grant));
     return 0;
@@ -257,12 +255,20 @@ class LinuxServiceManager final : public ServiceManager {
     return bundles;
   }
 
-  // REQUIRES: mu_ held.
+  // Adds what is registered now, and what was when the manager was made, to
+  // known_. REQUIRES: mu_ held.
   void remember(const BundleRecords& registered) {
-    for (const auto& [path, record] : registered) {
-      auto& versions = known_[path];
-      if (record.identifier) versions.emplace(*record.identifier, record.version.value_or(""));
-    }
+    for (const RegistryEntryPtr& entry : startupEntries_)
+      learn(entry->url(), entry->bundleIdentifier(), entry->bundleVersion());
+    startupEntries_ = {};
+    for (const auto& [path, record] : registered) learn(path, record.identifier, record.version);
+  }
+
+  // REQUIRES: mu_ held.
+  void learn(const std::string& path, const std::optional<std::string>& identifier,
+             const std::optional<std::string>& version) {
+    auto& versions = known_[path];
+    if (identifier) versions.emplace(*identifier, version.value_or(""));
   }
 
   // The bundle that holds a granted executable, and its identifier and
@@ -338,6 +344,9 @@ class LinuxServiceManager final : public ServiceManager {
   // it was seen as. Guarded by mu_; never shrinks, and holds one entry per
   // bundle ever installed while the daemon runs.
   std::map<std::string, std::set<PlugInVersion>> known_;
+  // The registry's entries when the manager was made, until remember()
+  // adds them to known_. Guarded by mu_.
+  std::vector<RegistryEntryPtr> startupEntries_;
 };
 
 }  // namespace
