@@ -752,6 +752,9 @@ int Main(int argc, char** argv) {
                         Latency(allMicros), "", "", "", ""});
       }
     }
+    // W5's figure for this drd is its peak before W7, which has figures of
+    // its own.
+    smallPeakKiB = small->peakResidentKiB();
     if (o.runs("W7")) {
       log("W7");
       Targets t;
@@ -812,7 +815,6 @@ int Main(int argc, char** argv) {
                       Mib(baseKiB) + " → " + Mib(peakLoadKiB) + " → " + Mib(afterKiB), "", "",
                       "back to before", Verdict(judged7, back)});
     }
-    smallPeakKiB = small->peakResidentKiB();
   }
 
   // ---- The 10,000-plug-in drd: W2, W4, W5 -------------------------------------
