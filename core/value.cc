@@ -356,6 +356,18 @@ size_t Value::size() const {
   return 0;
 }
 
+size_t Value::depth() const {
+  size_t deepest = 0;
+  if (isArray()) {
+    for (const Value& v : array()) deepest = std::max(deepest, v.depth());
+  } else if (isDictionary()) {
+    for (const auto& entry : dictionary()) deepest = std::max(deepest, entry.second.depth());
+  } else {
+    return 0;
+  }
+  return deepest + 1;
+}
+
 Value Value::changing(std::string_view key, const Value& value) const {
   if (!isDictionary()) return Value();
   Dictionary copy = dictionary();

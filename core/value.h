@@ -149,6 +149,9 @@ class Value {
   const Value& at(size_t index) const;
   // Element count of an array or dictionary; 0 for anything else.
   size_t size() const;
+  // How many levels of containers this value nests: 0 for a scalar (or
+  // absent), 1 for a container of scalars or an empty one, and so on.
+  size_t depth() const;
 
   // A new dictionary: a copy of this one in which `key` maps to `value`, or
   // without `key` when `value` is absent. This value is not changed. When this

@@ -392,7 +392,11 @@ void Transaction::annotatePlugIns() {
     changes[kElectionKey] = election;
   }
   if (const Value& extension = annotations[kExtensionKey]; extension.isPresent()) {
-    if (!extension.isDictionary() || !pdoc::WriteXml(extension)) {
+    // In a form the settings sit two levels below it (its "annotations",
+    // then this): deeper ones would make every reply that carries the
+    // plug-in's form impossible to send.
+    if (!extension.isDictionary() || extension.depth() > DRPlugInCore::kMaxFormDepth - 2 ||
+        !pdoc::WriteXml(extension)) {
       failMessage(kErrorMalformed, "invalid request format (annotation extension)");
       return;
     }

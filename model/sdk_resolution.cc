@@ -94,6 +94,14 @@ std::optional<Error> DRPlugInCore::diagnose() {
     return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn, "missing \"%@\" key in Info.pdoc or SDK",
                                  missing);
   }
+  // The form's "bundleInfo" is one level below the form (and "info", the
+  // plug-in dictionary, is within it).
+  if (size_t depth = bundleInfoDictionary().depth(); depth > kMaxFormDepth - 1) {
+    return DRMakeErrorWithFormat(
+        kDRErrorInvalidPlugIn,
+        "Info.pdoc and SDK nest %@ levels deep, more than the %@ a reply can carry", depth,
+        kMaxFormDepth - 1);
+  }
   return std::nullopt;
 }
 

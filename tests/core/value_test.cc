@@ -188,6 +188,21 @@ TEST(ValueTest, DictionaryBuilderTakesKeysInAnyOrderButEachOnce) {
   }
 }
 
+TEST(ValueTest, DepthCountsLevelsOfContainers) {
+  const struct {
+    Value value;
+    size_t depth;
+  } rows[] = {
+      {Value(), 0},
+      {Value("text"), 0},
+      {Value::EmptyArray(), 1},
+      {Value::EmptyDictionary(), 1},
+      {Value{{"a", 1}, {"b", Value(Array{Value(Array{})})}}, 3},
+      {Value(Array{Value(1), Value{{"x", Value{{"y", 2}}}}, Value::EmptyArray()}), 3},
+  };
+  for (const auto& row : rows) EXPECT_EQ(row.value.depth(), row.depth) << row.value.description();
+}
+
 TEST(ValueTest, CopiesShareNodesAndChangesMakeNewOnes) {
   const Value inner = Value{{"x", 1}};
   const Value outer = Value{{"inner", inner}};

@@ -195,14 +195,56 @@ TEST_F(RequestsTest, OneCopyPerIdentifierUnlessAllVersionsAreAsked) {
   EXPECT_EQ(w.match(Value(), kAllVersions).size(), 2u);
 }
 
-// Bundles may nest deeper than a message can: a discovery that would carry
-// such a dictionary is still answered, and the connection goes on serving.
-TEST_F(RequestsTest, ReplyTooDeepForTheWireIsAnsweredWithAnError) {
-  Value deep = Value("bottom");
-  for (int level = 0; level < 70; ++level) deep = Value(Array{deep});
-  ASSERT_EQ(ErrorCode(w.add(
-                {w.makePlugIn("system/deep.appex", "com.example.deep", "1.0", {{"Deep", deep}})})),
-            0u);
+// Bundles may nest deeper than a message can. A plug-in whose form no reply
+// could carry is ignored, with a log line, so that discovery still finds the
+// others; one level less is found.
+TEST_F(RequestsTest, PlugInNestedTooDeepForAReplyIsIgnored) {
+  auto nested = [](int depth) {
+    Value v("bottom");
+    for (int level = 0; level < depth; ++level) v = Value(Array{v});
+    return v;
+  };
+  // The reply, "matches", the form, "bundleInfo", "UXExtension", then "Deep":
+  // 59 arrays reach the 64 levels a message may nest.
+  ASSERT_EQ(
+      ErrorCode(w.add(
+          {w.makePlugIn("system/fits.appex", "com.example.fits", "1.0", {{"Deep", nested(59)}}),
+           w.makePlugIn("system/deep.appex", "com.example.deep", "1.0", {{"Deep", nested(60)}})})),
+      0u);
+  EXPECT_EQ(World::Identifiers(w.match()), "com.example.fits") << w.log();
+  const std::string log = w.log();
+  const size_t line = log.find("ignoring mis-configured plug-in at " + w.path("system/deep.appex"));
+  ASSERT_NE(line, std::string::npos) << log;
+  EXPECT_NE(log.substr(line, log.find('\n', line) - line)
+                .find("Info.pdoc and SDK nest 62 levels deep, more than the 61 a reply can carry"),
+            std::string::npos)
+      << log;
+
+  // Settings are held to the same bound: in a form they sit two levels lower
+  // than in the request.
+  const Value fits = w.uuidOf("com.example.fits");
+  auto annotate = [&](int depth) {
+    return ErrorCode(w.call(
+        Request("annotate", {{"annotations", Value{{"extension", Value{{"d", nested(depth)}}}}},
+                             {"uuids", Value(Array{fits})}})));
+  };
+  EXPECT_NE(annotate(60), 0u);
+  EXPECT_EQ(annotate(59), 0u);
+  EXPECT_EQ(World::Identifiers(w.match()), "com.example.fits") << w.log();
+}
+
+// A reply the wire cannot carry (here over 16 MiB) is answered with an error
+// instead, and the connection goes on serving.
+TEST_F(RequestsTest, ReplyTooLargeForTheWireIsAnsweredWithAnError) {
+  // Each form carries the 1 MiB text twice: in "bundleInfo" and in "info".
+  const std::string big(size_t{1} << 20, 'x');
+  std::vector<std::string> paths;
+  for (int i = 0; i < 9; ++i) {
+    const std::string n = std::to_string(i);
+    paths.push_back(w.makePlugIn("system/big" + n + ".appex", "com.example.big" + n, "1.0",
+                                 {{"Big", Value(big)}}));
+  }
+  ASSERT_EQ(ErrorCode(w.add(paths)), 0u);
   std::unique_ptr<client::Connection> c = w.connect();
   for (int i = 0; i < 70; ++i) {  // more than a connection may leave unanswered
     Value reply = w.call(Request("match"), c.get());
