@@ -298,15 +298,26 @@ void PeerConnection::run() {
 
 namespace {
 
-// A listening socket passed by systemd, or -1. Descriptors that are not a
-// listening Unix stream socket are closed, with a log line.
-int TakeActivatedSocket() {
+// A listening socket passed by systemd, or -1: the listening Unix stream
+// socket bound to `path` when one is, else the first listening Unix stream
+// socket (a unit may listen under another name). Every other descriptor
+// passed is closed, with a log line.
+int TakeActivatedSocket(const std::string& path) {
   int n = sd_listen_fds(1);
   if (n <= 0) return -1;
+  // A length of 0 asks for a socket bound to that (NUL-terminated) path.
+  auto listening = [](int fd, const std::string* at) {
+    return sd_is_socket_unix(fd, SOCK_STREAM, 1, at ? at->c_str() : nullptr, 0) > 0;
+  };
   int chosen = -1;
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n && chosen < 0; ++fd) {
+    if (listening(fd, &path)) chosen = fd;
+  }
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n && chosen < 0; ++fd) {
+    if (listening(fd, nullptr)) chosen = fd;
+  }
   for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n; ++fd) {
-    if (chosen < 0 && sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) > 0) {
-      chosen = fd;
+    if (fd == chosen) {
       ::fcntl(fd, F_SETFD, FD_CLOEXEC);
     } else {
       SystemLog("closing passed descriptor %d: not the one listening Unix stream socket", fd);
@@ -321,7 +332,7 @@ int TakeActivatedSocket() {
 Result<std::unique_ptr<Listener>> Listener::Create(const ListenerOptions& options,
                                                    SerialQueue* eventQueue) {
   if (options.useSocketActivation) {
-    int fd = TakeActivatedSocket();
+    int fd = TakeActivatedSocket(options.socketDirectory + "/" + options.serviceName);
     if (fd >= 0) return std::unique_ptr<Listener>(new Listener(fd, "", false, eventQueue));
   }
   const std::string& name = options.serviceName;

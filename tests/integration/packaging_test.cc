@@ -280,12 +280,22 @@ bool AwaitNotify(int fd, const std::string& line, std::string* seen) {
   return false;
 }
 
-TEST(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehind) {
+// Run alone, and after another listening socket passed first (a unit that
+// listens under more than one name): drd serves the one of its own name.
+class SocketActivationTest : public ::testing::TestWithParam<bool> {};
+INSTANTIATE_TEST_SUITE_P(PassedFirst, SocketActivationTest, ::testing::Values(false, true));
+
+TEST_P(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehind) {
+  const bool decoyFirst = GetParam();
   TempFolder root;
   const std::string runtime = root / "run/dromon";  // %t/dromon
   const std::string socketPath = runtime + "/" + kService;
   int listenFd = ListenLikeSystemd(socketPath);
   ASSERT_GE(listenFd, 0) << socketPath;
+  int decoyFd = decoyFirst ? ListenLikeSystemd(root / "run/other.sock") : -1;
+  if (decoyFirst) {
+    ASSERT_GE(decoyFd, 0);
+  }
   int notifyFd = NotifySocket(root / "notify.sock");
   ASSERT_GE(notifyFd, 0);
   struct stat before {};
@@ -297,7 +307,7 @@ TEST(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehind
   // in its own pid before exec.
   char listenPid[32] = "LISTEN_PID=";
   std::vector<std::string> env = {
-      "LISTEN_FDS=1",
+      decoyFirst ? "LISTEN_FDS=2" : "LISTEN_FDS=1",
       "NOTIFY_SOCKET=" + root / "notify.sock",
       "DR_SOCKET_DIR=" + runtime,  // as drd.service sets it
       "DR_REGISTRY=" + root / "registry.sqlite3",
@@ -313,19 +323,30 @@ TEST(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehind
   pid_t pid = ::fork();
   ASSERT_GE(pid, 0);
   if (pid == 0) {
-    // What systemd execs: the socket as the first passed descriptor.
+    // What systemd execs: the sockets as the first passed descriptors.
     int err = ::open(errorFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
     if (err >= 0) ::dup2(err, STDERR_FILENO);
-    if (::dup2(listenFd, SD_LISTEN_FDS_START) < 0) ::_exit(126);
+    // Moved out of the way first, so that neither is overwritten by the other.
+    const int listenHigh = ::fcntl(listenFd, F_DUPFD, 64);
+    const int decoyHigh = decoyFirst ? ::fcntl(decoyFd, F_DUPFD, 64) : -1;
+    if (decoyFirst && ::dup2(decoyHigh, SD_LISTEN_FDS_START) < 0) ::_exit(126);
+    if (::dup2(listenHigh, SD_LISTEN_FDS_START + (decoyFirst ? 1 : 0)) < 0) ::_exit(126);
+    // Only the passed descriptors stay open: a socket drd closes must stop
+    // listening, as it would under systemd.
+    for (int fd : {listenFd, decoyFd, listenHigh, decoyHigh})
+      if (fd > SD_LISTEN_FDS_START + 1) ::close(fd);
     std::snprintf(listenPid, sizeof listenPid, "LISTEN_PID=%d", static_cast<int>(::getpid()));
     ::execve(binary.c_str(), argv, envp.data());
     ::_exit(127);
   }
   ::close(listenFd);  // from here on only drd holds it, as under systemd
+  if (decoyFirst) ::close(decoyFd);
   auto standardError = [&] { return ReadAll(errorFile); };
+  bool reaped = false;
   auto reap = [&](std::chrono::milliseconds timeout) -> int {
     const auto deadline = std::chrono::steady_clock::now() + timeout;
     int status = 0;
+    reaped = true;
     while (std::chrono::steady_clock::now() < deadline) {
       if (::waitpid(pid, &status, WNOHANG) == pid)
         return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
@@ -335,6 +356,11 @@ TEST(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehind
     ::waitpid(pid, &status, 0);
     return -1;
   };
+  // A failed assertion returns early: drd must not outlive the test (it
+  // would hold the test runner's output open).
+  std::shared_ptr<void> reapOnReturn(nullptr, [&](void*) {
+    if (!reaped) reap(0ms);
+  });
 
   std::string seen;
   bool ready = AwaitNotify(notifyFd, "READY=1", &seen);
