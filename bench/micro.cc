@@ -231,6 +231,39 @@ BENCHMARK_CAPTURE(BM_Drm1Decode, lock_release, LockRelease());
 BENCHMARK_CAPTURE(BM_Drm1Decode, match_100, MatchReply(100))->Unit(benchmark::kMicrosecond);
 BENCHMARK_CAPTURE(BM_Drm1Decode, match_1000, MatchReply(1000))->Unit(benchmark::kMicrosecond);
 
+// A body of one dictionary of `count` keys written in ascending or descending
+// order: drd's encoders write the first, a peer may send the second.
+std::string KeyOrderBody(int count, bool descending) {
+  auto u32 = [](std::string& out, uint32_t v) { out.append(reinterpret_cast<const char*>(&v), 4); };
+  std::string body(1, static_cast<char>(dr::drm1::kTagDictionary));
+  u32(body, static_cast<uint32_t>(count));
+  for (int i = 0; i < count; ++i) {
+    char key[16];
+    std::snprintf(key, sizeof key, "key%08d", descending ? count - 1 - i : i);
+    u32(body, 11);
+    body.append(key, 11);
+    body += static_cast<char>(dr::drm1::kTagTrue);
+  }
+  return body;
+}
+
+void BM_Drm1DecodeKeyOrder(benchmark::State& state, bool descending) {
+  const std::string body = KeyOrderBody(static_cast<int>(state.range(0)), descending);
+  for (auto _ : state) {
+    auto value = dr::drm1::DecodeBody(body);
+    if (!value || value->size() != static_cast<size_t>(state.range(0)))
+      state.SkipWithError("decode failed");
+    benchmark::DoNotOptimize(value);
+  }
+  state.SetItemsProcessed(state.iterations() * state.range(0));
+}
+BENCHMARK_CAPTURE(BM_Drm1DecodeKeyOrder, ascending, false)
+    ->Arg(100000)
+    ->Unit(benchmark::kMicrosecond);
+BENCHMARK_CAPTURE(BM_Drm1DecodeKeyOrder, descending, true)
+    ->Arg(100000)
+    ->Unit(benchmark::kMicrosecond);
+
 // ---- pdoc --------------------------------------------------------------------
 
 std::string JsonInfo() {
