@@ -55,8 +55,6 @@ class Key {
   const char* data() const { return data_; }
   size_t size() const { return size_; }
   bool empty() const { return size_ == 0; }
-  bool starts_with(std::string_view prefix) const { return view().starts_with(prefix); }
-  bool ends_with(std::string_view suffix) const { return view().ends_with(suffix); }
 
   // Whether this key shares the process's copy of its text (for tests).
   bool isShared() const { return !owned_ && size_ > 0; }
@@ -79,16 +77,6 @@ class Key {
   }
   friend std::strong_ordering operator<=>(const Key& a, const char* b) {
     return a.view() <=> std::string_view(b);
-  }
-  friend std::string operator+(const Key& a, std::string_view b) {
-    std::string s(a.view());
-    s += b;
-    return s;
-  }
-  friend std::string operator+(std::string_view a, const Key& b) {
-    std::string s(a);
-    s += b.view();
-    return s;
   }
 
  private:

@@ -203,8 +203,6 @@ class Dictionary {
   using size_type = size_t;
   using iterator = std::vector<value_type>::iterator;
   using const_iterator = std::vector<value_type>::const_iterator;
-  using reverse_iterator = std::vector<value_type>::reverse_iterator;
-  using const_reverse_iterator = std::vector<value_type>::const_reverse_iterator;
 
   Dictionary() = default;
   // Of two entries with the same key, the first is kept.
@@ -219,14 +217,9 @@ class Dictionary {
   const_iterator end() const { return entries_.end(); }
   const_iterator cbegin() const { return entries_.begin(); }
   const_iterator cend() const { return entries_.end(); }
-  reverse_iterator rbegin() { return entries_.rbegin(); }
-  reverse_iterator rend() { return entries_.rend(); }
-  const_reverse_iterator rbegin() const { return entries_.rbegin(); }
-  const_reverse_iterator rend() const { return entries_.rend(); }
 
   size_t size() const { return entries_.size(); }
   bool empty() const { return entries_.empty(); }
-  void clear() { entries_.clear(); }
   // Room for `n` entries without moving the block again.
   void reserve(size_t n) { entries_.reserve(n); }
   // Gives back the room beyond the entries when that is more than a quarter
@@ -236,12 +229,9 @@ class Dictionary {
   }
 
   // The first entry whose key is not below `key`.
-  iterator lower_bound(std::string_view key) { return begin() + lowerIndex(key); }
-  const_iterator lower_bound(std::string_view key) const { return begin() + lowerIndex(key); }
   iterator find(std::string_view key) { return begin() + findIndex(key); }
   const_iterator find(std::string_view key) const { return begin() + findIndex(key); }
   bool contains(std::string_view key) const { return findIndex(key) != size(); }
-  size_t count(std::string_view key) const { return contains(key) ? 1 : 0; }
 
   // The value under `key`, inserted absent when there is none.
   Value& operator[](std::string_view key) { return try_emplace(Key(key)).first->second; }
@@ -261,9 +251,6 @@ class Dictionary {
   std::pair<iterator, bool> emplace(Key key, V&& value) {
     return try_emplace(std::move(key), std::forward<V>(value));
   }
-  std::pair<iterator, bool> insert(value_type entry) {
-    return try_emplace(std::move(entry.first), std::move(entry.second));
-  }
   template <typename V>
   std::pair<iterator, bool> insert_or_assign(Key key, V&& value) {
     auto [it, inserted] = try_emplace(std::move(key), std::forward<V>(value));
@@ -282,7 +269,6 @@ class Dictionary {
   }
 
   iterator erase(const_iterator it) { return entries_.erase(it); }
-  iterator erase(const_iterator first, const_iterator last) { return entries_.erase(first, last); }
   size_t erase(std::string_view key) {
     size_t i = findIndex(key);
     if (i == size()) return 0;

@@ -46,7 +46,7 @@ Value DRPlugInCore::exportForm(std::optional<Error>* /*error*/) const {
 // One lock for the whole form rather than one per property (a form is made
 // for every plug-in a match returns), which also makes the form one
 // consistent picture of the record. The keys go in ascending order, each at
-// the end of the map.
+// the end of the dictionary.
 Dictionary DRPlugInCore::formEntries() const {
   Dictionary form;
   auto add = [&form](const char* key, Value value) {

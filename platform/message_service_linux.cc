@@ -305,17 +305,14 @@ namespace {
 int TakeActivatedSocket(const std::string& path) {
   int n = sd_listen_fds(1);
   if (n <= 0) return -1;
-  // A length of 0 asks for a socket bound to that (NUL-terminated) path.
-  auto listening = [](int fd, const std::string* at) {
-    return sd_is_socket_unix(fd, SOCK_STREAM, 1, at ? at->c_str() : nullptr, 0) > 0;
-  };
-  int chosen = -1;
-  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n && chosen < 0; ++fd) {
-    if (listening(fd, &path)) chosen = fd;
+  int atPath = -1, first = -1;
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n && atPath < 0; ++fd) {
+    if (sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) <= 0) continue;
+    if (first < 0) first = fd;
+    // A length of 0 asks for a socket bound to that (NUL-terminated) path.
+    if (sd_is_socket_unix(fd, SOCK_STREAM, 1, path.c_str(), 0) > 0) atPath = fd;
   }
-  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n && chosen < 0; ++fd) {
-    if (listening(fd, nullptr)) chosen = fd;
-  }
+  const int chosen = atPath >= 0 ? atPath : first;
   for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + n; ++fd) {
     if (fd == chosen) {
       ::fcntl(fd, F_SETFD, FD_CLOEXEC);
