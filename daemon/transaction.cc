@@ -60,12 +60,12 @@ bool IsMessageNumber(const Value& value) {
 }
 
 // One entry of "conflicts": the running instance that makes a plug-in busy.
-Value BusyDescription(const BusyExtensionInstance& instance) {
+Value BusyDescription(const BusyInstance& instance) {
   return Value(Dictionary{
       {"pid", Value(static_cast<int64_t>(instance.pid))},
       {"path", Value(instance.bundlePath)},
       {"identifier", Value(instance.bundleIdentifier)},
-      {"version", Value(instance.bundleVersion)},
+      {"version", Value(instance.version)},
   });
 }
 
@@ -466,7 +466,7 @@ void Transaction::lockDownPlugIns() {
   Array busy;
   if (flags != kHoldPlugIn) {
     for (const DRDPlugInPtr& p : plugIns) {
-      if (std::optional<BusyExtensionInstance> instance = p->checkBusy()) {
+      if (std::optional<BusyInstance> instance = p->checkBusy()) {
         conflicts.push_back(BusyDescription(*instance));
         busy.emplace_back(Format("%@(%@)", p->identifier(), p->uuid()));
       }

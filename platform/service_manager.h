@@ -40,13 +40,14 @@ struct ExternalServiceGrant {
   bool operator==(const ExternalServiceGrant&) const = default;
 };
 
-// A running process whose executable lies in a registered plug-in bundle.
+// A running process whose executable lies in a registered plug-in bundle, as
+// an instance of one plug-in of that bundle.
 struct BusyExtensionInstance {
   pid_t pid = 0;
   std::optional<std::string> bundlePath;
   std::optional<std::string> bundleIdentifier;
-  // The version the bundle's registry record reports.
-  std::optional<std::string> bundleVersion;
+  // The registry entry of the plug-in; its record says the plug-in's version.
+  std::optional<Uuid> plugIn;
   bool operator==(const BusyExtensionInstance&) const = default;
 };
 
@@ -72,8 +73,9 @@ class ServiceManager {
 
   // The running processes whose executable lies in a registered plug-in
   // bundle with one of `bundleIdentifiers` (the innermost registered bundle
-  // when bundles nest), in pid order. Fails only when the process list cannot
-  // be read.
+  // when bundles nest), in pid order: each process once per plug-in of its
+  // bundle, in registry order. Fails only when the process list cannot be
+  // read.
   virtual Result<std::vector<BusyExtensionInstance>> busyExtensionInstances(
       const std::vector<std::string>& bundleIdentifiers) = 0;
 

@@ -101,10 +101,11 @@ int ExecutableError(int errnum) {
 }
 
 // The identifier and version of one registered bundle's plug-ins (all
-// entries of a bundle share them).
+// entries of a bundle share them), and the entries themselves.
 struct BundleRecord {
   std::optional<std::string> identifier;
   std::optional<std::string> version;
+  std::vector<Uuid> plugIns;
 };
 using BundleRecords = std::map<std::string, BundleRecord>;
 // A plug-in's identity as removal names it; a record without a version has "".
@@ -194,7 +195,8 @@ class LinuxServiceManager final : public ServiceManager {
       const BundleRecords::value_type* bundle = InnermostBundle(registered, *exe);
       if (!bundle || !bundle->second.identifier || !wanted.count(*bundle->second.identifier))
         continue;
-      busy.push_back({pid, bundle->first, bundle->second.identifier, bundle->second.version});
+      for (const Uuid& plugIn : bundle->second.plugIns)
+        busy.push_back({pid, bundle->first, bundle->second.identifier, plugIn});
     }
     return busy;
   }
@@ -249,8 +251,9 @@ class LinuxServiceManager final : public ServiceManager {
     BundleRecords bundles;
     if (!registry_) return bundles;
     for (const RegistryEntryPtr& entry : registry_->allEntries()) {
-      bundles.emplace(entry->url(),
-                      BundleRecord{entry->bundleIdentifier(), entry->bundleVersion()});
+      auto [it, added] = bundles.try_emplace(
+          entry->url(), BundleRecord{entry->bundleIdentifier(), entry->bundleVersion(), {}});
+      it->second.plugIns.push_back(entry->uuid());
     }
     return bundles;
   }

@@ -73,7 +73,7 @@ std::optional<Error> DRDPlugIn::enableForPid(pid_t pid) const {
   return std::nullopt;
 }
 
-std::optional<BusyExtensionInstance> DRDPlugIn::checkBusy() const {
+std::optional<BusyInstance> DRDPlugIn::checkBusy() const {
   // Without a bundle identifier there is nothing to ask the service manager.
   auto bundleIdentifier = bundleInfoDictionary()[kBNBundleIdentifierKey].string();
   if (!bundleIdentifier) return std::nullopt;
@@ -91,8 +91,17 @@ std::optional<BusyExtensionInstance> DRDPlugIn::checkBusy() const {
                 identifier());
       continue;
     }
-    if (instance.bundleVersion && instance.bundleVersion != ownVersion) continue;
-    return instance;
+    // A process runs as each plug-in of its bundle; each has its own record,
+    // whose version is the one compared.
+    std::optional<std::string> version;
+    if (instance.plugIn && *instance.plugIn == uuid()) {
+      version = ownVersion;
+    } else if (instance.plugIn && services_.plugInVersion) {
+      version = services_.plugInVersion(*instance.plugIn);
+    }
+    if (version && version != ownVersion) continue;
+    return BusyInstance{instance.pid, instance.bundlePath, instance.bundleIdentifier,
+                        std::move(version)};
   }
   return std::nullopt;
 }

@@ -8,6 +8,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -41,6 +42,21 @@ struct PlugInServices {
   TypeService* types = nullptr;
   // The daemon's environment (DRTEST_SDK); null: the process environment.
   EnvironmentLookup getenv;
+  // The version of the record of the plug-in registered as `uuid`; none when
+  // it has none or no record can be made. Null: only a record's own UUID is
+  // known.
+  std::function<std::optional<std::string>(const Uuid& uuid)> plugInVersion;
+};
+
+// A running instance of a plug-in, as the busy check reports it: the
+// process, its bundle, and the version of the plug-in it runs as (none when
+// that plug-in's record has none).
+struct BusyInstance {
+  pid_t pid = 0;
+  std::optional<std::string> bundlePath;
+  std::optional<std::string> bundleIdentifier;
+  std::optional<std::string> version;
+  bool operator==(const BusyInstance&) const = default;
 };
 
 class DRDPlugIn : public DRPlugInCore {
@@ -101,9 +117,9 @@ class DRDPlugIn : public DRPlugInCore {
   // success, else an error (code 4) after a system-log line.
   std::optional<Error> enableForPid(pid_t pid) const;
   // The first running instance of this plug-in (same bundle identifier, and
-  // the same version or none), or nothing; also nothing when instances cannot
-  // be listed (logged).
-  std::optional<BusyExtensionInstance> checkBusy() const;
+  // a plug-in of the same version or of none), or nothing; also nothing when
+  // instances cannot be listed (logged).
+  std::optional<BusyInstance> checkBusy() const;
 
   // ---- Accessors -----------------------------------------------------------
 

@@ -29,7 +29,23 @@ DRDatabase::DRDatabase(const std::optional<std::string>& path, DatabaseOptions o
 // never called; nothing is withdrawn here, since the registry may be gone too.
 DRDatabase::~DRDatabase() = default;
 
-void DRDatabase::subscribe() { options_.registry->addObserver(weak_from_this()); }
+void DRDatabase::subscribe() {
+  // A record asks for the versions of the other plug-ins of its bundle (the
+  // busy check); the database may be gone by then, its records not.
+  options_.plugInServices.plugInVersion =
+      [weak = weak_from_this()](const Uuid& uuid) -> std::optional<std::string> {
+    std::shared_ptr<DRDatabase> db = weak.lock();
+    if (!db) return std::nullopt;
+    return db->sync_.syncResult([&]() -> std::optional<std::string> {
+      auto it = db->cache_.find(uuid);
+      if (it != db->cache_.end()) return it->second->version();
+      RegistryEntryPtr entry = db->options_.registry->entryForUuid(uuid);
+      DRDPlugInPtr record = entry ? db->createPlugInForProxy(entry) : nullptr;
+      return record ? record->version() : std::nullopt;
+    });
+  };
+  options_.registry->addObserver(weak_from_this());
+}
 
 void DRDatabase::setDelegate(std::weak_ptr<DRDatabaseDelegate> delegate) {
   std::lock_guard<std::mutex> lock(delegateMu_);

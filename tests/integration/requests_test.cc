@@ -425,21 +425,37 @@ TEST_F(RequestsTest, HoldsHideAndRefuseUntilReleased) {
 }
 
 TEST_F(RequestsTest, BusyPlugInRefusesAnApplicationHold) {
-  w.makeApp("Host.app", "com.example.host");
-  const std::string p = w.makePlugIn("Host.app/Contents/PlugIns/p.appex", "com.example.p");
-  w.add({p});
-  RunningProgram running(p + "/Contents/Exec/run");
-  ASSERT_GT(running.pid(), 0);
-  Value reply =
-      w.call(Request("lock", {{"flags", 1}, {"paths", Value(Array{Value(w.path("Host.app"))})}}));
-  EXPECT_EQ(ErrorCode(reply), 14u);
-  EXPECT_EQ(ErrorText(reply), "plug-ins are busy");
-  ASSERT_EQ(reply["conflicts"].size(), 1u);
-  EXPECT_EQ(reply["conflicts"].at(0)["pid"].intValue(), running.pid());
-  EXPECT_EQ(reply["conflicts"].at(0)["path"].stringValue(), p);
-  // Naming the one plug-in holds it even while it runs.
-  reply = w.call(Request("lock", {{"flags", 2}, {"paths", Value(Array{Value(p)})}}));
-  EXPECT_TRUE(reply["uuids"].isUuid()) << ErrorText(reply);
+  // A plug-in's version may differ from its bundle's; the plug-in's is the
+  // one that makes a process an instance of it.
+  struct Row {
+    const char* what;
+    Dictionary extra;
+  } rows[] = {
+      {"plug-in version is the bundle's", {}},
+      {"plug-in version differs from the bundle's",
+       {{"UXExtensionAttributes", Value{{"UXExtensionVersion", "1.0"}}}}},
+  };
+  int n = 0;
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    const std::string app = "Host" + std::to_string(++n) + ".app";
+    w.makeApp(app, "com.example.host");
+    const std::string p = w.makePlugIn(app + "/Contents/PlugIns/p.appex",
+                                       "com.example.p" + std::to_string(n), "1", row.extra);
+    w.add({p});
+    RunningProgram running(p + "/Contents/Exec/run");
+    ASSERT_GT(running.pid(), 0);
+    Value reply =
+        w.call(Request("lock", {{"flags", 1}, {"paths", Value(Array{Value(w.path(app))})}}));
+    EXPECT_EQ(ErrorCode(reply), 14u);
+    EXPECT_EQ(ErrorText(reply), "plug-ins are busy");
+    ASSERT_EQ(reply["conflicts"].size(), 1u);
+    EXPECT_EQ(reply["conflicts"].at(0)["pid"].intValue(), running.pid());
+    EXPECT_EQ(reply["conflicts"].at(0)["path"].stringValue(), p);
+    // Naming the one plug-in holds it even while it runs.
+    reply = w.call(Request("lock", {{"flags", 2}, {"paths", Value(Array{Value(p)})}}));
+    EXPECT_TRUE(reply["uuids"].isUuid()) << ErrorText(reply);
+  }
 }
 
 TEST_F(RequestsTest, HoldEndsWhenItsHostDies) {

@@ -138,8 +138,10 @@ std::string World::makePlugIn(const std::string& path, const std::string& id,
   granted["com.corvel.security.app-sandbox"] = Value(true);
   Dictionary plugIn = extra;
   plugIn["UXExtensionPointIdentifier"] = Value("com.example.point");
-  plugIn["UXExtensionAttributes"] =
-      Value{{"UXExtensionIdentifier", Value(id)}, {"UXExtensionPointName", "com.example.point"}};
+  Dictionary attributes = plugIn["UXExtensionAttributes"].dictionary();
+  attributes["UXExtensionIdentifier"] = Value(id);
+  attributes["UXExtensionPointName"] = Value("com.example.point");
+  plugIn["UXExtensionAttributes"] = Value(std::move(attributes));
   const std::string bundle =
       registry_test::MakeBundle(root_ / path,
                                 Value{{"BNBundleIdentifier", Value(id + ".bundle")},

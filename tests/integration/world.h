@@ -72,7 +72,8 @@ class World {
                       const Value& entitlements = Value()) const;
   // A plug-in bundle at `path` (relative to root) with identifier `id`, for
   // extension point "com.example.point", version `version`, an executable
-  // named "run", `extra` entries merged into its plug-in dictionary, and
+  // named "run", `extra` entries merged into its plug-in dictionary (and
+  // extra "UXExtensionAttributes" into its attributes), and
   // `entitlements` besides the sandbox entitlement every plug-in needs.
   std::string makePlugIn(const std::string& path, const std::string& id,
                          const std::string& version = "1.0", const Dictionary& extra = {},

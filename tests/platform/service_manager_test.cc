@@ -163,10 +163,13 @@ TEST_F(ServiceManagerProcessTest, BusyInstancesAreTheLiveProcessesOfTheAskedBund
   ::kill(reaped.pid(), SIGKILL);
   reaped.wait();
 
-  const BusyExtensionInstance instA{a.pid(), bundle("A"), "com.example.a", "1.0"};
-  const BusyExtensionInstance instB{b.pid(), bundle("B"), "com.example.b", "2.0"};
+  auto plugIn = [&](const std::string& name) {
+    return registry_->entryForUrl(bundle(name))->uuid();
+  };
+  const BusyExtensionInstance instA{a.pid(), bundle("A"), "com.example.a", plugIn("A")};
+  const BusyExtensionInstance instB{b.pid(), bundle("B"), "com.example.b", plugIn("B")};
   const BusyExtensionInstance instInner{innerChild.pid(), bundle(inner), "com.example.inner",
-                                        "3.0"};
+                                        plugIn(inner)};
   struct Row {
     std::vector<std::string> identifiers;
     std::vector<BusyExtensionInstance> expected;

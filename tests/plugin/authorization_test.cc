@@ -2,6 +2,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <map>
 #include <optional>
 #include <string>
 #include <vector>
@@ -174,14 +175,29 @@ TEST_F(EnableTest, RefusalsAreErrorsWithTheirLogLines) {
   }
 }
 
-using CheckBusyTest = PlugInFixture;
+// Other plug-ins' versions come from the database; here from a table.
+class CheckBusyTest : public PlugInFixture {
+ protected:
+  PlugInServices services() override {
+    PlugInServices s = PlugInFixture::services();
+    s.plugInVersion = [this](const Uuid& uuid) -> std::optional<std::string> {
+      auto it = versions.find(uuid.string());
+      return it == versions.end() ? std::nullopt : it->second;
+    };
+    return s;
+  }
+  std::map<std::string, std::optional<std::string>> versions;
+};
 
-TEST_F(CheckBusyTest, FindsTheFirstInstanceOfThisVersion) {
+TEST_F(CheckBusyTest, FindsTheFirstInstanceOfAPlugInOfThisVersion) {
   const std::string bundle = "com.example.a";
-  auto instance = [&](pid_t pid, std::optional<std::string> version,
-                      std::optional<std::string> path = "/b/A.plugin",
-                      std::optional<std::string> id = "com.example.a") {
-    return BusyExtensionInstance{pid, std::move(path), std::move(id), std::move(version)};
+  auto plugIn = make(PlugInInfo("a"));
+  ASSERT_TRUE(plugIn);
+  const Uuid self = *plugIn->uuid(), v1 = Uuid::random(), v200 = Uuid::random(),
+             none = Uuid::random(), unknown = Uuid::random();
+  versions = {{v1.string(), "1.0"}, {v200.string(), "2.00"}, {none.string(), std::nullopt}};
+  auto instance = [&](pid_t pid, Uuid as, std::optional<std::string> path = "/b/A.plugin") {
+    return BusyExtensionInstance{pid, std::move(path), bundle, as};
   };
   const std::string kIncomplete =
       "ipc reported incomplete bundle \"com.example.a\" for plug-in com.example.a.ext";
@@ -190,26 +206,33 @@ TEST_F(CheckBusyTest, FindsTheFirstInstanceOfThisVersion) {
     std::vector<BusyExtensionInstance> instances;
     bool fails;
     std::optional<pid_t> busy;  // the pid of the answer
+    std::optional<std::string> version;
     std::vector<std::string> lines;
   };
   const Row rows[] = {
-      {"nothing running", {}, false, std::nullopt, {}},
-      {"other version, then this one", {instance(1, "1.0"), instance(2, "2.0")}, false, 2, {}},
-      {"only other versions", {instance(1, "1.0"), instance(2, "2.00")}, false, std::nullopt, {}},
-      {"no version counts", {instance(3, std::nullopt)}, false, 3, {}},
+      {"nothing running", {}, false, std::nullopt, std::nullopt, {}},
+      {"another version, then this plug-in",
+       {instance(1, v1), instance(2, self)},
+       false,
+       2,
+       "2.0",
+       {}},
+      {"only other versions", {instance(1, v1), instance(2, v200)}, false, std::nullopt, "", {}},
+      {"a plug-in without a version counts", {instance(3, none)}, false, 3, std::nullopt, {}},
+      {"an entry without a record counts", {instance(3, unknown)}, false, 3, std::nullopt, {}},
       {"incomplete record skipped",
-       {instance(4, "2.0", std::nullopt), instance(5, "2.0")},
+       {instance(4, self, std::nullopt), instance(5, self)},
        false,
        5,
+       "2.0",
        {kIncomplete}},
       {"listing fails",
-       {instance(6, "2.0")},
+       {instance(6, self)},
        true,
+       std::nullopt,
        std::nullopt,
        {"ipc failed to report dirty state for \"com.example.a\""}},
   };
-  auto plugIn = make(PlugInInfo("a"));
-  ASSERT_TRUE(plugIn);
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
     serviceManager.instances = row.instances;
@@ -217,8 +240,11 @@ TEST_F(CheckBusyTest, FindsTheFirstInstanceOfThisVersion) {
     if (row.fails) serviceManager.busyError = PosixError(EIO, "proc");
     serviceManager.busyQueries.clear();
     ScopedLogCapture log;
-    std::optional<BusyExtensionInstance> busy = plugIn->checkBusy();
+    std::optional<BusyInstance> busy = plugIn->checkBusy();
     EXPECT_EQ(busy ? std::optional<pid_t>(busy->pid) : std::nullopt, row.busy);
+    if (busy) {
+      EXPECT_EQ(busy->version, row.version);
+    }
     EXPECT_EQ(log.lines(), row.lines);
     EXPECT_EQ(serviceManager.busyQueries, (std::vector<std::vector<std::string>>{{bundle}}));
   }
@@ -227,7 +253,7 @@ TEST_F(CheckBusyTest, FindsTheFirstInstanceOfThisVersion) {
   auto anonymous = make(PlugInInfo("a").changing("BNBundleIdentifier", Value()));
   ASSERT_TRUE(anonymous);
   serviceManager.busyQueries.clear();
-  serviceManager.instances = {instance(7, "2.0")};
+  serviceManager.instances = {instance(7, self)};
   serviceManager.busyError.reset();
   EXPECT_EQ(anonymous->checkBusy(), std::nullopt);
   EXPECT_TRUE(serviceManager.busyQueries.empty());
