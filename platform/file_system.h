@@ -30,6 +30,9 @@ class FileSystem {
 
   // The whole contents of the file at `path`. Files larger than `maxBytes`
   // are refused (kFileReadError), so a hostile file cannot exhaust memory.
+  // Only regular files are read, and opening never waits: a folder, FIFO,
+  // socket or device reads as a missing file (kFileReadNoSuchFileError), so
+  // a FIFO put where a file belongs cannot stall the reader.
   virtual Result<std::string> readFile(const std::string& path,
                                        size_t maxBytes = kDefaultMaxRead) = 0;
 

@@ -453,6 +453,49 @@ TEST(ReliabilityTest, GarbageFilesDoNotStopDrd) {
   }
 }
 
+// ---------------------------------------------------------------- hostile files
+
+// The reply to `request` on a fresh connection, or nothing when none came
+// within two seconds: a hang guard for requests stuck behind another's.
+std::optional<Value> AnsweredPromptly(World& w, const Value& request) {
+  Drm1Peer peer(w.drd().socketPath());
+  if (!peer.send(1, request)) return std::nullopt;
+  std::optional<drm1::Frame> frame = peer.receive(std::chrono::seconds(2));
+  if (!frame) return std::nullopt;
+  return frame->body;
+}
+
+// A FIFO where a bundle file belongs, which nobody ever opens for writing:
+// registering it is refused as if the file were missing, a peer running
+// from a bundle whose entitlements are one is served as one without, and
+// meanwhile every other client is answered.
+TEST(ReliabilityTest, FifoInPlaceOfABundleFileStallsNobody) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "fifo", 1);
+  const std::string bundle = w.path("system/fifo.appex");
+  std::filesystem::create_directories(bundle + "/Contents");
+  ASSERT_EQ(::mkfifo((bundle + "/Contents/Info.pdoc").c_str(), 0600), 0);
+  const std::string app = w.makeApp("Fifo.app", "com.example.fifohost");
+  std::filesystem::remove(app + "/Contents/Entitlements.pdoc");
+  ASSERT_EQ(::mkfifo((app + "/Contents/Entitlements.pdoc").c_str(), 0600), 0);
+
+  Drm1Peer adder(w.drd().socketPath());
+  ASSERT_TRUE(adder.send(1, Request("add", {{"paths", Value(Array{Value(bundle)})}})));
+  const std::unique_ptr<HostApp> host = w.host("Fifo.app");
+  for (const Value& request :
+       {Request("match"), Request("access", {{"uuids", Value(Array{p.uuids[0]})}})}) {
+    std::optional<Value> reply = AnsweredPromptly(w, request);
+    ASSERT_TRUE(reply) << request.description() << " got no answer\n" << w.log();
+    EXPECT_EQ(ErrorCode(*reply), 0u) << ErrorText(*reply);
+  }
+  std::optional<drm1::Frame> added = adder.receive(std::chrono::seconds(2));
+  ASSERT_TRUE(added) << "\"add\" got no answer\n" << w.log();
+  EXPECT_EQ(ErrorCode(added->body), 2u) << ErrorText(added->body);
+  EXPECT_NE(w.log().find("(no Contents/Info.pdoc)"), std::string::npos) << w.log();
+  EXPECT_EQ(World::Identifiers(w.match(Value(), 0, host->connection())), "com.example.fifo0");
+}
+
 // ---------------------------------------------------------------- load
 
 struct Tally {

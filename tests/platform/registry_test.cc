@@ -228,7 +228,7 @@ TEST_F(RegistryTest, RefusesWhatIsNoPlugInBundleAndStoresNothing) {
       {"x.appex", "not an absolute path"},
       {file("f.appex", "x"), "not a plug-in bundle (not a folder)"},
       {folder("c.appex", "Contents"), "not a plug-in bundle (no Contents/Info.pdoc)"},
-      {folder("u.appex", "Contents/Info.pdoc"), "cannot read Contents/Info.pdoc: "},
+      {folder("u.appex", "Contents/Info.pdoc"), "not a plug-in bundle (no Contents/Info.pdoc)"},
       {info("g.appex", "\x01\x02 not a document"), invalid},
       {info("t.appex", "<?xml version=\"1.0\"?><pdoc version=\"1.0\"><dict><key>a"), invalid},
       {bundle("a.appex", Value(Array{Value("a")})),
