@@ -29,7 +29,9 @@
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 
+#include "core/utf8.h"
 #include "platform/drm1.h"
+#include "platform/file_system.h"
 #include "platform/pdoc.h"
 #include "platform/preferences.h"
 #include "platform/sandbox.h"
@@ -494,6 +496,62 @@ TEST(ReliabilityTest, FifoInPlaceOfABundleFileStallsNobody) {
   EXPECT_EQ(ErrorCode(added->body), 2u) << ErrorText(added->body);
   EXPECT_NE(w.log().find("(no Contents/Info.pdoc)"), std::string::npos) << w.log();
   EXPECT_EQ(World::Identifiers(w.match(Value(), 0, host->connection())), "com.example.fifo0");
+}
+
+// Bundles that could not travel in a reply (a path that is not UTF-8,
+// dictionaries nested too deep, one stored so by an older drd): "add"
+// refuses them with the path escaped, the log stays UTF-8, and every host's
+// discovery goes on with the other plug-ins, also after a restart.
+TEST(ReliabilityTest, PlugInThatCannotTravelNeverBreaksDiscovery) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "travel", 2);
+  const std::string odd = w.makePlugIn("system/odd\xff.appex", "com.example.odd");
+  const std::string link = w.path("system/link.appex");
+  ASSERT_EQ(::symlink(odd.c_str(), link.c_str()), 0);
+  Value deep = Value(Array{});
+  for (int i = 1; i < 60; ++i) deep = Value(Array{deep});  // 62 levels with the two above it
+  const std::string tooDeep =
+      w.makePlugIn("system/deep.appex", "com.example.deep", "1.0", {{"Deep", deep}});
+  const std::string escaped = EscapeInvalidUtf8(*CanonicalPath(odd));
+  const struct {
+    std::string path, reply, log;
+  } rows[] = {
+      {link, "unable to register plug-in at " + escaped, escaped + "\" is not UTF-8"},
+      {tooDeep, "unable to register plug-in at " + *CanonicalPath(tooDeep),
+       "nests deeper than the 61 levels a reply can carry"},
+  };
+  for (const auto& row : rows) {
+    Value reply = w.add({row.path});
+    EXPECT_EQ(ErrorCode(reply), 2u) << row.path;
+    EXPECT_EQ(ErrorText(reply), row.reply);
+    EXPECT_NE(w.log().find(row.log), std::string::npos) << w.log();
+  }
+  EXPECT_EQ(World::Identifiers(w.match()), "com.example.travel0 com.example.travel1");
+
+  // An entry an older drd stored under such a path is left out, with a line.
+  w.drd().signal(SIGTERM);
+  ASSERT_EQ(w.drd().waitForExit(), 0);
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(w.path("registry/r.sqlite3").c_str(), &db), SQLITE_OK);
+  std::unique_ptr<sqlite3, decltype(&sqlite3_close)> closer(db, &sqlite3_close);
+  sqlite3_stmt* update = nullptr;
+  ASSERT_EQ(
+      sqlite3_prepare_v2(db, "UPDATE bundles SET path = ? WHERE path = ?", -1, &update, nullptr),
+      SQLITE_OK);
+  const std::string stored = *CanonicalPath(p.paths[1]);
+  const std::string renamed = stored + "\xfe";
+  sqlite3_bind_text(update, 1, renamed.data(), static_cast<int>(renamed.size()), SQLITE_STATIC);
+  sqlite3_bind_text(update, 2, stored.data(), static_cast<int>(stored.size()), SQLITE_STATIC);
+  EXPECT_EQ(sqlite3_step(update), SQLITE_DONE);
+  EXPECT_EQ(sqlite3_changes(db), 1);
+  sqlite3_finalize(update);
+  ASSERT_TRUE(w.start()) << w.log();
+  EXPECT_EQ(World::Identifiers(w.match()), "com.example.travel0") << w.log();
+  EXPECT_NE(w.log().find("ignoring mis-configured plug-in at " + stored + "\\xFE"),
+            std::string::npos)
+      << w.log();
+  EXPECT_TRUE(IsValidUtf8(w.log())) << w.log();
 }
 
 // ---------------------------------------------------------------- load
