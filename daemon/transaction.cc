@@ -363,7 +363,9 @@ void Transaction::accessPlugIns() {
   Sandbox* sandbox = server().options().database.plugInServices.sandbox;
   bool walked = processUuidList([&](const DRDPlugInPtr& p) {
     const std::string path = p->path().value_or("");
-    std::optional<std::string> token = issueReadExtensionForURL(sandbox, path);
+    // The bundle as registered: a folder swapped for a link since then is
+    // refused (EACCES), not followed to wherever the link points.
+    std::optional<std::string> token = issueReadExtensionForURL(sandbox, path, path);
     if (!token) {
       failMessage(kErrorMalformed, Format("cannot create extension to %@: %d", path, errno));
       return false;

@@ -103,4 +103,11 @@ class FileSystemWrapper : public FileSystem {
 // back to realpath. Errors: kPosixErrorDomain with the errno of the lookup.
 Result<std::string> CanonicalPath(const std::string& path);
 
+// The canonical path of `path` when it is `root` or lies inside it, where
+// `root` is itself canonical (say a bundle's path as it was registered).
+// Errors: EACCES (kPosixErrorDomain) when `path` resolves anywhere else, as
+// a name such as "../x" does, or any path after a folder on the way was
+// swapped for a symbolic link; otherwise as CanonicalPath.
+Result<std::string> CanonicalPathWithin(const std::string& path, const std::string& root);
+
 }  // namespace dr

@@ -256,6 +256,16 @@ Result<std::string> CanonicalPath(const std::string& path) {
   return std::string(resolved.get());
 }
 
+Result<std::string> CanonicalPathWithin(const std::string& path, const std::string& root) {
+  Result<std::string> resolved = CanonicalPath(path);
+  if (!resolved.ok()) return resolved;
+  const std::string& r = *resolved;
+  const bool within = r == root || (r.starts_with(root) && r.size() > root.size() &&
+                                    (r[root.size()] == '/' || root == "/"));
+  if (!within) return PosixError(EACCES, "outside " + root + ": " + path);
+  return resolved;
+}
+
 FileSystem* FileSystem::Default() {
   static LinuxFileSystem* fs = new LinuxFileSystem();
   return fs;

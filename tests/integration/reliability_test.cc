@@ -554,6 +554,24 @@ TEST(ReliabilityTest, PlugInThatCannotTravelNeverBreaksDiscovery) {
   EXPECT_TRUE(IsValidUtf8(w.log())) << w.log();
 }
 
+// The folder of a registered bundle swapped for a link to /etc: "access"
+// refuses it (EACCES) rather than sign /etc, and forms carry no token for it.
+TEST(ReliabilityTest, AccessRefusesABundleFolderSwappedForALink) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "swap", 1);
+  const std::string registered = w.everything().at(0)["path"].stringValue();
+  std::filesystem::rename(registered, registered + ".moved");
+  ASSERT_EQ(::symlink("/etc", registered.c_str()), 0);
+
+  Value reply = w.call(Request("access", {{"uuids", Value(Array{p.uuids[0]})}}));
+  EXPECT_EQ(ErrorCode(reply), 4u);
+  EXPECT_EQ(ErrorText(reply), "cannot create extension to " + registered + ": 13");
+  const Value forms = w.everything();
+  ASSERT_EQ(forms.size(), 1u);
+  EXPECT_EQ(forms.at(0)["extensions"].size(), 0u) << forms.description();
+}
+
 // ---------------------------------------------------------------- load
 
 struct Tally {
