@@ -4,7 +4,9 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <poll.h>
+#include <sched.h>
 #include <signal.h>
+#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -570,6 +572,48 @@ TEST(ReliabilityTest, AccessRefusesABundleFolderSwappedForALink) {
   const Value forms = w.everything();
   ASSERT_EQ(forms.size(), 1u);
   EXPECT_EQ(forms.at(0)["extensions"].size(), 0u) << forms.description();
+}
+
+// A full disk when an annotation is saved: the request is answered and the
+// change kept in memory, and once there is room again the save is retried
+// without any further change, so the change survives a crash. The state
+// folder is a 64 KiB tmpfs in a mount namespace of this test process (and so
+// of the drd it starts); the mount goes with the process.
+TEST(ReliabilityTest, AnnotationSavedOnceTheFullDiskHasRoom) {
+  World w;
+  const std::string state = w.path("state");
+  std::filesystem::create_directories(state);
+  if (::unshare(CLONE_NEWNS) != 0 ||
+      ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      ::mount("tmpfs", state.c_str(), "tmpfs", 0, "size=64k,mode=0700") != 0) {
+    GTEST_SKIP() << "no private tmpfs (unshare or mount not permitted): " << std::strerror(errno);
+  }
+  struct Unmount {
+    std::string path;
+    ~Unmount() { ::umount2(path.c_str(), MNT_DETACH); }
+  } unmount{state};
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "full", 1);  // also makes the sandbox key
+  const std::string filler = state + "/filler";
+  {
+    std::ofstream out(filler, std::ios::binary);
+    const std::string block(4096, 'x');
+    for (int i = 0; i < 64 && out.write(block.data(), block.size()); ++i) out.flush();
+  }
+  Value reply = w.call(Request(
+      "annotate", {{"annotations", Value{{"election", 1}}}, {"uuids", Value(Array{p.uuids[0]})}}));
+  EXPECT_EQ(ErrorCode(reply), 0u) << ErrorText(reply);
+  EXPECT_NE(w.log().find("unable to save annotations:"), std::string::npos) << w.log();
+  EXPECT_EQ(w.match().at(0)["annotations"]["election"].intValue(), 1);
+
+  std::filesystem::remove(filler);
+  const std::string saved = "saved annotations:" + AnnotationFile(w) + " after ";
+  for (int i = 0; i < 300 && w.log().find(saved) == std::string::npos; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));  // a hang guard
+  }
+  EXPECT_NE(w.log().find(saved), std::string::npos) << w.log();
+  ASSERT_TRUE(w.kill9()) << w.log();
+  EXPECT_EQ(w.match().at(0)["annotations"]["election"].intValue(), 1) << w.log();
 }
 
 // ---------------------------------------------------------------- load
