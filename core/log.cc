@@ -4,6 +4,8 @@
 
 #include <cerrno>
 
+#include "core/utf8.h"
+
 namespace dr {
 namespace {
 
@@ -35,17 +37,19 @@ void WriteToStderr(std::string_view line) {
 }  // namespace
 
 void SystemLogLine(std::string_view text) {
+  // Every line is one line of UTF-8, whatever bytes a path or a peer put in
+  // it: line breaks are written as \n and \r, and bytes that are not UTF-8
+  // as \xNN.
   std::string line;
   line.reserve(text.size());
-  for (char c : text) {
-    if (c == '\n') {
-      line += "\\n";
-    } else if (c == '\r') {
-      line += "\\r";
-    } else {
-      line += c;
-    }
+  size_t plain = 0;  // start of the run not yet copied
+  for (size_t i = 0; i < text.size(); ++i) {
+    if (text[i] != '\n' && text[i] != '\r') continue;
+    AppendEscapingInvalidUtf8(line, text.substr(plain, i - plain));
+    line += text[i] == '\n' ? "\\n" : "\\r";
+    plain = i + 1;
   }
+  AppendEscapingInvalidUtf8(line, text.substr(plain));
   std::lock_guard<std::mutex> lock(SinkMutex());
   if (CurrentSink()) {
     CurrentSink()(line);

@@ -1,7 +1,8 @@
 // The system log: one line per message on standard error (journald adds the
 // time and process under systemd). A message is never split over lines: line
-// breaks inside a formatted text are written as "\n". Lines from several
-// threads never interleave. Tests may install a sink that captures lines.
+// breaks inside a formatted text are written as "\n", and every line is
+// UTF-8: a byte that is not (from a path, say) is written as "\xNN". Lines
+// from several threads never interleave. Tests may install a sink that captures lines.
 #pragma once
 
 #include <functional>

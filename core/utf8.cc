@@ -39,4 +39,28 @@ bool IsValidUtf8(std::string_view text) {
   return true;
 }
 
+void AppendEscapingInvalidUtf8(std::string& out, std::string_view text) {
+  static constexpr char kHex[] = "0123456789ABCDEF";
+  size_t valid = 0;  // start of the well-formed run not yet copied
+  size_t i = 0;
+  while (i < text.size()) {
+    if (DecodeUtf8(text, i)) continue;
+    out.append(text.substr(valid, i - valid));
+    const auto byte = static_cast<unsigned char>(text[i++]);
+    out += "\\x";
+    out += kHex[byte >> 4];
+    out += kHex[byte & 0xF];
+    valid = i;
+  }
+  out.append(text.substr(valid));
+}
+
+std::string EscapeInvalidUtf8(std::string_view text) {
+  if (IsValidUtf8(text)) return std::string(text);
+  std::string out;
+  out.reserve(text.size() + 16);
+  AppendEscapingInvalidUtf8(out, text);
+  return out;
+}
+
 }  // namespace dr

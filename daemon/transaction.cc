@@ -9,6 +9,7 @@
 
 #include "core/format.h"
 #include "core/log.h"
+#include "core/utf8.h"
 #include "daemon/discovery.h"
 #include "daemon/ipc_client.h"
 #include "daemon/server.h"
@@ -197,15 +198,17 @@ void Transaction::done() {
     server().log("unable to reply to client %d: %@", client_->pid(), sent);
     // A reply the wire cannot carry (nested too deeply or too large, say
     // from a plug-in's own dictionaries) still answers the request.
-    c->sendReply(request_.serial,
-                 Value{{kErrorCodeKey, Value(kErrorMalformed)},
-                       {kErrorKey, Value(Format("reply cannot be sent: %@", sent))}});
+    c->sendReply(
+        request_.serial,
+        Value{{kErrorCodeKey, Value(kErrorMalformed)},
+              {kErrorKey, Value(EscapeInvalidUtf8(Format("reply cannot be sent: %@", sent)))}});
   }
 }
 
 void Transaction::failMessage(uint64_t code, std::string_view message) {
   setReplyValue(kErrorCodeKey, Value(code));
-  setReplyValue(kErrorKey, Value(message));
+  // A path in the text may hold any bytes; the reply must be UTF-8.
+  setReplyValue(kErrorKey, Value(EscapeInvalidUtf8(message)));
   done();
 }
 
@@ -360,7 +363,9 @@ void Transaction::accessPlugIns() {
   Sandbox* sandbox = server().options().database.plugInServices.sandbox;
   bool walked = processUuidList([&](const DRDPlugInPtr& p) {
     const std::string path = p->path().value_or("");
-    std::optional<std::string> token = issueReadExtensionForURL(sandbox, path);
+    // The bundle as registered: a folder swapped for a link since then is
+    // refused (EACCES), not followed to wherever the link points.
+    std::optional<std::string> token = issueReadExtensionForURL(sandbox, path, path);
     if (!token) {
       failMessage(kErrorMalformed, Format("cannot create extension to %@: %d", path, errno));
       return false;

@@ -5,9 +5,11 @@
 
 #include "core/format.h"
 #include "core/log.h"
+#include "core/utf8.h"
 #include "model/plugin_core.h"
 #include "model/plugin_keys.h"
 #include "platform/pdoc.h"
+#include "platform/registry.h"
 
 namespace dr {
 void DRPlugInCore::resolveSDK(ServiceManager* serviceManager) {
@@ -95,12 +97,22 @@ std::optional<Error> DRPlugInCore::diagnose() {
                                  missing);
   }
   // The form's "bundleInfo" is one level below the form (and "info", the
-  // plug-in dictionary, is within it).
-  if (size_t depth = bundleInfoDictionary().depth(); depth > kMaxFormDepth - 1) {
-    return DRMakeErrorWithFormat(
-        kDRErrorInvalidPlugIn,
-        "Info.pdoc and SDK nest %@ levels deep, more than the %@ a reply can carry", depth,
-        kMaxFormDepth - 1);
+  // plug-in dictionary, is within it). A dictionary nested deeper than a
+  // reply can carry it, or text a reply cannot carry (stored by an older
+  // drd, or from the SDK), would make every reply carrying the form fail,
+  // for every host.
+  static_assert(kMaxTravellingDepth == kMaxFormDepth - 1);
+  if (std::optional<std::string> why = WhyCannotTravel(bundleInfoDictionary())) {
+    return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn,
+                                 "Info.pdoc and SDK cannot be carried in a reply: %@", *why);
+  }
+  for (const std::optional<std::string>& text :
+       {url(), containingUrl(), localizedName(), localizedShortName(), localizedContainingName()}) {
+    if (text && !TextCanTravel(*text)) {
+      return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn,
+                                   "its path or a name is not UTF-8 or holds NUL: \"%@\"",
+                                   EscapeInvalidUtf8(*text));
+    }
   }
   return std::nullopt;
 }

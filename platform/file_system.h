@@ -30,6 +30,9 @@ class FileSystem {
 
   // The whole contents of the file at `path`. Files larger than `maxBytes`
   // are refused (kFileReadError), so a hostile file cannot exhaust memory.
+  // Only regular files are read, and opening never waits: a folder, FIFO,
+  // socket or device reads as a missing file (kFileReadNoSuchFileError), so
+  // a FIFO put where a file belongs cannot stall the reader.
   virtual Result<std::string> readFile(const std::string& path,
                                        size_t maxBytes = kDefaultMaxRead) = 0;
 
@@ -99,5 +102,12 @@ class FileSystemWrapper : public FileSystem {
 // when /proc cannot tell (not mounted, a file deleted meanwhile) it falls
 // back to realpath. Errors: kPosixErrorDomain with the errno of the lookup.
 Result<std::string> CanonicalPath(const std::string& path);
+
+// The canonical path of `path` when it is `root` or lies inside it, where
+// `root` is itself canonical (say a bundle's path as it was registered).
+// Errors: EACCES (kPosixErrorDomain) when `path` resolves anywhere else, as
+// a name such as "../x" does, or any path after a folder on the way was
+// swapped for a symbolic link; otherwise as CanonicalPath.
+Result<std::string> CanonicalPathWithin(const std::string& path, const std::string& root);
 
 }  // namespace dr

@@ -88,16 +88,25 @@ Status Replace(const std::string& path, std::string_view bytes, mode_t mode, boo
 class LinuxFileSystem final : public FileSystem {
  public:
   Result<std::string> readFile(const std::string& path, size_t maxBytes) override {
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    // Without blocking: opening a FIFO for reading would otherwise wait for
+    // a writer, and with it every request behind this read.
+    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
     if (fd < 0) {
       int e = errno;
       return FileError(e == ENOENT ? kFileReadNoSuchFileError : kFileReadError, e, "open " + path);
     }
     struct stat st;
-    if (::fstat(fd, &st) != 0 || S_ISDIR(st.st_mode)) {
-      int e = S_ISDIR(st.st_mode) ? EISDIR : errno;
+    if (::fstat(fd, &st) != 0) {
+      int e = errno;
       ::close(fd);
       return FileError(kFileReadError, e, "read " + path);
+    }
+    if (!S_ISREG(st.st_mode)) {
+      // A folder, FIFO, socket or device is no file of drd's to read: for
+      // every reader it is as if the file were missing.
+      ::close(fd);
+      return Error(kFileErrorDomain, kFileReadNoSuchFileError,
+                   "read " + path + ": not a regular file");
     }
     std::string out;
     char buf[65536];
@@ -245,6 +254,16 @@ Result<std::string> CanonicalPath(const std::string& path) {
                                                        &std::free);
   if (!resolved) return PosixError(errno, "realpath " + path);
   return std::string(resolved.get());
+}
+
+Result<std::string> CanonicalPathWithin(const std::string& path, const std::string& root) {
+  Result<std::string> resolved = CanonicalPath(path);
+  if (!resolved.ok()) return resolved;
+  const std::string& r = *resolved;
+  const bool within = r == root || (r.starts_with(root) && r.size() > root.size() &&
+                                    (r[root.size()] == '/' || root == "/"));
+  if (!within) return PosixError(EACCES, "outside " + root + ": " + path);
+  return resolved;
 }
 
 FileSystem* FileSystem::Default() {

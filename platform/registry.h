@@ -14,10 +14,12 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "core/status.h"
 #include "core/value.h"
+#include "platform/drm1.h"
 #include "platform/file_system.h"
 
 namespace dr {
@@ -36,6 +38,20 @@ inline constexpr int64_t kRegistryBusy = 3;
 inline constexpr int64_t kRegistryCorrupt = 4;
 // Any other failure of the database (I/O, full disk, a newer schema, ...).
 inline constexpr int64_t kRegistryStorage = 5;
+
+// What the registry holds must be able to travel in a reply: a bundle whose
+// path, dictionaries or names could not is refused (kRegistryRefused), since
+// a reply carrying it could not be sent and every host's discovery would fail
+// with it. A plug-in's information dictionary travels inside its form, at the
+// fourth of the levels a message may nest (the reply, its "matches", the
+// form, the dictionary), so it may nest this deep (as Value::depth counts).
+inline constexpr size_t kMaxTravellingDepth = drm1::kMaxDepth - 3;
+// Whether `text` can travel in a message: UTF-8 without NUL.
+bool TextCanTravel(std::string_view text);
+// Why `value` could not travel inside a plug-in's form (a string or key that
+// is not UTF-8 or holds NUL, or nesting deeper than kMaxTravellingDepth), or
+// nothing when it can.
+std::optional<std::string> WhyCannotTravel(const Value& value);
 
 // The application that contains a plug-in bundle: the nearest enclosing
 // "*.app" folder whose Contents/PlugIns/ holds the bundle.

@@ -1,17 +1,62 @@
-// Registry entries, their lazily parsed dictionaries, and the registry's
-// options from the environment.
+// Registry entries, their lazily parsed dictionaries, what may travel in a
+// reply, and the registry's options from the environment.
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <vector>
 
 #include "core/format.h"
+#include "core/utf8.h"
 #include "platform/locations.h"
 #include "platform/registry.h"
 #include "platform/registry_cache.h"
 #include "platform/registry_scan.h"
 
 namespace dr {
+namespace {
+
+// The first string or key of `value` that cannot travel, or nesting past
+// `levelsLeft`; `value` itself takes one level when it is a collection.
+std::optional<std::string> FirstUntravelable(const Value& value, size_t levelsLeft) {
+  auto text = [](std::string_view t) -> std::optional<std::string> {
+    if (TextCanTravel(t)) return std::nullopt;
+    return Format("the text \"%@\" is not UTF-8 or holds NUL", EscapeInvalidUtf8(t));
+  };
+  if (value.isString()) return text(value.stringValue());
+  if (!value.isArray() && !value.isDictionary()) return std::nullopt;
+  if (levelsLeft == 0) {
+    return Format("it nests deeper than the %@ levels a reply can carry", kMaxTravellingDepth);
+  }
+  if (value.isArray()) {
+    for (const Value& element : value.array()) {
+      if (auto why = FirstUntravelable(element, levelsLeft - 1)) return why;
+    }
+    return std::nullopt;
+  }
+  for (const auto& [key, element] : value.dictionary()) {
+    if (auto why = text(key.view())) return why;
+    if (auto why = FirstUntravelable(element, levelsLeft - 1)) return why;
+  }
+  return std::nullopt;
+}
+
+}  // namespace
+
+bool TextCanTravel(std::string_view text) {
+  if (std::memchr(text.data(), '\0', text.size()) != nullptr) return false;
+  // Most text is ASCII: skip it eight bytes at a time.
+  size_t i = 0;
+  for (uint64_t word; i + 8 <= text.size(); i += 8) {
+    std::memcpy(&word, text.data() + i, 8);
+    if (word & 0x8080808080808080u) break;
+  }
+  return IsValidUtf8(text.substr(i));
+}
+
+std::optional<std::string> WhyCannotTravel(const Value& value) {
+  return FirstUntravelable(value, kMaxTravellingDepth);
+}
 
 RegistryBundleFiles::RegistryBundleFiles(std::string infoBytes,
                                          std::optional<std::string> entitlementsBytes)

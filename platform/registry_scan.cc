@@ -218,6 +218,7 @@ Result<ScannedBundle> ScanBundle(const std::string& url,
     return Refused(url, PosixError(errno, "stat").localizedDescription());
   }
   if (!S_ISDIR(st.st_mode)) return Refused(url, "not a plug-in bundle (not a folder)");
+  if (!TextCanTravel(*path)) return Refused(url, Format("its path \"%@\" is not UTF-8", *path));
 
   ScannedBundle out;
   out.path = *path;
@@ -230,6 +231,14 @@ Result<ScannedBundle> ScanBundle(const std::string& url,
       ReadDictionaryFile(url, out.path, kEntitlementsFile, false, fs, &entitlements);
   if (!entitlementsBytes) return entitlementsBytes.error();
   out.entitlementsBytes = std::move(*entitlementsBytes);
+
+  // Checked on the parsed values: a JSON file may spell a NUL as an escape.
+  for (const auto& [name, dictionary] :
+       {std::pair{kInfoFile, &info}, std::pair{kEntitlementsFile, &entitlements}}) {
+    if (auto why = WhyCannotTravel(*dictionary)) {
+      return Refused(url, Format("%@ cannot be carried in a reply: %@", name, *why));
+    }
+  }
 
   bool oldStyle = false;
   const Value& top = TopOf(info, &oldStyle);
@@ -250,6 +259,11 @@ Result<ScannedBundle> ScanBundle(const std::string& url,
     if (LiesUnder(out.path, root)) out.onSystemVolume = true;
   }
   out.containingApplication = ContainingApplicationOf(out.path, fs);
+  if (const auto& app = out.containingApplication;
+      app && app->displayName && !TextCanTravel(*app->displayName)) {
+    return Refused(url,
+                   Format("the name of its application %@ is not UTF-8 or holds NUL", app->url));
+  }
   // What the files read as now is what their stored bytes read as later.
   if (!entitlements.isPresent()) entitlements = Value::EmptyDictionary();
   out.parsed = ParsedFiles{std::move(info), std::move(entitlements)};

@@ -133,7 +133,8 @@ std::string ParentOf(const std::string& path) {
 
 // Reads and checks the key file.
 Result<MacKey> ReadKey(const std::string& path) {
-  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  // Without blocking: a FIFO in its place is refused below, not waited on.
+  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
   if (fd < 0) return PosixError(errno, "open " + path);
   struct stat st;
   if (::fstat(fd, &st) != 0) {

@@ -1,4 +1,5 @@
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -30,9 +31,18 @@ class FileUsageReports final : public UsageReports {
     }
     line += '\n';
     const std::string& path = *options_.logPath;
-    int fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0600);
+    // Without blocking, and only to a regular file: a FIFO in its place
+    // (with no reader, or one that never reads) must not stall the caller.
+    int fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NONBLOCK | O_NOCTTY,
+                    0600);
     if (fd < 0) {
       SystemLog("cannot append usage report to %@: %@", path, PosixError(errno, "open"));
+      return;
+    }
+    struct stat st;
+    if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+      ::close(fd);
+      SystemLog("cannot append usage report to %@: not a regular file", path);
       return;
     }
     // One write: with O_APPEND the kernel places the whole line at the end

@@ -49,14 +49,6 @@ std::vector<std::string> ResourceNames(const Value& resources) {
   return names;
 }
 
-// Whether the canonical path `resolved` is the bundle at the canonical path
-// `bundle` or lies inside it. A plug-in names its resources, so a name such as
-// "../../.ssh" must not win hosts a token for a file outside its bundle.
-bool WithinBundle(std::string_view resolved, std::string_view bundle) {
-  return resolved == bundle || (resolved.starts_with(bundle) && resolved.size() > bundle.size() &&
-                                resolved[bundle.size()] == '/');
-}
-
 }  // namespace
 
 std::shared_ptr<DRDPlugIn> DRDPlugIn::initWithRGData(const RegistryEntryPtr& entry,
@@ -109,20 +101,16 @@ void DRDPlugIn::augmentForm(Dictionary& form) const {
 Value DRDPlugIn::issueResourceExtensions(const Value& resources) const {
   Dictionary tokens;
   const std::string bundlePath = url().value_or(std::string());
-  std::optional<Result<std::string>> bundle;  // canonical, found when first needed
   for (const std::string& name : ResourceNames(resources)) {
     std::string path = name == kAppExtensionSharedPath ? bundlePath : bundlePath + "/" + name;
     int errnum = ENOSYS;  // no sandbox service: nothing can be issued
     if (services_.sandbox != nullptr) {
       // Resolved once: the path checked is the path granted, even if a link
-      // in it changes meanwhile.
-      Result<std::string> resolved = CanonicalPath(path);
-      if (resolved.ok() && path != bundlePath) {
-        if (!bundle) bundle = CanonicalPath(bundlePath);
-        if (!bundle->ok() || !WithinBundle(*resolved, **bundle)) {
-          resolved = PosixError(EACCES, "outside its bundle " + path);
-        }
-      }
+      // in it changes meanwhile. A plug-in names its resources, so a name
+      // such as "../../.ssh" must not win hosts a token for a file outside
+      // its bundle, nor may the bundle itself once its folder was swapped
+      // for a link since it was registered (under its canonical path).
+      Result<std::string> resolved = CanonicalPathWithin(path, bundlePath);
       Result<std::string> token = resolved.ok()
                                       ? services_.sandbox->issueFileExtension(
                                             kReadOnlyFileExtensionClass, *resolved, /*flags=*/0)

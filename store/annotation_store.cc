@@ -74,6 +74,15 @@ Result<std::string> UserStateDirectory(const EnvironmentLookup& getenv) {
 DRDAnnotationStore::DRDAnnotationStore(AnnotationStoreOptions options)
     : options_(std::move(options)) {}
 
+DRDAnnotationStore::~DRDAnnotationStore() {
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    stopping_ = true;
+  }
+  retryWake_.notify_all();
+  if (retryThread_.joinable()) retryThread_.join();
+}
+
 std::string DRDAnnotationStore::defaultDatabaseURL(const AnnotationStoreOptions& options) {
   Result<std::string> user = UserStateDirectory(options.getenv);
   if (!user) {
@@ -143,6 +152,7 @@ Status DRDAnnotationStore::loadDb() {
 }
 
 void DRDAnnotationStore::setAnnotations(Dictionary table) {
+  std::lock_guard<std::mutex> lock(mu_);
   annotations_ = std::move(table);
   entryXml_.clear();
   entryXmlValid_ = false;
@@ -165,6 +175,11 @@ void DRDAnnotationStore::updateEntryXml(const std::string& key) {
 }
 
 Status DRDAnnotationStore::saveDb() {
+  std::lock_guard<std::mutex> lock(mu_);
+  return save();
+}
+
+Status DRDAnnotationStore::save() {
   if (!entryXmlValid_) {
     entryXml_.clear();
     bool written = true;
@@ -203,6 +218,7 @@ Value DRDAnnotationStore::annotationForPlugIn(const DRDPlugIn& plugIn) const {
 }
 
 void DRDAnnotationStore::setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& plugIn) {
+  std::lock_guard<std::mutex> lock(mu_);
   std::string key = plugIn.annotationKey();
   auto stored = annotations_.find(key);
   if (annotation.isAbsent()) {
@@ -227,8 +243,44 @@ void DRDAnnotationStore::setAnnotationForPlugIn(const Value& annotation, const D
     annotations_[key] = Value(std::move(merged));
   }
   updateEntryXml(key);
-  if (Status saved = saveDb(); !saved.ok()) {
-    SystemLog("unable to save annotations:%@ error:%@", annotationsURL_, saved.error());
+  saveKeepingCount(/*logFailure=*/true);
+}
+
+void DRDAnnotationStore::saveKeepingCount(bool logFailure) {
+  if (Status saved = save(); !saved.ok()) {
+    if (logFailure) {
+      SystemLog("unable to save annotations:%@ error:%@", annotationsURL_, saved.error());
+    }
+    ++failedSaves_;
+    unsaved_ = true;
+    lastFailure_ = std::chrono::steady_clock::now();
+    if (!retryThread_.joinable()) retryThread_ = std::thread([this] { retrySaves(); });
+    retryWake_.notify_all();
+    return;
+  }
+  if (failedSaves_ > 0) {
+    SystemLog("saved annotations:%@ after %u failed attempts", annotationsURL_, failedSaves_);
+  }
+  failedSaves_ = 0;
+  unsaved_ = false;
+}
+
+void DRDAnnotationStore::retrySaves() {
+  std::unique_lock<std::mutex> lock(mu_);
+  while (!stopping_) {
+    if (!unsaved_) {
+      retryWake_.wait(lock);
+      continue;
+    }
+    // A change meanwhile saves (or fails, and so restarts the wait) by itself.
+    const auto due = lastFailure_ + options_.saveRetryInterval;
+    if (std::chrono::steady_clock::now() < due) {
+      retryWake_.wait_until(lock, due);
+      continue;
+    }
+    // Retries fail quietly: the failure that armed them was logged, and a
+    // full disk would otherwise fill the log too.
+    saveKeepingCount(/*logFailure=*/false);
   }
 }
 

@@ -7,7 +7,10 @@
 // two threads at once. The file is read once, at construction; from then on
 // memory is the truth. Failures never reach the caller: a file that cannot be
 // loaded leaves an empty table (logged unless the file is simply missing), a
-// save that fails is logged and the table in memory keeps the change. Only
+// save that fails is logged and the table in memory keeps the change; the
+// save is then tried again at the next change and on a timer, on a thread of
+// the store's own, until it succeeds, which is logged too (so a change made
+// while the disk was full is not lost to a crash once there is room). Only
 // the start-up errors of the default location (no user state folder, the
 // annotation folder cannot be made) stop the process.
 //
@@ -24,12 +27,16 @@
 
 #include <sys/types.h>
 
+#include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <thread>
 
 #include "core/status.h"
 #include "core/value.h"
@@ -53,6 +60,9 @@ struct AnnotationStoreOptions {
   // logged, in place of std::abort(). Must not return; if it does, the
   // process is aborted all the same.
   std::function<void(std::string_view message)> onFatal;
+  // How long after a failed save it is tried again (and again, until it
+  // succeeds) when no change comes first.
+  std::chrono::milliseconds saveRetryInterval{std::chrono::seconds(5)};
 };
 
 class DRDAnnotationStore {
@@ -81,6 +91,7 @@ class DRDAnnotationStore {
   // directory:%@ error:%@" when the folder cannot be made.
   static std::string defaultDatabaseURL(const AnnotationStoreOptions& options);
 
+  ~DRDAnnotationStore();
   DRDAnnotationStore(const DRDAnnotationStore&) = delete;
   DRDAnnotationStore& operator=(const DRDAnnotationStore&) = delete;
 
@@ -92,7 +103,8 @@ class DRDAnnotationStore {
   // or erases that annotation when `annotation` is absent, then saves the
   // whole table. A changed "election" is reported as "Enabled" (1) or
   // "Disabled" (any other value) when the plug-in names its extension point.
-  // A failed save is logged; the change stays in memory either way.
+  // A failed save is logged and retried; the change stays in memory either
+  // way.
   void setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& plugIn);
 
   // Replaces the table with the contents of the annotation file. On failure
@@ -100,6 +112,10 @@ class DRDAnnotationStore {
   Status loadDb();
   // Writes the whole table to the annotation file, atomically and durably.
   Status saveDb();
+
+  // The table's readers (annotationForPlugIn, annotations) take no lock: the
+  // retry thread only reads the table, and every change of it comes from
+  // the store's one owner.
 
   const std::string& annotationsURL() const { return annotationsURL_; }
   void setAnnotationsURL(std::string url) { annotationsURL_ = std::move(url); }
@@ -112,6 +128,13 @@ class DRDAnnotationStore {
 
   // Brings the kept text of the entry under `key` in step with the table.
   void updateEntryXml(const std::string& key);
+  // saveDb. REQUIRES: mu_ held.
+  Status save();
+  // Saves and keeps count: a failure is logged when `logFailure`, and arms
+  // the retry; the first success after failures is logged. REQUIRES: mu_.
+  void saveKeepingCount(bool logFailure);
+  // The retry thread: saves again every saveRetryInterval while unsaved_.
+  void retrySaves();
 
   AnnotationStoreOptions options_;
   std::string annotationsURL_;
@@ -121,6 +144,16 @@ class DRDAnnotationStore {
   // the next save writes the whole table (and its errors) as before.
   std::map<std::string, std::string, std::less<>> entryXml_;
   bool entryXmlValid_ = false;
+
+  // Guards the saves (entryXml_ and the state below) against the retry
+  // thread; changes of the table hold it too.
+  std::mutex mu_;
+  std::condition_variable retryWake_;
+  std::thread retryThread_;  // started at the first failed save
+  bool unsaved_ = false;     // the file lags behind the table
+  bool stopping_ = false;
+  size_t failedSaves_ = 0;  // since the last successful save
+  std::chrono::steady_clock::time_point lastFailure_;
 };
 
 }  // namespace dr

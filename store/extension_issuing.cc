@@ -2,11 +2,17 @@
 
 #include <cerrno>
 
+#include "platform/file_system.h"
+
 namespace dr {
 
-std::optional<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path) {
+std::optional<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path,
+                                                    const std::string& bundle) {
+  Result<std::string> resolved = CanonicalPathWithin(path, bundle);
   Result<std::string> token =
-      sandbox->issueFileExtension(kReadOnlyFileExtensionClass, path, kExtensionCanonicalPath);
+      resolved.ok() ? sandbox->issueFileExtension(kReadOnlyFileExtensionClass, *resolved,
+                                                  /*flags=*/0)
+                    : Result<std::string>(resolved.error());
   if (!token.ok()) {
     const Error& e = token.error();
     errno = e.domain() == kPosixErrorDomain ? static_cast<int>(e.code()) : EINVAL;

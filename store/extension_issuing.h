@@ -13,8 +13,12 @@
 namespace dr {
 
 // A token that grants reading the canonical form of `path` (the path of a
-// file URL, UTF-8), or nothing with errno set: a path that does not exist
-// fails with ENOENT, as resolving it does.
-std::optional<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path);
+// file URL, UTF-8), which must be the bundle at `bundle` (its canonical path
+// as registered) or lie inside it; or nothing with errno set: ENOENT for a
+// path that does not exist, EACCES for one that resolves outside the bundle,
+// as every path of a bundle does once its folder is swapped for a symbolic
+// link. The token names the path that was checked, resolved once.
+std::optional<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path,
+                                                    const std::string& bundle);
 
 }  // namespace dr

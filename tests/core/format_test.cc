@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include "core/log.h"
+
 #include <memory>
 #include <optional>
 
@@ -49,6 +51,27 @@ TEST(FormatTest, RendersEachConversion) {
       {Format("trailing %"), "trailing %"},
   };
   for (const Row& r : rows) EXPECT_EQ(r.got, r.expected);
+}
+
+// Whatever bytes a message holds (a path of any bytes, say), the log gets
+// one line of UTF-8.
+TEST(FormatTest, LogLinesAreOneLineOfUtf8) {
+  const struct {
+    std::string text, line;
+  } rows[] = {
+      {"plain é ✓ 𝄞", "plain é ✓ 𝄞"},
+      {"a\nb\rc", "a\\nb\\rc"},
+      {"at /x\xff\xfe/y", "at /x\\xFF\\xFE/y"},
+      {"cut \xc3", "cut \\xC3"},
+      {"overlong \xc0\xaf", "overlong \\xC0\\xAF"},
+      {"surrogate \xed\xa0\x80.", "surrogate \\xED\\xA0\\x80."},
+      {"\xf4\x90\x80\x80\n\xff", "\\xF4\\x90\\x80\\x80\\n\\xFF"},
+  };
+  for (const auto& row : rows) {
+    ScopedLogCapture log;
+    SystemLogLine(row.text);
+    EXPECT_EQ(log.lines(), std::vector<std::string>{row.line}) << row.line;
+  }
 }
 
 }  // namespace

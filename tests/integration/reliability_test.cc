@@ -4,7 +4,9 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <poll.h>
+#include <sched.h>
 #include <signal.h>
+#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -29,7 +31,9 @@
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 
+#include "core/utf8.h"
 #include "platform/drm1.h"
+#include "platform/file_system.h"
 #include "platform/pdoc.h"
 #include "platform/preferences.h"
 #include "platform/sandbox.h"
@@ -451,6 +455,165 @@ TEST(ReliabilityTest, GarbageFilesDoNotStopDrd) {
     EXPECT_EQ(ErrorCode(reply), 0u) << "row " << n << ": " << ErrorText(reply);
     ASSERT_TRUE(Alive(w.drd().pid())) << "row " << n << "\n" << w.log();
   }
+}
+
+// ---------------------------------------------------------------- hostile files
+
+// The reply to `request` on a fresh connection, or nothing when none came
+// within two seconds: a hang guard for requests stuck behind another's.
+std::optional<Value> AnsweredPromptly(World& w, const Value& request) {
+  Drm1Peer peer(w.drd().socketPath());
+  if (!peer.send(1, request)) return std::nullopt;
+  std::optional<drm1::Frame> frame = peer.receive(std::chrono::seconds(2));
+  if (!frame) return std::nullopt;
+  return frame->body;
+}
+
+// A FIFO where a bundle file belongs, which nobody ever opens for writing:
+// registering it is refused as if the file were missing, a peer running
+// from a bundle whose entitlements are one is served as one without, and
+// meanwhile every other client is answered.
+TEST(ReliabilityTest, FifoInPlaceOfABundleFileStallsNobody) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "fifo", 1);
+  const std::string bundle = w.path("system/fifo.appex");
+  std::filesystem::create_directories(bundle + "/Contents");
+  ASSERT_EQ(::mkfifo((bundle + "/Contents/Info.pdoc").c_str(), 0600), 0);
+  const std::string app = w.makeApp("Fifo.app", "com.example.fifohost");
+  std::filesystem::remove(app + "/Contents/Entitlements.pdoc");
+  ASSERT_EQ(::mkfifo((app + "/Contents/Entitlements.pdoc").c_str(), 0600), 0);
+
+  Drm1Peer adder(w.drd().socketPath());
+  ASSERT_TRUE(adder.send(1, Request("add", {{"paths", Value(Array{Value(bundle)})}})));
+  const std::unique_ptr<HostApp> host = w.host("Fifo.app");
+  for (const Value& request :
+       {Request("match"), Request("access", {{"uuids", Value(Array{p.uuids[0]})}})}) {
+    std::optional<Value> reply = AnsweredPromptly(w, request);
+    ASSERT_TRUE(reply) << request.description() << " got no answer\n" << w.log();
+    EXPECT_EQ(ErrorCode(*reply), 0u) << ErrorText(*reply);
+  }
+  std::optional<drm1::Frame> added = adder.receive(std::chrono::seconds(2));
+  ASSERT_TRUE(added) << "\"add\" got no answer\n" << w.log();
+  EXPECT_EQ(ErrorCode(added->body), 2u) << ErrorText(added->body);
+  EXPECT_NE(w.log().find("(no Contents/Info.pdoc)"), std::string::npos) << w.log();
+  EXPECT_EQ(World::Identifiers(w.match(Value(), 0, host->connection())), "com.example.fifo0");
+}
+
+// Bundles that could not travel in a reply (a path that is not UTF-8,
+// dictionaries nested too deep, one stored so by an older drd): "add"
+// refuses them with the path escaped, the log stays UTF-8, and every host's
+// discovery goes on with the other plug-ins, also after a restart.
+TEST(ReliabilityTest, PlugInThatCannotTravelNeverBreaksDiscovery) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "travel", 2);
+  const std::string odd = w.makePlugIn("system/odd\xff.appex", "com.example.odd");
+  const std::string link = w.path("system/link.appex");
+  ASSERT_EQ(::symlink(odd.c_str(), link.c_str()), 0);
+  Value deep = Value(Array{});
+  for (int i = 1; i < 60; ++i) deep = Value(Array{deep});  // 62 levels with the two above it
+  const std::string tooDeep =
+      w.makePlugIn("system/deep.appex", "com.example.deep", "1.0", {{"Deep", deep}});
+  const std::string escaped = EscapeInvalidUtf8(*CanonicalPath(odd));
+  const struct {
+    std::string path, reply, log;
+  } rows[] = {
+      {link, "unable to register plug-in at " + escaped, escaped + "\" is not UTF-8"},
+      {tooDeep, "unable to register plug-in at " + *CanonicalPath(tooDeep),
+       "nests deeper than the 61 levels a reply can carry"},
+  };
+  for (const auto& row : rows) {
+    Value reply = w.add({row.path});
+    EXPECT_EQ(ErrorCode(reply), 2u) << row.path;
+    EXPECT_EQ(ErrorText(reply), row.reply);
+    EXPECT_NE(w.log().find(row.log), std::string::npos) << w.log();
+  }
+  EXPECT_EQ(World::Identifiers(w.match()), "com.example.travel0 com.example.travel1");
+
+  // An entry an older drd stored under such a path is left out, with a line.
+  w.drd().signal(SIGTERM);
+  ASSERT_EQ(w.drd().waitForExit(), 0);
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(w.path("registry/r.sqlite3").c_str(), &db), SQLITE_OK);
+  std::unique_ptr<sqlite3, decltype(&sqlite3_close)> closer(db, &sqlite3_close);
+  sqlite3_stmt* update = nullptr;
+  ASSERT_EQ(
+      sqlite3_prepare_v2(db, "UPDATE bundles SET path = ? WHERE path = ?", -1, &update, nullptr),
+      SQLITE_OK);
+  const std::string stored = *CanonicalPath(p.paths[1]);
+  const std::string renamed = stored + "\xfe";
+  sqlite3_bind_text(update, 1, renamed.data(), static_cast<int>(renamed.size()), SQLITE_STATIC);
+  sqlite3_bind_text(update, 2, stored.data(), static_cast<int>(stored.size()), SQLITE_STATIC);
+  EXPECT_EQ(sqlite3_step(update), SQLITE_DONE);
+  EXPECT_EQ(sqlite3_changes(db), 1);
+  sqlite3_finalize(update);
+  ASSERT_TRUE(w.start()) << w.log();
+  EXPECT_EQ(World::Identifiers(w.match()), "com.example.travel0") << w.log();
+  EXPECT_NE(w.log().find("ignoring mis-configured plug-in at " + stored + "\\xFE"),
+            std::string::npos)
+      << w.log();
+  EXPECT_TRUE(IsValidUtf8(w.log())) << w.log();
+}
+
+// The folder of a registered bundle swapped for a link to /etc: "access"
+// refuses it (EACCES) rather than sign /etc, and forms carry no token for it.
+TEST(ReliabilityTest, AccessRefusesABundleFolderSwappedForALink) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "swap", 1);
+  const std::string registered = w.everything().at(0)["path"].stringValue();
+  std::filesystem::rename(registered, registered + ".moved");
+  ASSERT_EQ(::symlink("/etc", registered.c_str()), 0);
+
+  Value reply = w.call(Request("access", {{"uuids", Value(Array{p.uuids[0]})}}));
+  EXPECT_EQ(ErrorCode(reply), 4u);
+  EXPECT_EQ(ErrorText(reply), "cannot create extension to " + registered + ": 13");
+  const Value forms = w.everything();
+  ASSERT_EQ(forms.size(), 1u);
+  EXPECT_EQ(forms.at(0)["extensions"].size(), 0u) << forms.description();
+}
+
+// A full disk when an annotation is saved: the request is answered and the
+// change kept in memory, and once there is room again the save is retried
+// without any further change, so the change survives a crash. The state
+// folder is a 64 KiB tmpfs in a mount namespace of this test process (and so
+// of the drd it starts); the mount goes with the process.
+TEST(ReliabilityTest, AnnotationSavedOnceTheFullDiskHasRoom) {
+  World w;
+  const std::string state = w.path("state");
+  std::filesystem::create_directories(state);
+  if (::unshare(CLONE_NEWNS) != 0 ||
+      ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      ::mount("tmpfs", state.c_str(), "tmpfs", 0, "size=64k,mode=0700") != 0) {
+    GTEST_SKIP() << "no private tmpfs (unshare or mount not permitted): " << std::strerror(errno);
+  }
+  struct Unmount {
+    std::string path;
+    ~Unmount() { ::umount2(path.c_str(), MNT_DETACH); }
+  } unmount{state};
+  ASSERT_TRUE(w.start()) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "full", 1);  // also makes the sandbox key
+  const std::string filler = state + "/filler";
+  {
+    std::ofstream out(filler, std::ios::binary);
+    const std::string block(4096, 'x');
+    for (int i = 0; i < 64 && out.write(block.data(), block.size()); ++i) out.flush();
+  }
+  Value reply = w.call(Request(
+      "annotate", {{"annotations", Value{{"election", 1}}}, {"uuids", Value(Array{p.uuids[0]})}}));
+  EXPECT_EQ(ErrorCode(reply), 0u) << ErrorText(reply);
+  EXPECT_NE(w.log().find("unable to save annotations:"), std::string::npos) << w.log();
+  EXPECT_EQ(w.match().at(0)["annotations"]["election"].intValue(), 1);
+
+  std::filesystem::remove(filler);
+  const std::string saved = "saved annotations:" + AnnotationFile(w) + " after ";
+  for (int i = 0; i < 300 && w.log().find(saved) == std::string::npos; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));  // a hang guard
+  }
+  EXPECT_NE(w.log().find(saved), std::string::npos) << w.log();
+  ASSERT_TRUE(w.kill9()) << w.log();
+  EXPECT_EQ(w.match().at(0)["annotations"]["election"].intValue(), 1) << w.log();
 }
 
 // ---------------------------------------------------------------- load

@@ -273,6 +273,8 @@ TEST(DiagnoseTest, NamesWhatIsMissing) {
   };
   const Value point{{"UXExtensionPointIdentifier", "com.example.sdk"}};
   const Value own{{"UXExtensionProtocol", "P"}};
+  Value deep = Empty();  // 62 levels inside the information dictionary
+  for (int i = 1; i < 60; ++i) deep = Value{{"d", deep}};
   const Row rows[] = {
       {"plain bundle without protocol", "/p/A.bundle", point, Value(), protocolMissing},
       {"app extension gets the default", "/p/A.appex", point, Value(), ""},
@@ -292,6 +294,12 @@ TEST(DiagnoseTest, NamesWhatIsMissing) {
        Ux(own.changing("UXExtensionAttributes", "s")), attributesMissing},
       {"SDK protocol wrong kind still counts", "/p/A.bundle", point,
        Ux({{"UXExtensionProtocol", List({"a"})}}), ""},
+      // What a reply could not carry: every reply offering it would fail.
+      {"SDK nests too deep", "/p/A.appex", point, Ux({{"Deep", deep}}),
+       "Info.pdoc and SDK cannot be carried in a reply: it nests deeper than the 61 levels a "
+       "reply can carry"},
+      {"path not UTF-8", "/p/A\xff.appex", point, Value(),
+       "its path or a name is not UTF-8 or holds NUL: \"/p/A\\xFF.appex\""},
   };
   for (const Row& r : rows) {
     SCOPED_TRACE(r.what);

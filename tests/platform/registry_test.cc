@@ -220,6 +220,8 @@ TEST_F(RegistryTest, RefusesWhatIsNoPlugInBundleAndStoresNothing) {
   const std::string noSection =
       "Contents/Info.pdoc holds neither \"UXExtension\" nor \"Dromon\" as a dictionary";
   const std::string noMultiple = "\"Multiple\" is not a dictionary of plug-ins";
+  Value deep = Value::EmptyDictionary();  // 62 levels inside the Info.pdoc dictionary
+  for (int i = 1; i < 61; ++i) deep = Value{{"d", deep}};
   const struct {
     std::string url;
     std::string reason;  // ending in ": ", followed by a parser's or the system's text
@@ -228,7 +230,12 @@ TEST_F(RegistryTest, RefusesWhatIsNoPlugInBundleAndStoresNothing) {
       {"x.appex", "not an absolute path"},
       {file("f.appex", "x"), "not a plug-in bundle (not a folder)"},
       {folder("c.appex", "Contents"), "not a plug-in bundle (no Contents/Info.pdoc)"},
-      {folder("u.appex", "Contents/Info.pdoc"), "cannot read Contents/Info.pdoc: "},
+      {folder("u.appex", "Contents/Info.pdoc"), "not a plug-in bundle (no Contents/Info.pdoc)"},
+      {bundle("p\xff.appex", PlugInInfo("p")),
+       "its path \"" + dir_ / "p\xff.appex" + "\" is not UTF-8"},
+      {bundle("d.appex", Value{{"D", deep}, {"UXExtension", PlugInInfo("d")["UXExtension"]}}),
+       "Contents/Info.pdoc cannot be carried in a reply: it nests deeper than the 61 levels a "
+       "reply can carry"},
       {info("g.appex", "\x01\x02 not a document"), invalid},
       {info("t.appex", "<?xml version=\"1.0\"?><pdoc version=\"1.0\"><dict><key>a"), invalid},
       {bundle("a.appex", Value(Array{Value("a")})),

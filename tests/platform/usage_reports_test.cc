@@ -2,13 +2,16 @@
 // even when several processes append at once.
 #include "platform/usage_reports.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <nlohmann/json.hpp>
 #include <sstream>
 
+#include "core/log.h"
 #include "platform/file_system.h"
 #include "tests/support/process_fixtures.h"
 
@@ -50,6 +53,21 @@ TEST(UsageReportsTest, ConcurrentProcessesNeverInterleaveLines) {
     ASSERT_TRUE(nlohmann::json::accept(line)) << "line " << count << " is torn";
   }
   EXPECT_EQ(count, kProcesses * kReports);
+}
+
+// A FIFO in place of the report file, read or not: the report is refused
+// with a log line, never waited on.
+TEST(UsageReportsTest, FifoInPlaceOfTheFileIsRefusedWithoutWaiting) {
+  TempFolder folder;
+  UsageReportOptions options{folder / "usage.log"};
+  ASSERT_EQ(::mkfifo(options.logPath->c_str(), 0600), 0);
+  for (bool reader : {false, true}) {
+    const int fd = reader ? ::open(options.logPath->c_str(), O_RDONLY | O_NONBLOCK) : -1;
+    ScopedLogCapture log;
+    MakeUsageReports(options)->sendReport("d", 5, {{"k", "v"}});
+    EXPECT_TRUE(log.contains("cannot append usage report to " + *options.logPath)) << reader;
+    if (fd >= 0) ::close(fd);
+  }
 }
 
 }  // namespace

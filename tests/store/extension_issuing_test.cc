@@ -3,7 +3,11 @@
 
 #include <gtest/gtest.h>
 
+#include <unistd.h>
+
 #include <cerrno>
+
+#include "platform/file_system.h"
 
 #include "tests/support/fake_services.h"
 #include "tests/support/process_fixtures.h"
@@ -15,23 +19,38 @@ using testing::FakeCodeSigning;
 using testing::TempFolder;
 using testing::WriteTestFile;
 
-TEST(ExtensionIssuingTest, IssuesReadTokensForExistingPathsOnly) {
+TEST(ExtensionIssuingTest, IssuesReadTokensWithinTheRegisteredBundleOnly) {
   TempFolder folder;
   SandboxOptions options;
   options.keyPath = folder / "run/sandbox.key";
   FakeCodeSigning signing;
   auto sandbox = MakeLinuxSandbox(options, &signing);
 
-  std::string bundle = folder / "Ünïcode Plug-in.appex";
+  const std::string root = CanonicalPath(folder / ".").value_or("");
+  const std::string bundle = root + "/Ünïcode Plug-in.appex";
   ASSERT_TRUE(WriteTestFile(bundle + "/Contents/Info.pdoc", "{}"));
-  std::optional<std::string> token = issueReadExtensionForURL(sandbox.get(), bundle + "/");
+  std::optional<std::string> token = issueReadExtensionForURL(sandbox.get(), bundle + "/", bundle);
   ASSERT_TRUE(token.has_value());
   EXPECT_EQ(token->find('\0'), std::string::npos);
   EXPECT_EQ(consumeExtension(*token, options).value_or(""), bundle);
 
-  errno = 0;
-  EXPECT_FALSE(issueReadExtensionForURL(sandbox.get(), folder / "gone.appex").has_value());
-  EXPECT_EQ(errno, ENOENT);
+  // A bundle gone, or its folder swapped for a link to elsewhere: no token.
+  const std::string gone = root + "/gone.appex";
+  const std::string swapped = root + "/swapped.appex";
+  ASSERT_EQ(::symlink(root.c_str(), swapped.c_str()), 0);
+  const struct {
+    std::string path, registered;
+    int errnum;
+  } refused[] = {
+      {gone, gone, ENOENT},
+      {swapped, swapped, EACCES},
+      {bundle + "/..", bundle, EACCES},
+  };
+  for (const auto& row : refused) {
+    errno = 0;
+    EXPECT_FALSE(issueReadExtensionForURL(sandbox.get(), row.path, row.registered)) << row.path;
+    EXPECT_EQ(errno, row.errnum) << row.path;
+  }
 }
 
 }  // namespace
