@@ -162,7 +162,7 @@ void BM_AugmentForm(benchmark::State& state) {
   std::unique_ptr<dr::CodeSigning> signing =
       dr::MakeLinuxCodeSigning(dr::ProcessInfo::Default(), dr::FileSystem::Default());
   std::unique_ptr<dr::Sandbox> sandbox =
-      dr::MakeLinuxSandbox(dr::SandboxOptions{root + "/sandbox.key"}, signing.get());
+      dr::MakeLinuxSandbox(dr::SandboxOptions{.keyPath = root + "/sandbox.key"}, signing.get());
   dr::PlugInServices services;
   services.sandbox = sandbox.get();
   auto record = MakeRecord(42, 7, root, services);

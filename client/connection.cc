@@ -7,9 +7,11 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <deque>
 #include <mutex>
 #include <optional>
 #include <string_view>
+#include <vector>
 
 #include "platform/drm1.h"
 #include "platform/locations.h"
@@ -19,6 +21,7 @@ namespace dr::client {
 struct Connection::State {
   explicit State(int fd) : fd(fd) {}
   ~State() {
+    dropDescriptors();
     if (fd >= 0) ::close(fd);
   }
 
@@ -26,8 +29,18 @@ struct Connection::State {
                          std::chrono::steady_clock::time_point deadline);
   Status fail(int64_t code, std::string description);
 
+  // Reads what the socket has into the decoder, and the descriptors sent
+  // beside those bytes into `received`; 0 at end of stream, else as recv.
+  ssize_t receive();
+  // Closes every descriptor received and not handed out.
+  void dropDescriptors();
+
   std::mutex mu;
-  int fd;                          // guarded by mu; -1 once dead
+  int fd;  // guarded by mu; -1 once dead
+  // Descriptors received, one batch per frame that carries them, oldest
+  // first: a batch arrives with the first byte of its frame, so no later
+  // than the frame, and frames are decoded in order. Guarded by mu.
+  std::deque<std::vector<int>> received;
   std::optional<Error> deadError;  // guarded by mu: why the connection died
   uint64_t nextSerial = 1;         // guarded by mu
   drm1::FrameDecoder decoder;      // guarded by mu
@@ -96,7 +109,47 @@ int Connection::descriptor() const {
   return state_->fd;
 }
 
+void Connection::State::dropDescriptors() {
+  for (const std::vector<int>& batch : received) {
+    for (int d : batch) ::close(d);
+  }
+  received.clear();
+}
+
+ssize_t Connection::State::receive() {
+  char buffer[65536];
+  // Room for more descriptors than a frame may carry, so that a batch too
+  // large is seen whole (and refused) rather than cut.
+  alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * 2 * drm1::kMaxDescriptors)];
+  struct iovec iov = {buffer, sizeof buffer};
+  struct msghdr msg = {};
+  msg.msg_iov = &iov;
+  msg.msg_iovlen = 1;
+  msg.msg_control = control;
+  msg.msg_controllen = sizeof control;
+  ssize_t n = ::recvmsg(fd, &msg, MSG_CMSG_CLOEXEC);
+  if (n < 0) return n;
+  std::vector<int> batch;
+  for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
+    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
+    const size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (size_t i = 0; i < count; ++i) {
+      int d;
+      std::memcpy(&d, CMSG_DATA(c) + i * sizeof(int), sizeof d);
+      batch.push_back(d);
+    }
+  }
+  if (!batch.empty()) received.push_back(std::move(batch));
+  if (msg.msg_flags & MSG_CTRUNC) {
+    errno = EPROTO;  // descriptors were lost: the stream cannot be trusted
+    return -1;
+  }
+  decoder.feed(std::string_view(buffer, static_cast<size_t>(n)));
+  return n;
+}
+
 Status Connection::State::fail(int64_t code, std::string description) {
+  dropDescriptors();
   if (fd >= 0) ::close(fd);
   fd = -1;
   deadError = ClientError(code, std::move(description));
@@ -141,6 +194,14 @@ Status Connection::send(const Value& message, std::chrono::milliseconds timeout)
 }
 
 Result<Value> Connection::request(const Value& message, std::chrono::milliseconds timeout) {
+  std::vector<int> descriptors;
+  Result<Value> reply = request(message, timeout, &descriptors);
+  for (int d : descriptors) ::close(d);  // not asked for
+  return reply;
+}
+
+Result<Value> Connection::request(const Value& message, std::chrono::milliseconds timeout,
+                                  std::vector<int>* descriptors) {
   State& s = *state_;
   std::lock_guard<std::mutex> lock(s.mu);
   const Clock::time_point deadline = DeadlineAfter(timeout);
@@ -153,10 +214,25 @@ Result<Value> Connection::request(const Value& message, std::chrono::millisecond
     }
     if (frame->has_value()) {
       drm1::Frame& f = **frame;
+      std::vector<int> attached;
+      if (f.header.carriesDescriptors()) {
+        if (s.received.empty())
+          return s.fail(kProtocolError, "protocol error from drd: descriptors missing");
+        attached = std::move(s.received.front());
+        s.received.pop_front();
+      }
       // Anything else is a late reply to a request given up on, or a
       // message this connection does not wait for.
-      if (f.header.isReply() && f.header.replyTo == *serial) return std::move(f.body);
+      if (f.header.isReply() && f.header.replyTo == *serial) {
+        *descriptors = std::move(attached);
+        return std::move(f.body);
+      }
+      for (int d : attached) ::close(d);
       continue;
+    }
+    // With no part of a frame left, a batch left over has no frame.
+    if (!s.received.empty() && s.decoder.buffered() == 0) {
+      return s.fail(kProtocolError, "protocol error from drd: descriptors without a frame");
     }
     struct pollfd p = {s.fd, POLLIN, 0};
     int ready = ::poll(&p, 1, MillisecondsLeft(deadline));
@@ -166,15 +242,15 @@ Result<Value> Connection::request(const Value& message, std::chrono::millisecond
       return ClientError(kTimeout,
                          "no reply from drd within " + std::to_string(timeout.count()) + " ms");
     }
-    char buffer[65536];
-    ssize_t n = ::recv(s.fd, buffer, sizeof buffer, 0);
+    ssize_t n = s.receive();
     if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
     if (n == 0) return s.fail(kConnectionClosed, "connection closed by drd");
+    if (n < 0 && errno == EPROTO)
+      return s.fail(kProtocolError, "protocol error from drd: descriptors cut short");
     if (n < 0) {
       return s.fail(kConnectionClosed,
                     "connection closed by drd (" + std::string(std::strerror(errno)) + ")");
     }
-    s.decoder.feed(std::string_view(buffer, static_cast<size_t>(n)));
   }
 }
 

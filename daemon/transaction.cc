@@ -45,6 +45,7 @@ constexpr RequestKind kRequests[] = {
     {"bulk", &Transaction::bulkPlugIns},         {"match", &Transaction::matchPlugIns},
     {"ready", &Transaction::readyPlugIns},       {"access", &Transaction::accessPlugIns},
     {"annotate", &Transaction::annotatePlugIns}, {"lock", &Transaction::lockDownPlugIns},
+    {"open", &Transaction::openExtension},
 };
 
 std::optional<std::string> ResolvedPath(const std::string& path) {
@@ -193,7 +194,7 @@ void Transaction::done() {
   if (!request_.wantsReply) return;
   std::shared_ptr<PeerConnection> c = connection();
   if (!c) return;
-  Status sent = c->sendReply(request_.serial, reply_);
+  Status sent = c->sendReply(request_.serial, reply_, std::move(descriptors_));
   if (!sent.ok() && c->isOpen()) {
     server().log("unable to reply to client %d: %@", client_->pid(), sent);
     // A reply the wire cannot carry (nested too deeply or too large, say
@@ -424,6 +425,39 @@ void Transaction::addAnnotationForPlugInIn(const DRDPlugIn& plugIn, Dictionary& 
   Value annotation = server().annotationForPlugIn(plugIn);
   form[kAnnotationsKey] =
       annotation.isDictionary() ? std::move(annotation) : DRPlugInCore::NoAnnotations();
+}
+
+// ---- Opening a token ------------------------------------------------------
+
+// A sandboxed host cannot reach a plug-in's files by path: it hands drd the
+// token and gets the granted file or folder back as a descriptor. Only the
+// token's signature is checked: whatever the registry says now, the token
+// grants what it names, and the path is opened without following any link,
+// so a folder swapped for a link since is refused.
+void Transaction::openExtension() {
+  const Value& token = request()[kTokenKey];
+  if (!token.isString()) {
+    failMessage(kErrorMalformed, "invalid request format (token)");
+    return;
+  }
+  Sandbox* sandbox = server().options().database.plugInServices.sandbox;
+  Result<std::string> path = sandbox ? sandbox->grantedPath(token.stringValue())
+                                     : Result<std::string>(PosixError(ENOKEY, "no sandbox"));
+  if (!path.ok()) {
+    server().log("client %d: token refused: %@", client_->pid(),
+                 path.error().localizedDescription());
+    failMessage(kErrorNotPermitted, "token refused");
+    return;
+  }
+  Result<UniqueFd> fd = OpenForReading(*path);
+  if (!fd.ok()) {
+    const int64_t code = fd.error().domain() == kPosixErrorDomain ? fd.error().code() : EIO;
+    failMessage(kErrorBadPath, Format("cannot open %@: %d", *path, static_cast<int>(code)));
+    return;
+  }
+  setReplyValue(kPathKey, Value(*path));
+  descriptors_.push_back(std::move(*fd));
+  done();
 }
 
 // ---- Holds --------------------------------------------------------------

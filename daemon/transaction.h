@@ -14,8 +14,10 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "core/status.h"
+#include "core/unique_fd.h"
 #include "core/value.h"
 #include "platform/message_service.h"
 #include "plugin/plugin.h"
@@ -85,6 +87,7 @@ class Transaction {
   void accessPlugIns();
   void annotatePlugIns();
   void lockDownPlugIns();
+  void openExtension();
 
   // Puts the stored annotation of `plugIn` into `form` under "annotations"
   // (an empty dictionary when there is none).
@@ -95,7 +98,8 @@ class Transaction {
 
   const std::shared_ptr<DRDIpcClient> client_;
   const PeerMessage request_;
-  Value reply_;  // a dictionary
+  Value reply_;                        // a dictionary
+  std::vector<UniqueFd> descriptors_;  // sent with the reply
   bool replied_ = false;
 };
 

@@ -396,7 +396,8 @@ Result<Header> DecodeHeader(std::string_view bytes) {
     return ProtocolError("body length " + std::to_string(h.bodyLength) + " above 16 MiB");
   }
   if (h.serial == 0) return ProtocolError("serial 0");
-  if ((h.flags & ~(kFlagWantsReply | kFlagIsReply)) != 0) return ProtocolError("unknown flags");
+  if ((h.flags & ~(kFlagWantsReply | kFlagIsReply | kFlagDescriptors)) != 0)
+    return ProtocolError("unknown flags");
   if (h.isReply() != (h.replyTo != 0)) {
     return ProtocolError("reply-to does not match the reply flag");
   }

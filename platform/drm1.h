@@ -6,7 +6,8 @@
 //   frame  := magic "DRM1" | u32 body-length (<= 16 MiB) | u64 serial (!= 0)
 //             | u64 reply-to | u32 flags | u32 reserved (0) | body
 //   flags  := bit 0: the sender wants a reply; bit 1: this is a reply
-//             (reply-to is the request's serial; 0 for anything else)
+//             (reply-to is the request's serial; 0 for anything else);
+//             bit 2: descriptors travel beside the frame
 //   body   := value, a dictionary at the top level
 //   value  := 0x00 null | 0x01 false | 0x02 true | 0x03 i64 | 0x04 u64
 //           | 0x05 f64 | 0x06 date (f64 seconds since 1970) | 0x07 string
@@ -47,6 +48,10 @@ inline constexpr uint32_t kMaxBodySize = uint32_t{16} << 20;
 inline constexpr int kMaxDepth = 64;
 inline constexpr uint32_t kFlagWantsReply = 1u << 0;
 inline constexpr uint32_t kFlagIsReply = 1u << 1;
+// Descriptors travel beside the frame (SCM_RIGHTS with its first byte), at
+// most kMaxDescriptors; only replies carry them.
+inline constexpr uint32_t kFlagDescriptors = 1u << 2;
+inline constexpr size_t kMaxDescriptors = 4;
 
 enum Tag : uint8_t {
   kTagNull = 0x00,
@@ -71,6 +76,7 @@ struct Header {
 
   bool wantsReply() const { return (flags & kFlagWantsReply) != 0; }
   bool isReply() const { return (flags & kFlagIsReply) != 0; }
+  bool carriesDescriptors() const { return (flags & kFlagDescriptors) != 0; }
 };
 
 struct Frame {

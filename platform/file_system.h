@@ -21,6 +21,7 @@
 #include <string_view>
 
 #include "core/status.h"
+#include "core/unique_fd.h"
 
 namespace dr {
 
@@ -109,5 +110,12 @@ Result<std::string> CanonicalPath(const std::string& path);
 // a name such as "../x" does, or any path after a folder on the way was
 // swapped for a symbolic link; otherwise as CanonicalPath.
 Result<std::string> CanonicalPathWithin(const std::string& path, const std::string& root);
+
+// The file or folder at `path` opened for reading (O_RDONLY | O_CLOEXEC, and
+// O_DIRECTORY for a folder), for a process that cannot reach the path
+// itself. No symbolic link is followed anywhere in the path (ELOOP), and
+// anything but a regular file or a folder is refused (EACCES) before it is
+// opened, so neither a FIFO nor a device is ever opened by it.
+Result<UniqueFd> OpenForReading(const std::string& path);
 
 }  // namespace dr

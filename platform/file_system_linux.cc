@@ -266,6 +266,32 @@ Result<std::string> CanonicalPathWithin(const std::string& path, const std::stri
   return resolved;
 }
 
+Result<UniqueFd> OpenForReading(const std::string& path) {
+  if (path.find('\0') != std::string::npos) return PosixError(EINVAL, "path holds NUL");
+  // First a handle that opens nothing, to learn what the path names without
+  // the side effects of opening it (a FIFO would block, a device act).
+  struct open_how how = {};
+  how.flags = O_PATH | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+  UniqueFd handle(
+      static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
+  if (!handle) return PosixError(errno, "open " + path);
+  struct stat st;
+  if (::fstat(handle.get(), &st) != 0) return PosixError(errno, "stat " + path);
+  UniqueFd fd;
+  if (S_ISDIR(st.st_mode)) {
+    fd.reset(::openat(handle.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  } else if (S_ISREG(st.st_mode)) {
+    // Reopened through the handle: the same file, whatever the path names now.
+    const std::string self = "/proc/self/fd/" + std::to_string(handle.get());
+    fd.reset(::open(self.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
+  } else {
+    return PosixError(EACCES, "not a file or folder: " + path);
+  }
+  if (!fd) return PosixError(errno, "open " + path);
+  return fd;
+}
+
 FileSystem* FileSystem::Default() {
   static LinuxFileSystem* fs = new LinuxFileSystem();
   return fs;

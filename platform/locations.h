@@ -15,7 +15,7 @@ namespace dr {
 // Looks up an environment variable; nullptr when unset. Tests pass their own.
 using EnvironmentLookup = std::function<const char*(const char*)>;
 
-// The folder of the listening sockets and the sandbox key.
+// The folder of the listening sockets.
 std::string SocketDirectory(const EnvironmentLookup& getenv = nullptr);
 
 // The user's configuration folder; empty when neither XDG_CONFIG_HOME nor
@@ -30,6 +30,15 @@ std::string HomeFolder(const EnvironmentLookup& getenv = nullptr);
 // The user's data folder: $XDG_DATA_HOME when it is absolute, else
 // <home>/.local/share; "" when no absolute folder can be made.
 std::string DataHome(const EnvironmentLookup& getenv = nullptr);
+
+// The user's state folder: $XDG_STATE_HOME when it is absolute, else
+// <home>/.local/state; "" when no absolute folder can be made.
+std::string StateHome(const EnvironmentLookup& getenv = nullptr);
+
+// Where drd keeps the key of its read tokens:
+// <StateHome>/com.corvel.dromon/sandbox.key; "" when there is no state
+// folder.
+std::string SandboxKeyPath(const EnvironmentLookup& getenv = nullptr);
 
 // The absolute folders of a colon-separated list, in order. Empty and
 // relative entries are dropped, as the XDG rules ask of their lists.

@@ -57,6 +57,20 @@ std::string DataHome(const EnvironmentLookup& getenv) {
   return !home.empty() && home[0] == '/' ? home + "/.local/share" : std::string();
 }
 
+std::string StateHome(const EnvironmentLookup& getenv) {
+  if (std::string state = EnvironmentValue(getenv, "XDG_STATE_HOME");
+      !state.empty() && state[0] == '/') {
+    return state;
+  }
+  std::string home = HomeFolder(getenv);
+  return !home.empty() && home[0] == '/' ? home + "/.local/state" : std::string();
+}
+
+std::string SandboxKeyPath(const EnvironmentLookup& getenv) {
+  const std::string state = StateHome(getenv);
+  return state.empty() ? std::string() : state + "/com.corvel.dromon/sandbox.key";
+}
+
 std::vector<std::string> SplitFolderList(std::string_view list) {
   std::vector<std::string> folders;
   size_t start = 0;

@@ -16,6 +16,8 @@ inline constexpr const char* kAnnotationsKey = "annotations";  // changes to rec
 inline constexpr const char* kMatchesKey = "matches";          // the forms found
 inline constexpr const char* kExtensionsKey = "extensions";    // read tokens
 inline constexpr const char* kConflictsKey = "conflicts";      // busy plug-ins
+inline constexpr const char* kTokenKey = "token";              // a read token to open
+inline constexpr const char* kPathKey = "path";                // the path an opened token grants
 inline constexpr const char* kErrorCodeKey = "errorcode";      // an error reply's code
 inline constexpr const char* kErrorKey = "error";              // an error reply's message
 // Entries of "annotations".

@@ -31,14 +31,17 @@
 
 #include <atomic>
 #include <cstdint>
+#include <deque>
 #include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "core/queue.h"
 #include "core/status.h"
+#include "core/unique_fd.h"
 #include "core/value.h"
 #include "platform/drm1.h"
 
@@ -91,7 +94,10 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   // Queues the reply bound to the request with serial `requestSerial`.
   // Fails when the body cannot be encoded (nothing is sent) or when the
   // connection is closed; a queue past its limit closes the connection.
-  Status sendReply(uint64_t requestSerial, const Value& body);
+  // `descriptors` (at most drm1::kMaxDescriptors) go with it and are closed
+  // here once sent.
+  Status sendReply(uint64_t requestSerial, const Value& body,
+                   std::vector<UniqueFd> descriptors = {});
   // Closes the connection; the handler then gets kConnectionInvalid.
   void cancel();
   bool isOpen() const { return !closed_.load(); }
@@ -115,11 +121,13 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   std::atomic<bool> resumed_{false};
 
   mutable std::mutex mu_;
-  std::string outbox_;             // guarded by mu_: encoded frames not yet written
-  size_t outboxSent_ = 0;          // guarded by mu_
-  uint64_t nextSerial_ = 1;        // guarded by mu_
-  uint32_t unanswered_ = 0;        // guarded by mu_
-  std::shared_ptr<void> context_;  // guarded by mu_
+  std::string outbox_;     // guarded by mu_: encoded frames not yet written
+  size_t outboxSent_ = 0;  // guarded by mu_
+  // Descriptors to send with the frame at an offset of outbox_; guarded by mu_.
+  std::deque<std::pair<size_t, std::vector<UniqueFd>>> outboxDescriptors_;
+  uint64_t nextSerial_ = 1;                              // guarded by mu_
+  uint32_t unanswered_ = 0;                              // guarded by mu_
+  std::shared_ptr<void> context_;                        // guarded by mu_
   std::function<void(const ConnectionEvent&)> handler_;  // set before resume
 };
 

@@ -17,6 +17,7 @@
 #include "core/log.h"
 #include "platform/file_system.h"
 #include "platform/message_service.h"
+#include "platform/unix_socket.h"
 
 namespace dr {
 namespace {
@@ -153,11 +154,15 @@ void PeerConnection::wake() {
   [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
 }
 
-Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
+Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
+                                 std::vector<UniqueFd> descriptors) {
   std::lock_guard<std::mutex> lock(mu_);
   if (closed_) return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "connection closed");
-  Result<std::string> frame =
-      drm1::EncodeFrame(nextSerial_, requestSerial, drm1::kFlagIsReply, body);
+  if (descriptors.size() > drm1::kMaxDescriptors) {
+    return Error(drm1::kDrm1ErrorDomain, drm1::kUnencodable, "too many descriptors");
+  }
+  const uint32_t flags = drm1::kFlagIsReply | (descriptors.empty() ? 0 : drm1::kFlagDescriptors);
+  Result<std::string> frame = drm1::EncodeFrame(nextSerial_, requestSerial, flags, body);
   if (!frame) return frame.error();
   ++nextSerial_;
   // A connection at its limit of unanswered requests is not being read; its
@@ -171,6 +176,7 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
     return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "reply queue full");
   }
   const bool queuedBefore = outboxSent_ < outbox_.size();
+  if (!descriptors.empty()) outboxDescriptors_.emplace_back(outbox_.size(), std::move(descriptors));
   outbox_ += *frame;
   // Nothing ahead of it: write it from here rather than waking the
   // connection's thread to do so, which would double the thread switches
@@ -203,13 +209,27 @@ bool PeerConnection::writeSome() {
 }
 
 bool PeerConnection::writeSomeLocked() {
+  static const std::vector<UniqueFd> kNone;
   while (outboxSent_ < outbox_.size()) {
-    ssize_t n = ::send(fd_, outbox_.data() + outboxSent_, outbox_.size() - outboxSent_,
-                       MSG_DONTWAIT | MSG_NOSIGNAL);
+    // Descriptors go with the first byte of their frame, and a write stops
+    // short of the next frame that carries some.
+    size_t end = outbox_.size();
+    const std::vector<UniqueFd>* attached = &kNone;
+    if (!outboxDescriptors_.empty()) {
+      if (outboxDescriptors_.front().first == outboxSent_) {
+        attached = &outboxDescriptors_.front().second;
+        if (outboxDescriptors_.size() > 1) end = outboxDescriptors_[1].first;
+      } else {
+        end = outboxDescriptors_.front().first;
+      }
+    }
+    struct iovec part = {outbox_.data() + outboxSent_, end - outboxSent_};
+    ssize_t n = SendWithDescriptors(fd_, &part, 1, *attached);
     if (n < 0) {
       if (errno == EINTR) continue;
       return errno == EAGAIN || errno == EWOULDBLOCK;
     }
+    if (attached != &kNone) outboxDescriptors_.pop_front();  // sent, and closed here
     outboxSent_ += static_cast<size_t>(n);
   }
   outbox_.clear();
@@ -242,6 +262,10 @@ void PeerConnection::run() {
         SystemLog("protocol error on %@: a peer sent a reply", description());
         return false;
       }
+      if (f.header.carriesDescriptors()) {
+        SystemLog("protocol error on %@: a request may not carry descriptors", description());
+        return false;
+      }
       if (f.header.wantsReply()) {
         std::lock_guard<std::mutex> lock(mu_);
         ++unanswered_;
@@ -269,7 +293,12 @@ void PeerConnection::run() {
     if ((fds[0].revents & POLLOUT) && !writeSome()) break;
     if (fds[0].revents & (POLLHUP | POLLERR) && !readable) break;
     if (fds[0].revents & (POLLIN | POLLHUP | POLLERR)) {
-      ssize_t n = ::recv(fd_, buf, sizeof buf, MSG_DONTWAIT);
+      bool sawDescriptors = false;
+      ssize_t n = ReceiveRefusingDescriptors(fd_, buf, sizeof buf, &sawDescriptors);
+      if (sawDescriptors) {
+        SystemLog("protocol error on %@: descriptors sent with a request", description());
+        break;
+      }
       if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
       if (n <= 0) {
         peerOpen = false;

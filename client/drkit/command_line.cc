@@ -164,10 +164,13 @@ const std::vector<VerbSpec>& Verbs() {
       {"extension",
        {},
        2,
-       2,
-       "extension consume TOKEN",
-       "check a read token",
-       "Checks TOKEN against the user's key and prints the path it grants.\n"},
+       3,
+       "extension consume TOKEN | extension open TOKEN [FILE]",
+       "check or open a read token",
+       "consume: checks TOKEN against the user's key and prints the path it grants.\n"
+       "open: hands TOKEN to drd, which opens what it grants; prints FILE (a path\n"
+       "inside the granted folder) read through that, or lists the folder. Works\n"
+       "inside a sandbox that can reach drd's socket but not the plug-in.\n"},
       {"exclude",
        {kOptPoint, kOptIdentifier, kOptRule},
        1,
@@ -289,7 +292,8 @@ Status Validate(Invocation& inv, const std::vector<bool>& seen) {
     return Status();
   }
   if (inv.verb == "extension") {
-    return need(ops[0] == "consume", "unknown action '" + ops[0] + "' (expected consume)");
+    if (ops[0] == "consume") return need(ops.size() == 2, "consume takes one TOKEN");
+    return need(ops[0] == "open", "unknown action '" + ops[0] + "' (expected consume or open)");
   }
   if (inv.verb == "exclude") {
     const std::string& action = ops[0];

@@ -81,6 +81,9 @@ class NoTokenSandbox final : public Sandbox {
   Result<std::string> issueFileExtension(std::string_view, const std::string&, uint32_t) override {
     return std::string();
   }
+  Result<std::string> grantedPath(std::string_view) override {
+    return Error(kSandboxErrorDomain, kExtensionForged, "no key");
+  }
 };
 
 std::string ElectionText(const Value& election) {

@@ -36,6 +36,26 @@ std::string ParentFolder(const std::string& path) { return path.substr(0, path.r
 }  // namespace
 
 int RunExtension(const Invocation& inv, Io& io) {
+  if (inv.operands[0] == "open") {
+    Result<std::unique_ptr<client::Connection>> c =
+        client::Connection::Open(inv.service, client::DefaultSocketDirectory());
+    if (!c) return Fail(io, c.error().localizedDescription());
+    Result<client::OpenedExtension> opened = client::openExtension(**c, inv.operands[1]);
+    if (!opened) return Fail(io, opened.error().localizedDescription());
+    const std::string file = inv.operands.size() > 2 ? inv.operands[2] : "";
+    // A folder is listed, a file printed.
+    if (Result<std::vector<std::string>> names = opened->listFolder(file)) {
+      for (const std::string& name : *names) io.out << name << "\n";
+      return 0;
+    }
+    Result<std::string> bytes = opened->readFile(file);
+    if (!bytes) {
+      return Fail(
+          io, (file.empty() ? opened->path() : file) + ": " + bytes.error().localizedDescription());
+    }
+    io.out << *bytes;
+    return 0;
+  }
   Result<std::string> path = client::consumeExtension(inv.operands[1]);
   if (!path) return Fail(io, path.error().localizedDescription());
   io.out << *path << "\n";

@@ -8,9 +8,12 @@
 //
 // Prints each plug-in found ("identifier version uuid"), then "readied
 // IDENTIFIER" for the one it readied: the first plug-in the user elected, else
-// the first one found, or the one named IDENTIFIER. Exit status 0 on success,
-// 1 when drd fails or nothing fits, 2 on a bad command line.
+// the first one found, or the one named IDENTIFIER; then "read N bytes of
+// Contents/Info.pdoc" from its bundle, read the way a sandboxed host must:
+// through a token that drd opens. Exit status 0 on success, 1 when drd fails
+// or nothing fits, 2 on a bad command line.
 #include <drd/client.h>
+#include <drd/extension.h>
 
 #include <iostream>
 #include <string>
@@ -57,5 +60,23 @@ int main(int argc, char** argv) {
     return 1;
   }
   std::cout << "readied " << chosen->identifier << "\n";
+
+  // A sandboxed host cannot open the bundle's path; it asks for a token and
+  // lets drd open what the token grants.
+  auto tokens = (*host)->access({chosen->uuid});
+  if (!tokens) {
+    std::cerr << "no token for " << chosen->identifier << ": " << tokens.error().description()
+              << "\n";
+    return 1;
+  }
+  auto bundle = client::openExtension((*host)->connection(), tokens->front());
+  auto info =
+      bundle ? bundle->readFile("Contents/Info.pdoc") : dr::Result<std::string>(bundle.error());
+  if (!info) {
+    std::cerr << "cannot read the bundle of " << chosen->identifier << ": "
+              << info.error().description() << "\n";
+    return 1;
+  }
+  std::cout << "read " << info->size() << " bytes of Contents/Info.pdoc\n";
   return 0;
 }

@@ -122,7 +122,7 @@ TEST(DrkitCommandLineTest, RefusesMalformedCommandLines) {
       {{"hold", "--app", "/a", "/b"}, "hold: unexpected operand '/b'"},
       {{"ready", "1B4E28BA-2FA1-11D2-883F-0016D3CCA42"},
        "ready: not a UUID: '1B4E28BA-2FA1-11D2-883F-0016D3CCA42'"},
-      {{"extension", "eat", "t"}, "extension: unknown action 'eat' (expected consume)"},
+      {{"extension", "eat", "t"}, "extension: unknown action 'eat' (expected consume or open)"},
       {{"extension", "consume"}, "extension: missing operand"},
       {{"exclude", "add"}, "exclude: add takes rules: -p, -i or --rule"},
       {{"exclude", "remove", "0"}, "exclude: remove takes rules or one number from 'list'"},

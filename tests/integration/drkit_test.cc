@@ -376,7 +376,8 @@ TEST_F(DrkitTest, HostExampleDiscoversAndReadiesAPlugIn) {
   Child host(ClientBinaryPath("host_example"), {kPoint}, DrkitEnvironment(root()));
   EXPECT_EQ(host.wait(), 0) << host.err();
   EXPECT_NE(host.out().find("com.example.a 1.0 "), std::string::npos) << host.out();
-  EXPECT_NE(host.out().find("\nreadied com.example.b\n"), std::string::npos) << host.out();
+  EXPECT_NE(host.out().find("\nreadied com.example.b\nread "), std::string::npos) << host.out();
+  EXPECT_NE(host.out().find(" bytes of Contents/Info.pdoc\n"), std::string::npos) << host.out();
 
   Child nothing(ClientBinaryPath("host_example"), {"com.example.nowhere"},
                 DrkitEnvironment(root()));

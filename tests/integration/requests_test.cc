@@ -30,15 +30,6 @@ class RequestsTest : public ::testing::Test {
   void SetUp() override { ASSERT_TRUE(w.start()) << w.log(); }
 
   Value uuids(std::initializer_list<Value> list) { return Value(Array(list)); }
-  // Waits up to five seconds for `predicate`.
-  template <typename P>
-  bool eventually(P predicate) {
-    for (int i = 0; i < 100; ++i) {
-      if (predicate()) return true;
-      std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    }
-    return false;
-  }
 
   World w;
 };
@@ -367,7 +358,7 @@ TEST_F(RequestsTest, AccessHandsOutOneTokenPerUuid) {
   Value reply = w.call(Request("access", {{"uuids", uuids({uuid, uuid})}}));
   ASSERT_EQ(ErrorCode(reply), 0u) << ErrorText(reply);
   ASSERT_EQ(reply["extensions"].size(), 2u);
-  SandboxOptions options{w.path("sockets/sandbox.key")};
+  SandboxOptions options{.keyPath = w.path("state/com.corvel.dromon/sandbox.key")};
   Result<std::string> granted = consumeExtension(reply["extensions"].at(1).stringValue(), options);
   ASSERT_TRUE(granted.ok());
   EXPECT_EQ(*granted, a);
@@ -466,7 +457,7 @@ TEST_F(RequestsTest, HoldEndsWhenItsHostDies) {
   ASSERT_TRUE(held["uuids"].isUuid()) << ErrorText(held);
   EXPECT_EQ(w.match().size(), 0u);
   holder->kill();
-  EXPECT_TRUE(eventually([&] { return w.match().size() == 1; })) << w.log();
+  EXPECT_TRUE(Eventually([&] { return w.match().size() == 1; })) << w.log();
 }
 
 }  // namespace

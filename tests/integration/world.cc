@@ -44,7 +44,8 @@ uint64_t ErrorCode(const Value& reply) { return reply["errorcode"].uintValue(); 
 std::string ErrorText(const Value& reply) { return reply["error"].stringValue(); }
 
 HostApp::HostApp(const std::string& appPath, const std::string& executable,
-                 const std::string& drdSocket, const std::string& relayFolder) {
+                 const std::string& drdSocket, const std::string& relayFolder,
+                 std::vector<std::string> launcher) {
   const std::string program = appPath + "/Contents/Exec/" + executable;
   CopyExecutable(RelayBinary(), program);
   std::filesystem::create_directories(relayFolder);
@@ -54,7 +55,12 @@ HostApp::HostApp(const std::string& appPath, const std::string& executable,
   pid_ = ::fork();
   if (pid_ == 0) {
     ::dup2(out[1], STDOUT_FILENO);
-    ::execl(program.c_str(), program.c_str(), drdSocket.c_str(), relaySocket.c_str(), nullptr);
+    std::vector<std::string> args = std::move(launcher);
+    args.insert(args.end(), {program, drdSocket, relaySocket});
+    std::vector<char*> argv;
+    for (std::string& a : args) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    ::execv(argv[0], argv.data());
     ::_exit(127);
   }
   ::close(out[1]);
@@ -197,10 +203,12 @@ Value World::uuidOf(const std::string& id) const {
   return Value();
 }
 
-std::unique_ptr<HostApp> World::host(const std::string& app) const {
+std::unique_ptr<HostApp> World::host(const std::string& app,
+                                     std::vector<std::string> launcher) const {
   static int count = 0;
-  auto h = std::make_unique<HostApp>(root_ / app, "host", drd_->socketPath(),
-                                     root_ / ("relay" + std::to_string(++count)));
+  auto h =
+      std::make_unique<HostApp>(root_ / app, "host", drd_->socketPath(),
+                                root_ / ("relays/" + std::to_string(++count)), std::move(launcher));
   EXPECT_NE(h->connection(), nullptr) << "host " << app << " did not connect";
   return h;
 }

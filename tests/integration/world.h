@@ -6,9 +6,11 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <memory>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "client/include/drd/connection.h"
@@ -17,6 +19,16 @@
 #include "tests/support/registry_bundles.h"
 
 namespace dr::testing {
+
+// Waits up to five seconds for `predicate` to hold.
+template <typename P>
+bool Eventually(P predicate) {
+  for (int i = 0; i < 100; ++i) {
+    if (predicate()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  return false;
+}
 
 // A request message of `name` with the protocol version and `fields`.
 Value Request(const std::string& name, Dictionary fields = {});
@@ -29,8 +41,9 @@ std::string ErrorText(const Value& reply);
 // that application's bundle and entitlements. The test talks through it.
 class HostApp {
  public:
+  // `launcher`: a command the host is started through (a sandbox, say).
   HostApp(const std::string& appPath, const std::string& executable, const std::string& drdSocket,
-          const std::string& relayFolder);
+          const std::string& relayFolder, std::vector<std::string> launcher = {});
   ~HostApp();
   HostApp(const HostApp&) = delete;
   HostApp& operator=(const HostApp&) = delete;
@@ -92,8 +105,11 @@ class World {
   Value everything() const;
   Value uuidOf(const std::string& id) const;
 
-  // A host application process running from `app` (made with makeApp).
-  std::unique_ptr<HostApp> host(const std::string& app) const;
+  // A host application process running from `app` (made with makeApp),
+  // started through `launcher` when given; it relays through a socket in
+  // path("relays").
+  std::unique_ptr<HostApp> host(const std::string& app,
+                                std::vector<std::string> launcher = {}) const;
 
  private:
   registry_test::TempFolder root_;

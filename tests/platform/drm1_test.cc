@@ -108,7 +108,7 @@ TEST(Drm1Test, RefusesFramesThatBreakTheRules) {
       {"DRM2" + HeaderBytes(1, 1, 0, 1).substr(4) + Tag(kTagDictionary), "magic"},
       {HeaderBytes(kMaxBodySize + 1, 1, 0, 1), "above 16 MiB"},
       {HeaderBytes(5, 0, 0, 1) + Tag(kTagDictionary) + U32(0), "serial 0"},
-      {HeaderBytes(5, 1, 0, 1 | 4) + Tag(kTagDictionary) + U32(0), "flags"},
+      {HeaderBytes(5, 1, 0, 1 | 8) + Tag(kTagDictionary) + U32(0), "flags"},
       {HeaderBytes(5, 1, 0, kFlagIsReply) + Tag(kTagDictionary) + U32(0), "reply-to"},
       {HeaderBytes(5, 1, 9, kFlagWantsReply) + Tag(kTagDictionary) + U32(0), "reply-to"},
       {HeaderBytes(5, 1, 0, 1, 1) + Tag(kTagDictionary) + U32(0), "reserved"},

@@ -166,6 +166,28 @@ TEST_F(SandboxTokenTest, KeyFileIsPrivateOutlivesTheIssuerAndIsRefusedOnceExpose
   EXPECT_FALSE(consumeExtension(token, options_).ok());
 }
 
+TEST_F(SandboxTokenTest, AKeyAtTheFormerPlaceIsMovedOnceAndOnlyWhenSafe) {
+  // Tokens issued with a key at the former place stay valid after the move.
+  SandboxOptions former = options_;
+  former.keyPath = folder_ / "sockets/sandbox.key";
+  const std::string token =
+      MakeLinuxSandbox(former, &signing_)
+          ->issueFileExtension(kReadOnlyFileExtensionClass, folder_.path(), kExtensionCanonicalPath)
+          .value_or("");
+  ASSERT_FALSE(token.empty());
+  options_.formerKeyPath = former.keyPath;
+  EXPECT_EQ(issueAnew().value_or(""), token);
+  EXPECT_TRUE(consumeExtension(token, options_).ok());
+  EXPECT_FALSE(std::filesystem::exists(former.keyPath));
+
+  // A former key others could read is not trusted: a new key is made.
+  ASSERT_EQ(::unlink(options_.keyPath.c_str()), 0);
+  ASSERT_TRUE(WriteTestFile(former.keyPath, std::string(32, 'k')));
+  ASSERT_EQ(::chmod(former.keyPath.c_str(), 0644), 0);
+  EXPECT_NE(issueAnew().value_or(token), token);
+  EXPECT_TRUE(std::filesystem::exists(former.keyPath));
+}
+
 TEST_F(SandboxTokenTest, ProcessesMakingTheKeyAtOnceAgreeOnIt) {
   constexpr int kProcesses = 8;
   int start[2], results[2];

@@ -140,7 +140,7 @@ TEST_F(PlugInTest, AnnotationKeyFollowsOnlyAStringReplacement) {
 // Tokens come from the real sandbox and are checked by consuming them, so
 // each must grant exactly the resource it is filed under.
 TEST_F(PlugInTest, FormGetsOneTokenPerDeclaredResource) {
-  SandboxOptions options{folder / "keys/sandbox.key"};
+  SandboxOptions options{.keyPath = folder / "keys/sandbox.key"};
   testing::FakeCodeSigning signing;
   std::unique_ptr<Sandbox> sandbox = MakeLinuxSandbox(options, &signing);
   PlugInServices s = services();

@@ -25,6 +25,12 @@ Result<std::string> FakeSandbox::issueFileExtension(std::string_view extensionCl
   return "token:" + std::string(extensionClass) + ":" + path;
 }
 
+Result<std::string> FakeSandbox::grantedPath(std::string_view token) {
+  constexpr std::string_view kPrefix = "token:file.read-only:";
+  if (!token.starts_with(kPrefix)) return Error(kSandboxErrorDomain, kExtensionForged, "fake");
+  return std::string(token.substr(kPrefix.size()));
+}
+
 Value FakePreferences::copyCurrentHostValue(std::string_view key, std::string_view domain) {
   auto it = values.find({std::string(domain), std::string(key)});
   return it == values.end() ? Value() : it->second;

@@ -41,6 +41,8 @@ class FakeSandbox : public Sandbox {
   bool isSandboxed(pid_t pid) override { return sandboxedPids.contains(pid); }
   Result<std::string> issueFileExtension(std::string_view extensionClass, const std::string& path,
                                          uint32_t flags) override;
+  // The path of a read-only token this sandbox issued.
+  Result<std::string> grantedPath(std::string_view token) override;
 };
 
 // Values by (domain, key) for the current host.

@@ -28,6 +28,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "core/status.h"
 #include "core/value.h"
@@ -58,6 +59,10 @@ class DRD_EXPORT Connection {
 
   // Sends `message` (a dictionary) wanting a reply; the reply's body.
   Result<Value> request(const Value& message, std::chrono::milliseconds timeout = kDefaultTimeout);
+  // request(), and the descriptors drd sent with the reply (its "open"
+  // reply carries one), which the caller then owns and closes.
+  Result<Value> request(const Value& message, std::chrono::milliseconds timeout,
+                        std::vector<int>* descriptors);
   // Sends `message` (a dictionary) wanting no reply.
   Status send(const Value& message, std::chrono::milliseconds timeout = kDefaultTimeout);
 

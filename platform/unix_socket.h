@@ -1,0 +1,28 @@
+// Bytes and descriptors over a connected Unix stream socket.
+//
+// Descriptors travel as SCM_RIGHTS ancillary data with the first byte of the
+// bytes they go with. Stateless; any thread. Both calls never block and
+// never raise SIGPIPE; they answer as sendmsg/recvmsg do (-1 with errno).
+#pragma once
+
+#include <sys/types.h>
+#include <sys/uio.h>
+
+#include <cstddef>
+#include <vector>
+
+#include "core/unique_fd.h"
+
+namespace dr {
+
+// Sends the bytes of `parts`, with `descriptors` attached to the first byte
+// when there are any (then at least one byte must go).
+ssize_t SendWithDescriptors(int fd, const struct iovec* parts, size_t count,
+                            const std::vector<UniqueFd>& descriptors);
+
+// Receives up to `size` bytes. Descriptors that came with them are closed at
+// once and `sawDescriptors` set: a peer that may not send any has broken the
+// protocol, and none may leak.
+ssize_t ReceiveRefusingDescriptors(int fd, void* buffer, size_t size, bool* sawDescriptors);
+
+}  // namespace dr
