@@ -27,10 +27,10 @@ struct Connection::State {
   Status fail(int64_t code, std::string description);
 
   std::mutex mu;
-  int fd;                          // guarded by mu; -1 once dead
-  std::optional<Error> deadError;  // guarded by mu: why the connection died
-  uint64_t nextSerial = 1;         // guarded by mu
-  drm1::FrameDecoder decoder;      // guarded by mu
+  int fd;                                         // guarded by mu; -1 once dead
+  std::optional<Error> deadError;                 // guarded by mu: why the connection died
+  uint64_t nextSerial = 1;                        // guarded by mu
+  drm1::FrameDecoder decoder{drm1::kFromDaemon};  // guarded by mu
 };
 
 namespace {
