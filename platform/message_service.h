@@ -12,9 +12,10 @@
 // daemon's descriptors; when they run out all the same, accepting pauses
 // (logged once) while the connections already made are served.
 //
-// Connections are read by one event loop thread (epoll), so a connection
-// idle between frames costs no thread; the loop decodes DRM1 frames and
-// delivers each connection's events to its handler one at a time, in order:
+// Connections are read by a few event loop threads (epoll), all of one
+// process's connections by the same loop, so a connection idle between
+// frames costs no thread; a loop decodes DRM1 frames and delivers each
+// connection's events to its handler one at a time, in order:
 // a message per frame, and a final kConnectionInvalid when the peer hangs
 // up, breaks the protocol (logged, and only that connection closes), stops
 // for kFrameStallLimit in the middle of a frame, or is cancelled.
@@ -77,6 +78,8 @@ struct PeerMessage {
   std::shared_ptr<const void> budget;
 };
 
+class ConnectionLoop;
+
 struct ConnectionEvent {
   enum class Kind { kMessage, kConnectionInvalid };
   Kind kind = Kind::kMessage;
@@ -91,11 +94,14 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   // queue every peer's requests share.
   static constexpr uint32_t kMaxMessagesInFlight = 64;
   // The bytes those messages count for, per connection and in all: a
-  // frame's own bytes plus kValueCost per value it holds, about what its
-  // decoded values take in memory.
+  // frame's own bytes plus kValueCost per value it holds, at least what its
+  // decoded values take in memory (41 bytes a null in an array, 50 a short
+  // string, 88 a dictionary entry with its own key). A 16 MiB frame counts
+  // up to 112 MiB, so two such are in drd at once.
   static constexpr size_t kMaxBytesInFlight = size_t{16} << 20;
   static constexpr size_t kMaxBytesInFlightTotal = size_t{256} << 20;
-  static constexpr size_t kValueCost = 64;
+  static constexpr size_t kValueCost = 96;
+  // What a connection with nothing in flight may bring in past the total.
   static constexpr size_t kSmallFrameBytes = 4096;
   // How long a peer may stop in the middle of a frame.
   static constexpr std::chrono::seconds kFrameStallLimit{30};
@@ -148,7 +154,8 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
 
   const int fd_;
   const AuditToken token_;
-  uint64_t id_ = 0;  // the loop's name for it, set by resume()
+  ConnectionLoop* loop_ = nullptr;  // the loop that reads it, set by resume()
+  uint64_t id_ = 0;                 // the loop's name for it, set by resume()
   std::atomic<bool> closed_{false};
   std::atomic<bool> resumed_{false};
 

@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <chrono>
 #include <condition_variable>
@@ -18,7 +19,6 @@
 #include <deque>
 #include <iterator>
 #include <map>
-#include <optional>
 #include <set>
 #include <unordered_map>
 #include <vector>
@@ -80,14 +80,45 @@ int KeepAliveCount() { return gKeepAlive.load(); }
 
 // ---- The loop ---------------------------------------------------------------
 
-// The one thread that reads every connection: epoll over their sockets,
-// plus an eventfd through which other threads ask it to look at a
-// connection again (closed, or room made in a budget). Lives until exit.
+// A thread that reads connections: epoll over their sockets, plus an
+// eventfd through which other threads ask it to look at a connection again
+// (closed, or room made in a budget). There are kLoops of them, made when
+// first needed, each living until exit. All connections of one process are
+// read by the same loop, and a process with none is given the loop that
+// reads the fewest: a process flooding drd keeps its own loop busy, while
+// the other processes' loops sleep until their peers send, and so are
+// scheduled at once although at background priority.
 class ConnectionLoop {
  public:
-  static ConnectionLoop& Get() {
-    static ConnectionLoop* loop = new ConnectionLoop();  // served until exit
-    return *loop;
+  static constexpr size_t kLoops = 4;
+
+  // The loop for a new connection of process `pid`.
+  static ConnectionLoop& For(pid_t pid) {
+    Assignments& a = Assignments::Get();
+    std::lock_guard<std::mutex> lock(a.mu);
+    auto it = a.byProcess.find(pid);
+    size_t i;
+    if (it != a.byProcess.end()) {
+      i = it->second.loop;
+      ++it->second.connections;
+    } else {
+      i = static_cast<size_t>(std::min_element(a.connections.begin(), a.connections.end()) -
+                              a.connections.begin());
+      a.byProcess[pid] = {i, 1};
+    }
+    ++a.connections[i];
+    if (!a.loops[i]) a.loops[i] = new ConnectionLoop();  // served until exit
+    return *a.loops[i];
+  }
+
+  // A connection of process `pid` has ended.
+  static void Leave(pid_t pid) {
+    Assignments& a = Assignments::Get();
+    std::lock_guard<std::mutex> lock(a.mu);
+    auto it = a.byProcess.find(pid);
+    if (it == a.byProcess.end()) return;
+    --a.connections[it->second.loop];
+    if (--it->second.connections == 0) a.byProcess.erase(it);
   }
 
   void add(std::shared_ptr<PeerConnection> connection) {
@@ -161,6 +192,22 @@ class ConnectionLoop {
     }
     std::thread([this] { run(); }).detach();
   }
+
+  // Which loop reads which process's connections.
+  struct Assignments {
+    static Assignments& Get() {
+      static Assignments* assignments = new Assignments();  // used until exit
+      return *assignments;
+    }
+    struct Process {
+      size_t loop;
+      size_t connections;
+    };
+    std::mutex mu;
+    std::array<ConnectionLoop*, kLoops> loops{};   // guarded by mu
+    std::array<size_t, kLoops> connections{};      // guarded by mu
+    std::unordered_map<pid_t, Process> byProcess;  // guarded by mu
+  };
 
   void postLocked(uint64_t id) {
     const bool first = posted_.empty();
@@ -250,7 +297,7 @@ struct MessageBudget {
       used += bytes;
       return true;
     }
-    waiting.push_back(c.id_);
+    waiting.emplace_back(c.loop_, c.id_);
     if (!full) {
       full = true;
       SystemLog("connections have %zu MiB in flight in all: reading waits for room", used >> 20);
@@ -260,7 +307,7 @@ struct MessageBudget {
 
   void give(size_t bytes) {
     if (bytes == 0) return;
-    std::vector<uint64_t> wake;
+    std::vector<std::pair<ConnectionLoop*, uint64_t>> wake;
     {
       std::lock_guard<std::mutex> lock(mu);
       used -= bytes;
@@ -270,13 +317,14 @@ struct MessageBudget {
       }
       wake.swap(waiting);
     }
-    for (uint64_t id : wake) ConnectionLoop::Get().post(id);
+    for (const auto& [loop, id] : wake) loop->post(id);
   }
 
   std::mutex mu;
-  size_t used = 0;                // guarded by mu
-  std::vector<uint64_t> waiting;  // guarded by mu: connections to serve again once room is made
-  bool full = false;              // guarded by mu: logged once until it empties
+  size_t used = 0;  // guarded by mu
+  // Guarded by mu: connections to serve again once room is made.
+  std::vector<std::pair<ConnectionLoop*, uint64_t>> waiting;
+  bool full = false;  // guarded by mu: logged once until it empties
 };
 
 // A delivered message's share of the budgets.
@@ -319,14 +367,16 @@ void PeerConnection::setEventHandler(std::function<void(const ConnectionEvent&)>
 }
 
 void PeerConnection::resume() {
-  if (resumed_.exchange(true)) return;
+  if (resumed_) return;  // REQUIRES: called from one thread
   // The loop owns a reference, so the connection lives while it is served.
-  ConnectionLoop::Get().add(shared_from_this());
+  loop_ = &ConnectionLoop::For(token_.pid);
+  resumed_ = true;
+  loop_->add(shared_from_this());
 }
 
 void PeerConnection::endSoon() {
   closed_ = true;
-  if (resumed_) ConnectionLoop::Get().post(id_);
+  if (resumed_) loop_->post(id_);
 }
 
 Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body) {
@@ -407,7 +457,7 @@ void PeerConnection::updateInterestLocked() {
   const uint32_t events = (reading_ ? EPOLLIN : 0u) | (outbox_.empty() ? 0u : EPOLLOUT);
   if (events == interest_) return;
   interest_ = events;
-  ConnectionLoop::Get().setInterest(fd_, id_, events);
+  loop_->setInterest(fd_, id_, events);
 }
 
 void PeerConnection::release(size_t bytes) {
@@ -419,11 +469,11 @@ void PeerConnection::release(size_t bytes) {
     wake = waitingForBudget_;
     waitingForBudget_ = false;
   }
-  if (wake) ConnectionLoop::Get().post(id_);
+  if (wake) loop_->post(id_);
 }
 
 bool PeerConnection::serve(uint32_t events) {
-  ConnectionLoop& loop = ConnectionLoop::Get();
+  ConnectionLoop& loop = *loop_;
   if (closed_) {
     end();
     return false;
@@ -442,11 +492,13 @@ bool PeerConnection::serve(uint32_t events) {
   }
   Pump state = Pump::kNeedBytes;
   // A read shorter than asked for most likely emptied the socket: the loop
-  // hears of more, so it does not ask again only to be told there is none.
+  // hears of more, so it does not ask again only to be told there is none,
+  // unless the peer has hung up, whose end is then found at once.
   bool drained = false;
   for (int reads = 0;; ++reads) {
     state = deliverFrames();
-    if (state != Pump::kNeedBytes || reads == kReadsPerTurn || drained) break;
+    if (state != Pump::kNeedBytes || reads == kReadsPerTurn) break;
+    if (drained && !(events & (EPOLLHUP | EPOLLRDHUP | EPOLLERR))) break;
     const ssize_t n = ::recv(fd_, loop.readBuffer(), kReadChunk, MSG_DONTWAIT);
     if (n > 0) {
       decoder_.feed(std::string_view(loop.readBuffer(), static_cast<size_t>(n)));
@@ -529,7 +581,7 @@ PeerConnection::Pump PeerConnection::deliverFrames() {
 }
 
 void PeerConnection::end() {
-  ConnectionLoop& loop = ConnectionLoop::Get();
+  ConnectionLoop& loop = *loop_;
   closed_ = true;
   loop.remove(*this);
   ::shutdown(fd_, SHUT_RDWR);
@@ -552,6 +604,7 @@ void PeerConnection::end() {
     context = std::move(context_);
   }
   context.reset();
+  ConnectionLoop::Leave(token_.pid);
   loop.forget(id_);  // the loop's reference, perhaps the last
 }
 
@@ -722,8 +775,9 @@ void Listener::stop() {
 
 void Listener::acceptLoop() {
   EnterBackgroundPriority();
-  // Out of descriptors (or memory): since when, and how many peers waited.
-  std::optional<std::chrono::steady_clock::time_point> outOfDescriptors;
+  // Out of descriptors (or memory), and since when.
+  bool outOfDescriptors = false;
+  std::chrono::steady_clock::time_point outSince;
   while (!stopping_) {
     // A peer connecting faster than connections are handed over would
     // otherwise hold an unbounded number of descriptors here; beyond the
@@ -745,7 +799,8 @@ void Listener::acceptLoop() {
       // Out of descriptors or memory: the peers wait in the backlog while
       // the connections already made go on; said once, not per attempt.
       if (!outOfDescriptors) {
-        outOfDescriptors = std::chrono::steady_clock::now();
+        outOfDescriptors = true;
+        outSince = std::chrono::steady_clock::now();
         SystemLog("accept failed: %@; new connections wait until descriptors are free",
                   PosixError(err, "accept"));
       }
@@ -758,9 +813,9 @@ void Listener::acceptLoop() {
     if (outOfDescriptors) {
       SystemLog("accepting again after %lld ms out of descriptors",
                 static_cast<long long>(std::chrono::duration_cast<std::chrono::milliseconds>(
-                                           std::chrono::steady_clock::now() - *outOfDescriptors)
+                                           std::chrono::steady_clock::now() - outSince)
                                            .count()));
-      outOfDescriptors.reset();
+      outOfDescriptors = false;
     }
     struct ucred cred;
     socklen_t len = sizeof cred;
