@@ -121,12 +121,12 @@ class ConnectionLoop {
     if (--it->second.connections == 0) a.byProcess.erase(it);
   }
 
+  // Serves `connection`, named by newId() already.
   void add(std::shared_ptr<PeerConnection> connection) {
     PeerConnection& c = *connection;
     c.lastProgress_ = std::chrono::steady_clock::now();
     {
       std::lock_guard<std::mutex> lock(mu_);
-      c.id_ = nextId_++;
       connections_[c.id_] = std::move(connection);
     }
     std::lock_guard<std::mutex> lock(c.mu_);
@@ -138,6 +138,12 @@ class ConnectionLoop {
       c.closed_ = true;
     }
     if (c.closed_) post(c.id_);  // cancelled already, or not to be served
+  }
+
+  // A name for a connection about to be added.
+  uint64_t newId() {
+    std::lock_guard<std::mutex> lock(mu_);
+    return nextId_++;
   }
 
   // Has the loop serve connection `id` again soon.
@@ -370,6 +376,7 @@ void PeerConnection::resume() {
   if (resumed_) return;  // REQUIRES: called from one thread
   // The loop owns a reference, so the connection lives while it is served.
   loop_ = &ConnectionLoop::For(token_.pid);
+  id_ = loop_->newId();  // before resumed_, which tells other threads both are set
   resumed_ = true;
   loop_->add(shared_from_this());
 }
