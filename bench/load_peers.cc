@@ -55,7 +55,7 @@ void EchoServer::setReply(const dr::Value& body) {
 
 void EchoServer::run() {
   struct Peer {
-    dr::drm1::FrameDecoder decoder;
+    dr::drm1::FrameDecoder decoder{dr::drm1::kFromDaemon};
     uint64_t serial = 1;
   };
   std::map<int, Peer> peers;

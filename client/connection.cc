@@ -41,9 +41,9 @@ struct Connection::State {
   // first: a batch arrives with the first byte of its frame, so no later
   // than the frame, and frames are decoded in order. Guarded by mu.
   std::deque<std::vector<int>> received;
-  std::optional<Error> deadError;  // guarded by mu: why the connection died
-  uint64_t nextSerial = 1;         // guarded by mu
-  drm1::FrameDecoder decoder;      // guarded by mu
+  std::optional<Error> deadError;                 // guarded by mu: why the connection died
+  uint64_t nextSerial = 1;                        // guarded by mu
+  drm1::FrameDecoder decoder{drm1::kFromDaemon};  // guarded by mu
 };
 
 namespace {

@@ -5,9 +5,11 @@
 // server's service queue, in this client's line (clients take turns); the
 // end of the connection stops further work. The connection holds the one
 // lasting reference to its client (its context), so a client lives as long
-// as its connection plus any Transaction of it. Events arrive on the
-// connection's own thread, requests run on the service queue; every member
-// is safe to call from either.
+// as its connection plus any Transaction of it; each Transaction holds its
+// message, and so the message's share of the connection's budget, until it
+// is done. Events arrive on the message service's loop thread, which reads
+// every connection, so handling them must not wait long; requests run on
+// the service queue; every member is safe to call from either.
 #pragma once
 
 #include <sys/types.h>

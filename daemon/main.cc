@@ -6,9 +6,11 @@
 // (for instance another drd already serves the name), 0 after SIGTERM or
 // SIGINT.
 #include <signal.h>
+#include <sys/resource.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <optional>
 #include <string>
@@ -56,6 +58,20 @@ std::optional<CommandLine> ParseCommandLine(int argc, char** argv) {
   return line;
 }
 
+// Each connection holds a descriptor or two; the soft limit (often 1024)
+// would let a few hundred idle peers lock everyone else out, while the hard
+// limit is the user's to give.
+void RaiseDescriptorLimit() {
+  struct rlimit limit;
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max) return;
+  const rlim_t before = limit.rlim_cur;
+  limit.rlim_cur = limit.rlim_max;
+  if (setrlimit(RLIMIT_NOFILE, &limit) != 0) {
+    dr::SystemLog("unable to raise the descriptor limit from %llu: %@",
+                  static_cast<unsigned long long>(before), dr::PosixError(errno, "setrlimit"));
+  }
+}
+
 int Fail(const char* message) {
   dr::SystemLogLine(message);
   sd_notifyf(0, "STATUS=%s", message);
@@ -77,6 +93,7 @@ int main(int argc, char** argv) {
   sigaddset(&stop, SIGINT);
   pthread_sigmask(SIG_BLOCK, &stop, nullptr);
   signal(SIGPIPE, SIG_IGN);
+  RaiseDescriptorLimit();
 
   dr::Result<dr::RegistryOptions> registryOptions = dr::RegistryOptionsFromEnvironment();
   dr::Result<std::unique_ptr<dr::Registry>> registry =

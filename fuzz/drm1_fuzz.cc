@@ -6,6 +6,8 @@
 // - answer the same frames and the same error however the stream is cut;
 // - keep answering its error once it has failed;
 // - account for every byte (consumed by frames or still buffered);
+// - refuse a body past a cap on its values exactly when it holds more, and
+//   count the values of one it takes the same under any cap it fits;
 // and whatever it accepts must encode again, decode to the same value, and
 // encode to the same bytes a second time; its description stays on one line.
 #include <cstddef>
@@ -96,7 +98,20 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   using namespace dr::fuzz;
   const std::string_view in(reinterpret_cast<const char*>(data), size);
 
-  if (Result<Value> body = drm1::DecodeBody(in); body.ok()) CheckEncodesBack(*body);
+  size_t values = 0;
+  Result<Value> body = drm1::DecodeBody(in, SIZE_MAX, &values);
+  if (body.ok()) CheckEncodesBack(*body);
+  // The first byte picks a small cap on the number of values.
+  const size_t cap = size == 0 ? 1 : 1 + data[0] % 64;
+  size_t cappedValues = 0;
+  Result<Value> capped = drm1::DecodeBody(in, cap, &cappedValues);
+  if (body.ok()) {
+    DRD_FUZZ_CHECK(capped.ok() == (values <= cap), "the cap on values refused the wrong body");
+    DRD_FUZZ_CHECK(!capped.ok() || (cappedValues == values && SameValue(*capped, *body)),
+                   "a body under the cap on values decoded otherwise");
+  } else if (capped.ok()) {
+    DRD_FUZZ_CHECK(false, "a body decoded only under a cap on its values");
+  }
 
   Outcome whole = DecodeStream(in, in.size() + 1);
   const size_t step = size == 0 ? 1 : 1 + data[size - 1] % 64;
@@ -111,18 +126,22 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     CheckFrameEncodesBack(a);
     CheckEncodesBack(a.body);
   }
-  // A long-lived connection: a stream of whole frames sent over and over,
-  // past the point where the decoder drops the bytes it has consumed, gives
-  // the same frames every time. Some 70 KB of decoding, so only for one
-  // input length in 32.
+  // A long-lived connection: a stream of whole frames sent over and over
+  // (with serials going up), past the point where the decoder drops the
+  // bytes it has consumed, gives the same frames every time. Some 70 KB of
+  // decoding, so only for one input length in 32.
   if (size % 32 == 0 && !whole.error && !whole.frames.empty()) {
     size_t framed = 0;
     for (const drm1::Frame& f : whole.frames) framed += drm1::kHeaderSize + f.header.bodyLength;
-    const std::string_view frames = in.substr(0, framed);
     drm1::FrameDecoder decoder;
     size_t taken = 0;
+    uint64_t serial = 0;
     const size_t copies = 2 + 70000 / framed;
     for (size_t copy = 0; copy < copies; ++copy) {
+      std::string frames;
+      for (const drm1::Frame& f : whole.frames) {
+        frames += *drm1::EncodeFrame(++serial, f.header.replyTo, f.header.flags, f.body);
+      }
       decoder.feed(frames);
       for (size_t i = 0; i < whole.frames.size(); ++i, ++taken) {
         Result<std::optional<drm1::Frame>> next = decoder.next();

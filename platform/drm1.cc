@@ -66,7 +66,8 @@ bool IsPlainAscii(std::string_view s) {
 // against the bytes left before anything is reserved or copied.
 class BodyReader {
  public:
-  explicit BodyReader(std::string_view in) : in_(in) {}
+  BodyReader(std::string_view in, size_t maxValues) : in_(in), maxValues_(maxValues) {}
+  size_t values() const { return values_; }
 
   Result<Value> readTop() {
     if (in_.empty()) return ProtocolError("empty body");
@@ -118,6 +119,7 @@ class BodyReader {
   Result<Value> read(int depth) {
     const char* p;
     if (!take(1, &p)) return ProtocolError("truncated value tag");
+    if (++values_ > maxValues_) return TooManyValues();
     const auto tag = static_cast<uint8_t>(*p);
     switch (tag) {
       case kTagNull:
@@ -167,6 +169,9 @@ class BodyReader {
         if (*n > left() / least) {
           return ProtocolError("count of " + std::to_string(*n) + " exceeds the body");
         }
+        // Refused before any element is read: a body of small values may
+        // hold far more of them than the cap.
+        if (*n > maxValues_ - values_) return TooManyValues();
         // Room for the elements is made as they come beyond the first few
         // thousand, so that a count the body could hold but does not fill
         // costs no more than the body.
@@ -197,14 +202,20 @@ class BodyReader {
     }
   }
 
+  Error TooManyValues() const {
+    return ProtocolError("more than " + std::to_string(maxValues_) + " values");
+  }
+
   std::string_view in_;
   size_t pos_ = 0;
+  const size_t maxValues_;
+  size_t values_ = 0;  // read so far
 };
 
 // Why `s` cannot be written as text: too long, holding NUL, or not UTF-8,
 // in that order of precedence.
-Status CheckText(std::string_view s, const char* what) {
-  if (s.size() > kMaxBodySize) return Unencodable(std::string(what) + " too long");
+Status CheckText(std::string_view s, const char* what, size_t limit) {
+  if (s.size() > limit) return Unencodable(std::string(what) + " too long");
   if (s.find('\0') != std::string_view::npos) return Unencodable(std::string(what) + " holds NUL");
   if (!IsUtf8(s)) return Unencodable(std::string(what) + " is not UTF-8");
   return Status::OK();
@@ -260,28 +271,34 @@ class FittingSink {
   char* p_;
 };
 
-// Appends to a string, for a body that may pass the limit: it stops with an
-// error at the first value that starts beyond it.
-class GrowingSink {
+// Counts what would be written, for a body known to pass the limit: the
+// writer stops with an error at the first value that starts beyond it, or
+// at a value it refuses before, and nothing the size of the body is made.
+class CountingSink {
  public:
-  explicit GrowingSink(std::string& out) : out_(out) {}
-  bool overLimit() const { return out_.size() > kMaxBodySize; }
-  void put(const void* from, size_t n) { out_.append(static_cast<const char*>(from), n); }
+  explicit CountingSink(size_t limit) : limit_(limit) {}
+  bool overLimit() const { return size_ > limit_; }
+  void put(const void*, size_t n) { size_ += n; }
 
  private:
-  std::string& out_;
+  size_t size_ = 0;
+  const size_t limit_;
 };
 
+std::string TooLarge(size_t limit) {
+  return "body larger than " + std::to_string(limit >> 20) + " MiB";
+}
+
 // The encoder of values, over either sink; both refuse the same values with
-// the same errors, in the same order, except that only the growing sink
+// the same errors, in the same order, except that only the counting sink
 // meets the limit.
 template <typename Sink>
 class ValueWriter {
  public:
-  explicit ValueWriter(Sink& sink) : sink_(sink) {}
+  ValueWriter(Sink& sink, size_t limit) : sink_(sink), limit_(limit) {}
 
   Status value(const Value& v, int depth) {
-    if (sink_.overLimit()) return Unencodable("body larger than 16 MiB");
+    if (sink_.overLimit()) return Unencodable(TooLarge(limit_));
     switch (v.type()) {
       case Value::Type::kAbsent:
         tag(kTagNull);
@@ -310,7 +327,7 @@ class ValueWriter {
         return text(v.stringValue(), "string");
       case Value::Type::kData: {
         const Data& d = v.dataValue();
-        if (d.size() > kMaxBodySize) return Unencodable("data too long");
+        if (d.size() > limit_) return Unencodable("data too long");
         tag(kTagData);
         raw(static_cast<uint32_t>(d.size()));
         sink_.put(d.data(), d.size());
@@ -353,8 +370,8 @@ class ValueWriter {
     sink_.put(&v, sizeof v);
   }
   Status text(std::string_view s, const char* what) {
-    if (s.size() > kMaxBodySize || !IsPlainAscii(s)) {
-      if (Status st = CheckText(s, what); !st.ok()) return st;
+    if (s.size() > limit_ || !IsPlainAscii(s)) {
+      if (Status st = CheckText(s, what, limit_); !st.ok()) return st;
     }
     raw(static_cast<uint32_t>(s.size()));
     sink_.put(s.data(), s.size());
@@ -362,28 +379,28 @@ class ValueWriter {
   }
 
   Sink& sink_;
+  const size_t limit_;
 };
 
 // `value` encoded after `prefix` bytes (left as they are in `out`, which
-// holds at least that many), the buffer sized once.
-Status Encode(std::string& out, size_t prefix, const Value& value) {
+// holds at least that many), the buffer sized once, within `limit` bytes.
+Status Encode(std::string& out, size_t prefix, const Value& value, size_t limit) {
   const size_t size = EncodedSize(value, 1);
-  // The growing sink's limit counts the prefix too.
-  if (prefix + size <= kMaxBodySize) {
+  if (size <= limit) {
     out.resize(prefix + size);
     FittingSink sink(out.data() + prefix);
-    if (Status s = ValueWriter<FittingSink>(sink).value(value, 1); !s.ok()) return s;
+    if (Status s = ValueWriter<FittingSink>(sink, limit).value(value, 1); !s.ok()) return s;
     out.resize(static_cast<size_t>(sink.end() - out.data()));
     return Status::OK();
   }
-  out.reserve(prefix + std::min<size_t>(size, kMaxBodySize + 1));
-  GrowingSink sink(out);
-  return ValueWriter<GrowingSink>(sink).value(value, 1);
+  CountingSink sink(limit);
+  if (Status s = ValueWriter<CountingSink>(sink, limit).value(value, 1); !s.ok()) return s;
+  return Unencodable(TooLarge(limit));
 }
 
 }  // namespace
 
-Result<Header> DecodeHeader(std::string_view bytes) {
+Result<Header> DecodeHeader(std::string_view bytes, const Limits& limits) {
   const char* p = bytes.data();
   if (std::memcmp(p, kMagic, sizeof kMagic) != 0) return ProtocolError("bad magic");
   Header h;
@@ -392,8 +409,9 @@ Result<Header> DecodeHeader(std::string_view bytes) {
   h.replyTo = Load<uint64_t>(p + 16);
   h.flags = Load<uint32_t>(p + 24);
   const uint32_t reserved = Load<uint32_t>(p + 28);
-  if (h.bodyLength > kMaxBodySize) {
-    return ProtocolError("body length " + std::to_string(h.bodyLength) + " above 16 MiB");
+  if (h.bodyLength > limits.maxBodySize) {
+    return ProtocolError("body length " + std::to_string(h.bodyLength) + " above " +
+                         std::to_string(limits.maxBodySize >> 20) + " MiB");
   }
   if (h.serial == 0) return ProtocolError("serial 0");
   if ((h.flags & ~(kFlagWantsReply | kFlagIsReply | kFlagDescriptors)) != 0)
@@ -405,21 +423,27 @@ Result<Header> DecodeHeader(std::string_view bytes) {
   return h;
 }
 
-Result<Value> DecodeBody(std::string_view body) { return BodyReader(body).readTop(); }
+Result<Value> DecodeBody(std::string_view body, size_t maxValues, size_t* values) {
+  BodyReader reader(body, maxValues);
+  Result<Value> value = reader.readTop();
+  if (values) *values = reader.values();
+  return value;
+}
 
 Result<std::string> EncodeValue(const Value& value) {
   std::string out;
-  if (Status s = Encode(out, 0, value); !s.ok()) return s.error();
+  if (Status s = Encode(out, 0, value, kMaxBodySize); !s.ok()) return s.error();
   return out;
 }
 
 Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
                                 const Value& body) {
   if (!body.isDictionary()) return Unencodable("the body is not a dictionary");
+  const size_t limit = (flags & kFlagIsReply) != 0 ? kMaxReplyBodySize : kMaxBodySize;
   std::string out(kHeaderSize, '\0');
-  if (Status s = Encode(out, kHeaderSize, body); !s.ok()) return s.error();
+  if (Status s = Encode(out, kHeaderSize, body, limit); !s.ok()) return s.error();
   const size_t length = out.size() - kHeaderSize;
-  if (length > kMaxBodySize) return Unencodable("body larger than 16 MiB");
+  if (length > limit) return Unencodable(TooLarge(limit));
   std::memcpy(out.data(), kMagic, sizeof kMagic);
   const uint32_t length32 = static_cast<uint32_t>(length), reserved = 0;
   std::memcpy(out.data() + 4, &length32, 4);
@@ -430,29 +454,56 @@ Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flag
   return out;
 }
 
-Result<std::optional<Frame>> FrameDecoder::next() {
+Error FrameDecoder::fail(Error error) {
+  error_ = std::move(error);
+  return *error_;
+}
+
+Result<std::optional<Header>> FrameDecoder::nextHeader() {
   if (error_) return *error_;
+  if (header_) return header_;
   std::string_view pending = std::string_view(buffer_).substr(consumed_);
-  if (pending.size() < kHeaderSize) return std::optional<Frame>();
-  Result<Header> header = DecodeHeader(pending);
-  if (!header) {
-    error_ = header.error();
-    return *error_;
+  if (pending.size() < kHeaderSize) return std::optional<Header>();
+  Result<Header> header = DecodeHeader(pending, limits_);
+  if (!header) return fail(header.error());
+  if (header->serial <= lastSerial_) {
+    return fail(ProtocolError("serial " + std::to_string(header->serial) +
+                              " not above the one before, " + std::to_string(lastSerial_)));
   }
-  if (pending.size() - kHeaderSize < header->bodyLength) return std::optional<Frame>();
-  Result<Value> body = DecodeBody(pending.substr(kHeaderSize, header->bodyLength));
-  if (!body) {
-    error_ = body.error();
-    return *error_;
-  }
-  consumed_ += kHeaderSize + header->bodyLength;
-  // Drop consumed bytes once they dominate, so a long-lived connection's
-  // buffer stays the size of what is in flight.
-  if (consumed_ > 65536 && consumed_ * 2 > buffer_.size()) {
+  header_ = *header;
+  return header_;
+}
+
+Result<std::optional<Frame>> FrameDecoder::next() {
+  Result<std::optional<Header>> header = nextHeader();
+  if (!header) return header.error();
+  if (!header->has_value()) return std::optional<Frame>();
+  const Header h = **header;
+  if (buffered() - kHeaderSize < h.bodyLength) return std::optional<Frame>();
+  size_t values = 0;
+  Result<Value> body =
+      DecodeBody(std::string_view(buffer_).substr(consumed_ + kHeaderSize, h.bodyLength),
+                 limits_.maxValues, &values);
+  if (!body) return fail(body.error());
+  consumed_ += kHeaderSize + h.bodyLength;
+  lastSerial_ = h.serial;
+  header_.reset();
+  if (consumed_ == buffer_.size()) {
+    // All taken: a connection that sent one large frame keeps no large
+    // buffer while it idles.
+    consumed_ = 0;
+    if (buffer_.capacity() > 65536) {
+      std::string().swap(buffer_);
+    } else {
+      buffer_.clear();
+    }
+  } else if (consumed_ > 65536 && consumed_ * 2 > buffer_.size()) {
+    // Drop consumed bytes once they dominate, so a long-lived connection's
+    // buffer stays the size of what is in flight.
     buffer_.erase(0, consumed_);
     consumed_ = 0;
   }
-  return std::optional<Frame>(Frame{*header, std::move(*body)});
+  return std::optional<Frame>(Frame{h, std::move(*body), values});
 }
 
 }  // namespace dr::drm1

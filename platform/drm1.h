@@ -3,7 +3,7 @@
 // Every message in either direction is one frame, a 32-byte header and a
 // body; all integers are little-endian:
 //
-//   frame  := magic "DRM1" | u32 body-length (<= 16 MiB) | u64 serial (!= 0)
+//   frame  := magic "DRM1" | u32 body-length | u64 serial (!= 0, increasing)
 //             | u64 reply-to | u32 flags | u32 reserved (0) | body
 //   flags  := bit 0: the sender wants a reply; bit 1: this is a reply
 //             (reply-to is the request's serial; 0 for anything else);
@@ -17,10 +17,15 @@
 //   array  := u32 element count, values
 //   dictionary := u32 entry count, (key: string, value)*; keys unique
 //
-// Nesting is at most 64 levels (the top dictionary is level 1). A frame that
-// breaks any rule is refused with kDrm1ErrorDomain and a message naming the
-// field at fault; the decoder never trusts a length or count. Null decodes
-// to an absent value (and so vanishes from a dictionary).
+// Nesting is at most 64 levels (the top dictionary is level 1). A frame sent
+// to the daemon has a body of at most 16 MiB holding at most 1,048,576 values
+// (every array element and dictionary value, the top dictionary too), so
+// that what it decodes to stays a small multiple of its bytes; a frame from
+// the daemon may be 256 MiB and hold any number of values. The serials of a
+// stream are strictly increasing (gaps allowed). A frame that breaks any
+// rule is refused with kDrm1ErrorDomain and a message naming the field at
+// fault; the decoder never trusts a length or count. Null decodes to an
+// absent value (and so vanishes from a dictionary).
 //
 // Stateless functions, and a FrameDecoder owned by one connection; neither
 // is shared between threads.
@@ -44,7 +49,9 @@ inline constexpr int64_t kUnencodable = 2;    // the value cannot be sent
 
 inline constexpr char kMagic[4] = {'D', 'R', 'M', '1'};
 inline constexpr size_t kHeaderSize = 32;
-inline constexpr uint32_t kMaxBodySize = uint32_t{16} << 20;
+inline constexpr uint32_t kMaxBodySize = uint32_t{16} << 20;        // sent to the daemon
+inline constexpr uint32_t kMaxReplyBodySize = uint32_t{256} << 20;  // sent by the daemon
+inline constexpr size_t kMaxValues = size_t{1} << 20;               // sent to the daemon
 inline constexpr int kMaxDepth = 64;
 inline constexpr uint32_t kFlagWantsReply = 1u << 0;
 inline constexpr uint32_t kFlagIsReply = 1u << 1;
@@ -68,6 +75,15 @@ enum Tag : uint8_t {
   kTagDictionary = 0x0B,
 };
 
+// What a reader takes: frames sent to the daemon (what the daemon reads) or
+// frames the daemon sends (what its clients read).
+struct Limits {
+  uint32_t maxBodySize;
+  size_t maxValues;
+};
+inline constexpr Limits kToDaemon{kMaxBodySize, kMaxValues};
+inline constexpr Limits kFromDaemon{kMaxReplyBodySize, SIZE_MAX};
+
 struct Header {
   uint32_t bodyLength = 0;
   uint64_t serial = 0;
@@ -81,40 +97,54 @@ struct Header {
 
 struct Frame {
   Header header;
-  Value body;  // always a dictionary
+  Value body;         // always a dictionary
+  size_t values = 0;  // how many values the body held, the top dictionary too
 };
 
 // The header in the first kHeaderSize bytes of `bytes`, checked.
 // REQUIRES: bytes.size() >= kHeaderSize.
-Result<Header> DecodeHeader(std::string_view bytes);
+Result<Header> DecodeHeader(std::string_view bytes, const Limits& limits = kToDaemon);
 
-// The value of a body, checked; the top level must be a dictionary.
-Result<Value> DecodeBody(std::string_view body);
+// The value of a body, checked; the top level must be a dictionary holding
+// at most `maxValues` values in all; their number goes to `values`.
+Result<Value> DecodeBody(std::string_view body, size_t maxValues = SIZE_MAX,
+                         size_t* values = nullptr);
 
 // The encoding of one value (any type; absent is written as null).
 // Fails with kUnencodable for text that is not UTF-8 or holds NUL.
 Result<std::string> EncodeValue(const Value& value);
 
 // A whole frame: `body` must be a dictionary and encode to at most
-// kMaxBodySize bytes; the header's bodyLength is filled in. Fails with
-// kUnencodable otherwise.
+// kMaxBodySize bytes (kMaxReplyBodySize for a reply, kFlagIsReply); the
+// header's bodyLength is filled in. Fails with kUnencodable otherwise.
 Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
                                 const Value& body);
 
-// Splits a byte stream into frames. Feed it what the socket delivers; take
-// frames while next() answers one. After an error the stream is unusable
-// (the connection must be closed) and next() keeps answering that error.
+// Splits a byte stream into frames within `limits`. Feed it what the socket
+// delivers; take frames while next() answers one. The buffer holds what was
+// fed and not yet taken, never more: a header's length reserves nothing. After
+// an error the stream is unusable (the connection must be closed) and next()
+// keeps answering that error.
 class FrameDecoder {
  public:
+  explicit FrameDecoder(const Limits& limits = kToDaemon) : limits_(limits) {}
   void feed(std::string_view bytes) { buffer_.append(bytes); }
+  // The checked header of the next frame once its bytes are in (nothing
+  // before), or the protocol error.
+  Result<std::optional<Header>> nextHeader();
   // A frame, nothing when more bytes are needed, or the protocol error.
   Result<std::optional<Frame>> next();
   // Bytes received and not yet consumed by a frame.
   size_t buffered() const { return buffer_.size() - consumed_; }
 
  private:
+  Error fail(Error error);
+
+  Limits limits_;
   std::string buffer_;
   size_t consumed_ = 0;
+  uint64_t lastSerial_ = 0;       // of the last frame taken
+  std::optional<Header> header_;  // of the next frame, once checked
   std::optional<Error> error_;
 };
 

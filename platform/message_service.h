@@ -9,20 +9,35 @@
 // connections, not for all of them. At most kMaxWaitingConnections wait
 // for their turn; beyond that new peers stay in the socket's backlog until
 // the queue catches up, so a peer connecting in a loop cannot exhaust the
-// daemon's descriptors. Each PeerConnection reads DRM1 frames on a thread of
-// its own (a few threads whose connection ended wait a while to serve the
-// next one, instead of a thread made per connection) and delivers its events
-// to its handler one at a time, in order: a message per frame, and a final
-// kConnectionInvalid when the peer hangs up, breaks the protocol (logged,
-// and only that connection closes) or is cancelled. Replies are queued per
-// connection: one with nothing queued before it is written at once by the
-// sender, as far as the socket takes it without waiting, and the rest by the
-// connection's thread, so sending never blocks the caller; a peer whose
-// queue passes kMaxQueuedReplyBytes is closed, and one with
-// kMaxUnansweredRequests requests in flight is not read until they are
-// answered.
+// daemon's descriptors; when they run out all the same, accepting pauses
+// (logged once) while the connections already made are served.
 //
-// Ownership: a connection keeps itself alive while its thread runs, and
+// Connections are read by a few event loop threads (epoll), all of one
+// process's connections by the same loop, so a connection idle between
+// frames costs no thread; a loop decodes DRM1 frames and delivers each
+// connection's events to its handler one at a time, in order:
+// a message per frame, and a final kConnectionInvalid when the peer hangs
+// up, breaks the protocol (logged, and only that connection closes), stops
+// for kFrameStallLimit in the middle of a frame, or is cancelled.
+//
+// Budgets. Every message delivered holds a share of its connection's budget
+// until the work it started is over (the last copy of its PeerMessage is
+// gone), whether it wants a reply or not: at kMaxMessagesInFlight messages
+// or kMaxBytesInFlight bytes the connection is not read until work ends.
+// All connections together hold at most kMaxBytesInFlightTotal, counted
+// from a frame's header on (its bytes, and what its values may decode to),
+// except that a connection with nothing in flight may always bring in one
+// frame of at most kSmallFrameBytes, so that an ordinary client is served
+// while others hold the whole budget. A connection over a budget is not
+// closed: it waits, and so does its peer.
+//
+// Replies are queued per connection: one with nothing queued before it is
+// written at once by the sender, as far as the socket takes it without
+// waiting, and the rest by the loop, so sending never blocks the caller; a
+// peer whose queue passes kMaxQueuedReplyBytes (the reply being written not
+// counted) is closed.
+//
+// Ownership: a connection keeps itself alive while the loop serves it, and
 // holds its context object until its last event has been delivered; callers
 // keep weak references. All members are safe to call from any thread.
 #pragma once
@@ -30,6 +45,7 @@
 #include <sys/types.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <deque>
 #include <functional>
@@ -59,7 +75,12 @@ struct PeerMessage {
   uint64_t serial = 0;
   bool wantsReply = false;
   Value body;  // a dictionary
+  // The message's share of its connection's budget, given back when the
+  // last copy of the message is gone.
+  std::shared_ptr<const void> budget;
 };
+
+class ConnectionLoop;
 
 struct ConnectionEvent {
   enum class Kind { kMessage, kConnectionInvalid };
@@ -70,10 +91,22 @@ struct ConnectionEvent {
 class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
  public:
   static constexpr size_t kMaxQueuedReplyBytes = size_t{64} << 20;
-  // Requests delivered and not yet answered, per connection. At the limit the
-  // connection is not read until replies go out, so one peer that pipelines
-  // without end cannot fill the queue every peer's requests share.
-  static constexpr uint32_t kMaxUnansweredRequests = 64;
+  // Messages delivered whose work is not over, per connection, with or
+  // without a reply: one peer that pipelines without end cannot fill the
+  // queue every peer's requests share.
+  static constexpr uint32_t kMaxMessagesInFlight = 64;
+  // The bytes those messages count for, per connection and in all: a
+  // frame's own bytes plus kValueCost per value it holds, at least what its
+  // decoded values take in memory (41 bytes a null in an array, 50 a short
+  // string, 88 a dictionary entry with its own key). A 16 MiB frame counts
+  // up to 112 MiB, so two such are in drd at once.
+  static constexpr size_t kMaxBytesInFlight = size_t{16} << 20;
+  static constexpr size_t kMaxBytesInFlightTotal = size_t{256} << 20;
+  static constexpr size_t kValueCost = 96;
+  // What a connection with nothing in flight may bring in past the total.
+  static constexpr size_t kSmallFrameBytes = 4096;
+  // How long a peer may stop in the middle of a frame.
+  static constexpr std::chrono::seconds kFrameStallLimit{30};
 
   ~PeerConnection();
   PeerConnection(const PeerConnection&) = delete;
@@ -108,27 +141,48 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
 
  private:
   friend class Listener;
+  friend class ConnectionLoop;
+  friend struct MessageBudget;
+  friend class MessageShare;
+  enum class Pump { kNeedBytes, kWaiting, kBroken };
+
   PeerConnection(int fd, AuditToken token);
-  void run();
-  bool writeSome();        // false when the peer is gone
-  bool writeSomeLocked();  // writeSome; REQUIRES: mu_ held
-  void wake();
+  // On the loop thread: serves the connection after `events` (0 when it
+  // was asked to look again); false once it has ended.
+  bool serve(uint32_t events);
+  Pump deliverFrames();
+  void end();
+  void release(size_t bytes);   // a message's budget comes back
+  void endSoon();               // from any thread: the loop ends it
+  bool writeSomeLocked();       // false when the peer is gone; REQUIRES: mu_ held
+  void updateInterestLocked();  // REQUIRES: mu_ held
 
   const int fd_;
-  const int wakeFd_;
   const AuditToken token_;
+  ConnectionLoop* loop_ = nullptr;  // the loop that reads it, set by resume()
+  uint64_t id_ = 0;                 // the loop's name for it, set by resume()
   std::atomic<bool> closed_{false};
   std::atomic<bool> resumed_{false};
 
   mutable std::mutex mu_;
-  std::string outbox_;     // guarded by mu_: encoded frames not yet written
-  size_t outboxSent_ = 0;  // guarded by mu_
-  // Descriptors to send with the frame at an offset of outbox_; guarded by mu_.
-  std::deque<std::pair<size_t, std::vector<UniqueFd>>> outboxDescriptors_;
-  uint64_t nextSerial_ = 1;                              // guarded by mu_
-  uint32_t unanswered_ = 0;                              // guarded by mu_
-  std::shared_ptr<void> context_;                        // guarded by mu_
+  std::deque<std::string> outbox_;  // guarded by mu_: encoded frames not yet written
+  // The descriptors sent with each frame of outbox_ (most have none).
+  std::deque<std::vector<UniqueFd>> outboxDescriptors_;  // guarded by mu_
+  size_t outboxSent_ = 0;          // guarded by mu_: bytes of the first one written
+  size_t outboxQueued_ = 0;        // guarded by mu_: bytes of all but the first
+  uint64_t nextSerial_ = 1;        // guarded by mu_
+  uint32_t inFlight_ = 0;          // guarded by mu_: messages whose work is not over
+  size_t inFlightBytes_ = 0;       // guarded by mu_
+  bool reading_ = true;            // guarded by mu_: wants to read the socket
+  bool waitingForBudget_ = false;  // guarded by mu_: a release must wake the loop
+  uint32_t interest_ = 0;          // guarded by mu_: the events asked of epoll
+  std::shared_ptr<void> context_;  // guarded by mu_
   std::function<void(const ConnectionEvent&)> handler_;  // set before resume
+
+  // The loop thread's alone.
+  drm1::FrameDecoder decoder_;
+  size_t reserved_ = 0;  // of the total budget, for the frame being read
+  std::chrono::steady_clock::time_point lastProgress_;
 };
 
 struct ListenerOptions {

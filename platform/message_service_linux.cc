@@ -1,18 +1,27 @@
 #include <fcntl.h>
 #include <poll.h>
+#include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/uio.h>
 #include <sys/un.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <array>
 #include <cerrno>
 #include <chrono>
 #include <condition_variable>
+#include <cstdlib>
 #include <cstring>
 #include <deque>
+#include <iterator>
 #include <map>
+#include <set>
+#include <unordered_map>
+#include <vector>
 
 #include "core/log.h"
 #include "platform/file_system.h"
@@ -29,6 +38,12 @@ namespace {
 #endif
 
 constexpr size_t kReadChunk = 65536;
+// How long the listener leaves its socket alone when accept fails for want
+// of descriptors or memory.
+constexpr std::chrono::milliseconds kAcceptBackOff{250};
+// Reads of one connection in one turn of the loop, so that a peer sending
+// without pause does not keep the loop from the others.
+constexpr int kReadsPerTurn = 16;
 
 int MakeWakeFd() { return ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); }
 
@@ -40,70 +55,6 @@ void DrainWakeFd(int fd) {
 
 std::atomic<int> gKeepAlive{0};
 
-// How long a connection's thread waits for another connection to serve
-// before it ends, and how many may wait at once: a burst of thousands of
-// connections must not leave thousands of threads behind, which would also
-// end all at once and hold up thread creation meanwhile (glibc frees their
-// stacks under one lock).
-constexpr auto kReaderLinger = std::chrono::seconds(10);
-constexpr size_t kMaxIdleReaders = 16;
-
-// The threads connections read on. A thread whose connection ended waits a
-// while for the next one instead of ending: a peer that connects and
-// disconnects in a loop otherwise costs a thread's creation and teardown
-// (clone, stack mapping and guard page) per connection, about a tenth of
-// what drd spends on such a connection.
-class ReaderThreads {
- public:
-  static ReaderThreads& Get() {
-    static ReaderThreads* threads = new ReaderThreads();  // waiting threads use it until exit
-    return *threads;
-  }
-
-  // Runs `job` on a waiting thread, or on a new one when none waits.
-  void run(std::function<void()> job) {
-    {
-      std::lock_guard<std::mutex> lock(mu_);
-      if (idle_ > jobs_.size()) {
-        jobs_.push_back(std::move(job));
-        cv_.notify_one();
-        return;
-      }
-    }
-    std::thread([this, job = std::move(job)]() mutable {
-      // Reading connections gives way to running the requests read: a peer
-      // flooding drd with connections or frames waits, not the clients.
-      EnterBackgroundPriority();
-      job();
-      job = nullptr;  // release what the job holds before waiting
-      serveMore();
-    }).detach();
-  }
-
- private:
-  void serveMore() {
-    std::unique_lock<std::mutex> lock(mu_);
-    for (;;) {
-      if (idle_ >= kMaxIdleReaders) return;
-      ++idle_;
-      const bool got = cv_.wait_for(lock, kReaderLinger, [&] { return !jobs_.empty(); });
-      --idle_;
-      if (!got) return;
-      std::function<void()> job = std::move(jobs_.front());
-      jobs_.pop_front();
-      lock.unlock();
-      job();
-      job = nullptr;
-      lock.lock();
-    }
-  }
-
-  std::mutex mu_;
-  std::condition_variable cv_;
-  std::deque<std::function<void()>> jobs_;  // guarded by mu_
-  size_t idle_ = 0;                         // guarded by mu_: threads waiting for a job
-};
-
 void NotifyKeepAlive(int count) {
   // Only meaningful under systemd; sd_notify does nothing elsewhere.
   if (count > 0) {
@@ -113,20 +64,299 @@ void NotifyKeepAlive(int count) {
   }
 }
 
+// The most a frame of `bodyLength` bytes may count for before it is decoded,
+// and what it counts for once it holds `values` values.
+size_t FrameBytes(size_t bodyLength, size_t values) {
+  return drm1::kHeaderSize + bodyLength + values * PeerConnection::kValueCost;
+}
+size_t MostFrameBytes(size_t bodyLength) {
+  return FrameBytes(bodyLength, std::min(std::max<size_t>(bodyLength, 1), drm1::kMaxValues));
+}
+
 }  // namespace
 
 void KeepAliveBegin() { NotifyKeepAlive(++gKeepAlive); }
 void KeepAliveEnd() { NotifyKeepAlive(--gKeepAlive); }
 int KeepAliveCount() { return gKeepAlive.load(); }
 
+// ---- The loop ---------------------------------------------------------------
+
+// A thread that reads connections: epoll over their sockets, plus an
+// eventfd through which other threads ask it to look at a connection again
+// (closed, or room made in a budget). There are kLoops of them, made when
+// first needed, each living until exit. All connections of one process are
+// read by the same loop, and a process with none is given the loop that
+// reads the fewest: a process flooding drd keeps its own loop busy, while
+// the other processes' loops sleep until their peers send, and so are
+// scheduled at once although at background priority.
+class ConnectionLoop {
+ public:
+  static constexpr size_t kLoops = 4;
+
+  // The loop for a new connection of process `pid`.
+  static ConnectionLoop& For(pid_t pid) {
+    Assignments& a = Assignments::Get();
+    std::lock_guard<std::mutex> lock(a.mu);
+    auto it = a.byProcess.find(pid);
+    size_t i;
+    if (it != a.byProcess.end()) {
+      i = it->second.loop;
+      ++it->second.connections;
+    } else {
+      i = static_cast<size_t>(std::min_element(a.connections.begin(), a.connections.end()) -
+                              a.connections.begin());
+      a.byProcess[pid] = {i, 1};
+    }
+    ++a.connections[i];
+    if (!a.loops[i]) a.loops[i] = new ConnectionLoop();  // served until exit
+    return *a.loops[i];
+  }
+
+  // A connection of process `pid` has ended.
+  static void Leave(pid_t pid) {
+    Assignments& a = Assignments::Get();
+    std::lock_guard<std::mutex> lock(a.mu);
+    auto it = a.byProcess.find(pid);
+    if (it == a.byProcess.end()) return;
+    --a.connections[it->second.loop];
+    if (--it->second.connections == 0) a.byProcess.erase(it);
+  }
+
+  // Serves `connection`, named by newId() already.
+  void add(std::shared_ptr<PeerConnection> connection) {
+    PeerConnection& c = *connection;
+    c.lastProgress_ = std::chrono::steady_clock::now();
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      connections_[c.id_] = std::move(connection);
+    }
+    std::lock_guard<std::mutex> lock(c.mu_);
+    struct epoll_event ev = {};
+    ev.events = c.interest_ = EPOLLIN;
+    ev.data.u64 = c.id_;
+    if (::epoll_ctl(epollFd_, EPOLL_CTL_ADD, c.fd_, &ev) != 0) {
+      SystemLog("closing %@: %@", c.description(), PosixError(errno, "epoll_ctl"));
+      c.closed_ = true;
+    }
+    if (c.closed_) post(c.id_);  // cancelled already, or not to be served
+  }
+
+  // A name for a connection about to be added.
+  uint64_t newId() {
+    std::lock_guard<std::mutex> lock(mu_);
+    return nextId_++;
+  }
+
+  // Has the loop serve connection `id` again soon.
+  void post(uint64_t id) {
+    std::lock_guard<std::mutex> lock(mu_);
+    postLocked(id);
+  }
+
+  void setInterest(int fd, uint64_t id, uint32_t events) {
+    struct epoll_event ev = {};
+    ev.events = events;
+    ev.data.u64 = id;
+    ::epoll_ctl(epollFd_, EPOLL_CTL_MOD, fd, &ev);  // fails only once the connection ended
+  }
+
+  void remove(PeerConnection& c) {
+    ::epoll_ctl(epollFd_, EPOLL_CTL_DEL, c.fd_, nullptr);
+    midFrame_.erase(c.id_);
+  }
+
+  void forget(uint64_t id) {
+    std::shared_ptr<PeerConnection> last;  // perhaps the last reference: dropped unlocked
+    std::lock_guard<std::mutex> lock(mu_);
+    auto it = connections_.find(id);
+    if (it == connections_.end()) return;
+    last = std::move(it->second);
+    connections_.erase(it);
+  }
+
+  // Whether `c` is waiting in the middle of a frame for its peer.
+  void noteMidFrame(PeerConnection& c, bool midFrame) {
+    if (midFrame) {
+      midFrame_.insert(c.id_);
+    } else {
+      midFrame_.erase(c.id_);
+    }
+  }
+
+  char* readBuffer() { return readBuffer_.get(); }
+
+ private:
+  ConnectionLoop()
+      : epollFd_(::epoll_create1(EPOLL_CLOEXEC)),
+        wakeFd_(MakeWakeFd()),
+        readBuffer_(new char[kReadChunk]) {
+    struct epoll_event ev = {};
+    ev.events = EPOLLIN;
+    ev.data.u64 = 0;
+    if (epollFd_ < 0 || wakeFd_ < 0 || ::epoll_ctl(epollFd_, EPOLL_CTL_ADD, wakeFd_, &ev) != 0) {
+      SystemLog("the connection loop cannot start: %@", PosixError(errno, "epoll"));
+      std::abort();
+    }
+    std::thread([this] { run(); }).detach();
+  }
+
+  // Which loop reads which process's connections.
+  struct Assignments {
+    static Assignments& Get() {
+      static Assignments* assignments = new Assignments();  // used until exit
+      return *assignments;
+    }
+    struct Process {
+      size_t loop;
+      size_t connections;
+    };
+    std::mutex mu;
+    std::array<ConnectionLoop*, kLoops> loops{};   // guarded by mu
+    std::array<size_t, kLoops> connections{};      // guarded by mu
+    std::unordered_map<pid_t, Process> byProcess;  // guarded by mu
+  };
+
+  void postLocked(uint64_t id) {
+    const bool first = posted_.empty();
+    posted_.push_back(id);
+    if (first) {
+      uint64_t one = 1;
+      [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
+    }
+  }
+
+  std::shared_ptr<PeerConnection> find(uint64_t id) {
+    std::lock_guard<std::mutex> lock(mu_);
+    auto it = connections_.find(id);
+    return it == connections_.end() ? nullptr : it->second;
+  }
+
+  void run() {
+    // Reading connections gives way to running the requests read: a peer
+    // flooding drd with frames waits, not the clients.
+    EnterBackgroundPriority();
+    struct epoll_event events[64];
+    auto lastSweep = std::chrono::steady_clock::now();
+    for (;;) {
+      // Only a connection in the middle of a frame has a deadline.
+      const int timeout = midFrame_.empty() ? -1 : 1000;
+      const int n = ::epoll_wait(epollFd_, events, 64, timeout);
+      if (n < 0 && errno != EINTR) {
+        SystemLog("the connection loop failed: %@", PosixError(errno, "epoll_wait"));
+        std::abort();
+      }
+      for (int i = 0; i < n; ++i) {
+        if (events[i].data.u64 == 0) {
+          DrainWakeFd(wakeFd_);
+        } else if (std::shared_ptr<PeerConnection> c = find(events[i].data.u64)) {
+          c->serve(events[i].events);
+        }
+      }
+      std::vector<uint64_t> posted;
+      {
+        std::lock_guard<std::mutex> lock(mu_);
+        posted.swap(posted_);
+      }
+      for (uint64_t id : posted) {
+        if (std::shared_ptr<PeerConnection> c = find(id)) c->serve(0);
+      }
+      const auto now = std::chrono::steady_clock::now();
+      if (!midFrame_.empty() && now - lastSweep >= std::chrono::seconds(1)) {
+        lastSweep = now;
+        sweepStalled(now);
+      }
+    }
+  }
+
+  void sweepStalled(std::chrono::steady_clock::time_point now) {
+    std::vector<uint64_t> ids(midFrame_.begin(), midFrame_.end());
+    for (uint64_t id : ids) {
+      std::shared_ptr<PeerConnection> c = find(id);
+      if (!c || now - c->lastProgress_ < PeerConnection::kFrameStallLimit) continue;
+      SystemLog("protocol error on %@: no byte for %d s in the middle of a frame", c->description(),
+                static_cast<int>(PeerConnection::kFrameStallLimit.count()));
+      c->end();
+    }
+  }
+
+  const int epollFd_;
+  const int wakeFd_;
+  std::unique_ptr<char[]> readBuffer_;
+  std::mutex mu_;
+  std::unordered_map<uint64_t, std::shared_ptr<PeerConnection>> connections_;  // guarded by mu_
+  std::vector<uint64_t> posted_;                                               // guarded by mu_
+  uint64_t nextId_ = 1;                                                        // guarded by mu_
+  std::set<uint64_t> midFrame_;  // the loop thread's alone
+};
+
+// The budget all connections share, and the connections waiting for room.
+struct MessageBudget {
+  static MessageBudget& Get() {
+    static MessageBudget* budget = new MessageBudget();  // used until exit
+    return *budget;
+  }
+
+  // Takes `bytes` when they fit, or when `small` (a connection with nothing
+  // in flight reading a small frame); else `c` waits for room.
+  bool take(PeerConnection& c, size_t bytes, bool small) {
+    std::lock_guard<std::mutex> lock(mu);
+    if (small || used + bytes <= PeerConnection::kMaxBytesInFlightTotal) {
+      used += bytes;
+      return true;
+    }
+    waiting.emplace_back(c.loop_, c.id_);
+    if (!full) {
+      full = true;
+      SystemLog("connections have %zu MiB in flight in all: reading waits for room", used >> 20);
+    }
+    return false;
+  }
+
+  void give(size_t bytes) {
+    if (bytes == 0) return;
+    std::vector<std::pair<ConnectionLoop*, uint64_t>> wake;
+    {
+      std::lock_guard<std::mutex> lock(mu);
+      used -= bytes;
+      if (waiting.empty()) {
+        full = false;
+        return;
+      }
+      wake.swap(waiting);
+    }
+    for (const auto& [loop, id] : wake) loop->post(id);
+  }
+
+  std::mutex mu;
+  size_t used = 0;  // guarded by mu
+  // Guarded by mu: connections to serve again once room is made.
+  std::vector<std::pair<ConnectionLoop*, uint64_t>> waiting;
+  bool full = false;  // guarded by mu: logged once until it empties
+};
+
+// A delivered message's share of the budgets.
+class MessageShare {
+ public:
+  MessageShare(std::weak_ptr<PeerConnection> connection, size_t bytes)
+      : connection_(std::move(connection)), bytes_(bytes) {}
+  ~MessageShare() {
+    MessageBudget::Get().give(bytes_);
+    if (std::shared_ptr<PeerConnection> c = connection_.lock()) c->release(bytes_);
+  }
+  MessageShare(const MessageShare&) = delete;
+  MessageShare& operator=(const MessageShare&) = delete;
+
+ private:
+  const std::weak_ptr<PeerConnection> connection_;
+  const size_t bytes_;
+};
+
 // ---- PeerConnection ---------------------------------------------------------
 
-PeerConnection::PeerConnection(int fd, AuditToken token)
-    : fd_(fd), wakeFd_(MakeWakeFd()), token_(token) {}
+PeerConnection::PeerConnection(int fd, AuditToken token) : fd_(fd), token_(token) {}
 
 PeerConnection::~PeerConnection() {
   ::close(fd_);
-  if (wakeFd_ >= 0) ::close(wakeFd_);
   if (token_.pidfd >= 0) ::close(token_.pidfd);
 }
 
@@ -144,14 +374,17 @@ void PeerConnection::setEventHandler(std::function<void(const ConnectionEvent&)>
 }
 
 void PeerConnection::resume() {
-  if (resumed_.exchange(true)) return;
-  // The thread owns a reference, so the connection lives while it reads.
-  ReaderThreads::Get().run([self = shared_from_this()] { self->run(); });
+  if (resumed_) return;  // REQUIRES: called from one thread
+  // The loop owns a reference, so the connection lives while it is served.
+  loop_ = &ConnectionLoop::For(token_.pid);
+  id_ = loop_->newId();  // before resumed_, which tells other threads both are set
+  resumed_ = true;
+  loop_->add(shared_from_this());
 }
 
-void PeerConnection::wake() {
-  uint64_t one = 1;
-  [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
+void PeerConnection::endSoon() {
+  closed_ = true;
+  if (resumed_) loop_->post(id_);
 }
 
 Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
@@ -165,152 +398,232 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
   Result<std::string> frame = drm1::EncodeFrame(nextSerial_, requestSerial, flags, body);
   if (!frame) return frame.error();
   ++nextSerial_;
-  // A connection at its limit of unanswered requests is not being read; its
-  // thread must hear that this reply makes room.
-  const bool wasFull = unanswered_ >= kMaxUnansweredRequests;
-  if (unanswered_ > 0) --unanswered_;
-  if (outbox_.size() - outboxSent_ + frame->size() > kMaxQueuedReplyBytes) {
+  const bool queuedBefore = !outbox_.empty();
+  if (queuedBefore && outboxQueued_ + frame->size() > kMaxQueuedReplyBytes) {
     SystemLog("closing %@: more than 64 MiB of replies unread", description());
-    closed_ = true;
-    wake();
+    endSoon();
     return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "reply queue full");
   }
-  const bool queuedBefore = outboxSent_ < outbox_.size();
-  if (!descriptors.empty()) outboxDescriptors_.emplace_back(outbox_.size(), std::move(descriptors));
-  outbox_ += *frame;
-  // Nothing ahead of it: write it from here rather than waking the
-  // connection's thread to do so, which would double the thread switches
-  // of every request. A failure is left to that thread to find.
-  if (!queuedBefore) writeSomeLocked();
-  if (outboxSent_ < outbox_.size() || wasFull) wake();
+  if (queuedBefore) outboxQueued_ += frame->size();
+  outbox_.push_back(std::move(*frame));
+  outboxDescriptors_.push_back(std::move(descriptors));
+  // Nothing ahead of it: write it from here rather than have the loop do
+  // so, which would double the thread switches of every request. A failure
+  // is left to the loop to find.
+  if (!queuedBefore && !writeSomeLocked()) {
+    endSoon();
+    return Status::OK();
+  }
+  updateInterestLocked();
   return Status::OK();
 }
 
-void PeerConnection::cancel() {
-  closed_ = true;
-  wake();
-}
+void PeerConnection::cancel() { endSoon(); }
 
 bool PeerConnection::flush(int timeoutMs) {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
   for (;;) {
     {
       std::lock_guard<std::mutex> lock(mu_);
-      if (outboxSent_ == outbox_.size()) return true;
+      if (outbox_.empty()) return true;
     }
     if (closed_ || std::chrono::steady_clock::now() >= deadline) return false;
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
 }
 
-bool PeerConnection::writeSome() {
-  std::lock_guard<std::mutex> lock(mu_);
-  return writeSomeLocked();
-}
-
 bool PeerConnection::writeSomeLocked() {
-  static const std::vector<UniqueFd> kNone;
-  while (outboxSent_ < outbox_.size()) {
-    // Descriptors go with the first byte of their frame, and a write stops
-    // short of the next frame that carries some.
-    size_t end = outbox_.size();
-    const std::vector<UniqueFd>* attached = &kNone;
-    if (!outboxDescriptors_.empty()) {
-      if (outboxDescriptors_.front().first == outboxSent_) {
-        attached = &outboxDescriptors_.front().second;
-        if (outboxDescriptors_.size() > 1) end = outboxDescriptors_[1].first;
-      } else {
-        end = outboxDescriptors_.front().first;
-      }
+  while (!outbox_.empty()) {
+    // Several queued replies leave in one call. Descriptors go with the
+    // first byte of their frame, so a call that carries some starts at that
+    // frame, and one stops short of the next frame that has some.
+    const bool attach = outboxSent_ == 0 && !outboxDescriptors_.front().empty();
+    struct iovec parts[16];
+    size_t count = 0;
+    auto descriptors = outboxDescriptors_.begin();
+    for (auto it = outbox_.begin(); it != outbox_.end() && count < std::size(parts);
+         ++it, ++descriptors) {
+      if (count > 0 && !descriptors->empty()) break;
+      const size_t skip = count == 0 ? outboxSent_ : 0;
+      parts[count++] = {it->data() + skip, it->size() - skip};
     }
-    struct iovec part = {outbox_.data() + outboxSent_, end - outboxSent_};
-    ssize_t n = SendWithDescriptors(fd_, &part, 1, *attached);
+    static const std::vector<UniqueFd> kNone;
+    ssize_t n = SendWithDescriptors(fd_, parts, count, attach ? outboxDescriptors_.front() : kNone);
     if (n < 0) {
       if (errno == EINTR) continue;
       return errno == EAGAIN || errno == EWOULDBLOCK;
     }
-    if (attached != &kNone) outboxDescriptors_.pop_front();  // sent, and closed here
-    outboxSent_ += static_cast<size_t>(n);
+    if (attach) outboxDescriptors_.front().clear();  // sent: ours are closed
+    size_t sent = static_cast<size_t>(n);
+    while (sent > 0) {
+      const size_t left = outbox_.front().size() - outboxSent_;
+      if (sent < left) {
+        outboxSent_ += sent;
+        break;
+      }
+      sent -= left;
+      outbox_.pop_front();
+      outboxDescriptors_.pop_front();
+      outboxSent_ = 0;
+      if (!outbox_.empty()) outboxQueued_ -= outbox_.front().size();
+    }
   }
-  outbox_.clear();
-  outboxSent_ = 0;
   return true;
 }
 
-void PeerConnection::run() {
-  drm1::FrameDecoder decoder;
-  // On the stack: a zeroed buffer on the heap cost a 64 KiB memset for every
-  // connection, however little it sent.
-  char buf[kReadChunk];
-  bool peerOpen = true;
-  // Delivers the frames already received, as far as the limit of unanswered
-  // requests allows; false on a protocol error.
-  auto deliver = [&]() -> bool {
-    for (;;) {
-      {
-        std::lock_guard<std::mutex> lock(mu_);
-        if (unanswered_ >= kMaxUnansweredRequests) return true;
-      }
-      Result<std::optional<drm1::Frame>> frame = decoder.next();
-      if (!frame) {
-        SystemLog("protocol error on %@: %@", description(), frame.error());
-        return false;
-      }
-      if (!frame->has_value()) return true;
-      drm1::Frame& f = **frame;
-      if (f.header.isReply()) {
-        SystemLog("protocol error on %@: a peer sent a reply", description());
-        return false;
-      }
-      if (f.header.carriesDescriptors()) {
-        SystemLog("protocol error on %@: a request may not carry descriptors", description());
-        return false;
-      }
-      if (f.header.wantsReply()) {
-        std::lock_guard<std::mutex> lock(mu_);
-        ++unanswered_;
-      }
-      ConnectionEvent event;
-      event.message = PeerMessage{f.header.serial, f.header.wantsReply(), std::move(f.body)};
-      if (handler_) handler_(event);
+void PeerConnection::updateInterestLocked() {
+  if (closed_ || id_ == 0) return;
+  const uint32_t events = (reading_ ? EPOLLIN : 0u) | (outbox_.empty() ? 0u : EPOLLOUT);
+  if (events == interest_) return;
+  interest_ = events;
+  loop_->setInterest(fd_, id_, events);
+}
+
+void PeerConnection::release(size_t bytes) {
+  bool wake;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    --inFlight_;
+    inFlightBytes_ -= bytes;
+    wake = waitingForBudget_;
+    waitingForBudget_ = false;
+  }
+  if (wake) loop_->post(id_);
+}
+
+bool PeerConnection::serve(uint32_t events) {
+  ConnectionLoop& loop = *loop_;
+  if (closed_) {
+    end();
+    return false;
+  }
+  if (events & EPOLLOUT) {
+    std::lock_guard<std::mutex> lock(mu_);
+    if (!writeSomeLocked()) {
+      closed_ = true;
+    } else {
+      updateInterestLocked();
     }
-  };
-  while (peerOpen && !closed_) {
-    if (!deliver()) break;
-    bool pendingOut, readable;
-    {
-      std::lock_guard<std::mutex> lock(mu_);
-      pendingOut = outboxSent_ < outbox_.size();
-      readable = unanswered_ < kMaxUnansweredRequests;
-    }
-    const short events = static_cast<short>((readable ? POLLIN : 0) | (pendingOut ? POLLOUT : 0));
-    struct pollfd fds[2] = {{fd_, events, 0}, {wakeFd_, POLLIN, 0}};
-    if (::poll(fds, 2, -1) < 0) {
-      if (errno == EINTR) continue;
+  }
+  if (closed_) {
+    end();
+    return false;
+  }
+  Pump state = Pump::kNeedBytes;
+  // A read shorter than asked for most likely emptied the socket: the loop
+  // hears of more, so it does not ask again only to be told there is none,
+  // unless the peer has hung up, whose end is then found at once.
+  bool drained = false;
+  for (int reads = 0;; ++reads) {
+    state = deliverFrames();
+    if (state != Pump::kNeedBytes || reads == kReadsPerTurn) break;
+    if (drained && !(events & (EPOLLHUP | EPOLLRDHUP | EPOLLERR))) break;
+    bool sawDescriptors = false;
+    const ssize_t n =
+        ReceiveRefusingDescriptors(fd_, loop.readBuffer(), kReadChunk, &sawDescriptors);
+    if (sawDescriptors) {
+      SystemLog("protocol error on %@: descriptors sent with a request", description());
+      state = Pump::kBroken;
       break;
     }
-    if (fds[1].revents & POLLIN) DrainWakeFd(wakeFd_);
-    if ((fds[0].revents & POLLOUT) && !writeSome()) break;
-    if (fds[0].revents & (POLLHUP | POLLERR) && !readable) break;
-    if (fds[0].revents & (POLLIN | POLLHUP | POLLERR)) {
-      bool sawDescriptors = false;
-      ssize_t n = ReceiveRefusingDescriptors(fd_, buf, sizeof buf, &sawDescriptors);
-      if (sawDescriptors) {
-        SystemLog("protocol error on %@: descriptors sent with a request", description());
-        break;
-      }
-      if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
-      if (n <= 0) {
-        peerOpen = false;
-        break;
-      }
-      decoder.feed(std::string_view(buf, static_cast<size_t>(n)));
+    if (n > 0) {
+      decoder_.feed(std::string_view(loop.readBuffer(), static_cast<size_t>(n)));
+      lastProgress_ = std::chrono::steady_clock::now();
+      drained = static_cast<size_t>(n) < kReadChunk;
+      continue;
     }
-    // Write what the handler just queued without waiting for the next poll.
-    if (!writeSome()) break;
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) break;
+    state = Pump::kBroken;  // the peer hung up, or the socket failed
+    break;
   }
+  // Not reading, the socket's hang-up would be reported again and again.
+  if (state == Pump::kWaiting && (events & (EPOLLHUP | EPOLLERR))) state = Pump::kBroken;
+  if (state == Pump::kBroken || closed_) {
+    end();
+    return false;
+  }
+  const bool reading = state == Pump::kNeedBytes;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    // Time waiting for a budget is not the peer's stall.
+    if (reading && !reading_) lastProgress_ = std::chrono::steady_clock::now();
+    reading_ = reading;
+    updateInterestLocked();
+  }
+  loop.noteMidFrame(*this, reading && decoder_.buffered() > 0);
+  return true;
+}
+
+PeerConnection::Pump PeerConnection::deliverFrames() {
+  for (;;) {
+    bool idle;
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      if (inFlight_ >= kMaxMessagesInFlight || inFlightBytes_ >= kMaxBytesInFlight) {
+        waitingForBudget_ = true;
+        return Pump::kWaiting;
+      }
+      idle = inFlight_ == 0;
+    }
+    Result<std::optional<drm1::Header>> header = decoder_.nextHeader();
+    if (!header) {
+      SystemLog("protocol error on %@: %@", description(), header.error());
+      return Pump::kBroken;
+    }
+    if (!header->has_value()) return Pump::kNeedBytes;
+    const drm1::Header& h = **header;
+    if (h.isReply()) {
+      SystemLog("protocol error on %@: a peer sent a reply", description());
+      return Pump::kBroken;
+    }
+    if (h.carriesDescriptors()) {
+      SystemLog("protocol error on %@: a request may not carry descriptors", description());
+      return Pump::kBroken;
+    }
+    if (reserved_ == 0) {
+      const size_t most = MostFrameBytes(h.bodyLength);
+      if (!MessageBudget::Get().take(*this, most, idle && h.bodyLength <= kSmallFrameBytes)) {
+        return Pump::kWaiting;
+      }
+      reserved_ = most;
+    }
+    Result<std::optional<drm1::Frame>> frame = decoder_.next();
+    if (!frame) {
+      SystemLog("protocol error on %@: %@", description(), frame.error());
+      return Pump::kBroken;
+    }
+    if (!frame->has_value()) return Pump::kNeedBytes;
+    drm1::Frame& f = **frame;
+    const size_t bytes = FrameBytes(f.header.bodyLength, f.values);
+    MessageBudget::Get().give(reserved_ - bytes);
+    reserved_ = 0;
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      ++inFlight_;
+      inFlightBytes_ += bytes;
+    }
+    ConnectionEvent event;
+    event.message = PeerMessage{f.header.serial, f.header.wantsReply(), std::move(f.body),
+                                std::make_shared<MessageShare>(weak_from_this(), bytes)};
+    if (handler_) handler_(event);
+  }
+}
+
+void PeerConnection::end() {
+  ConnectionLoop& loop = *loop_;
   closed_ = true;
+  loop.remove(*this);
   ::shutdown(fd_, SHUT_RDWR);
+  MessageBudget::Get().give(reserved_);
+  reserved_ = 0;
+  decoder_ = drm1::FrameDecoder();
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    outbox_.clear();
+    outboxDescriptors_.clear();
+    outboxSent_ = outboxQueued_ = 0;
+  }
   ConnectionEvent invalid;
   invalid.kind = ConnectionEvent::Kind::kConnectionInvalid;
   if (handler_) handler_(invalid);
@@ -321,6 +634,9 @@ void PeerConnection::run() {
     std::lock_guard<std::mutex> lock(mu_);
     context = std::move(context_);
   }
+  context.reset();
+  ConnectionLoop::Leave(token_.pid);
+  loop.forget(id_);  // the loop's reference, perhaps the last
 }
 
 // ---- Listener ---------------------------------------------------------------
@@ -490,6 +806,9 @@ void Listener::stop() {
 
 void Listener::acceptLoop() {
   EnterBackgroundPriority();
+  // Out of descriptors (or memory), and since when.
+  bool outOfDescriptors = false;
+  std::chrono::steady_clock::time_point outSince;
   while (!stopping_) {
     // A peer connecting faster than connections are handed over would
     // otherwise hold an unbounded number of descriptors here; beyond the
@@ -506,12 +825,28 @@ void Listener::acceptLoop() {
     if (!(fds[0].revents & POLLIN)) continue;
     int fd = ::accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC);
     if (fd < 0) {
-      if (errno != EINTR && errno != EAGAIN && errno != ECONNABORTED) {
-        SystemLog("accept failed: %@", PosixError(errno, "accept"));
-        // Out of descriptors or memory: pause instead of spinning.
-        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+      const int err = errno;
+      if (err == EINTR || err == EAGAIN || err == ECONNABORTED) continue;
+      // Out of descriptors or memory: the peers wait in the backlog while
+      // the connections already made go on; said once, not per attempt.
+      if (!outOfDescriptors) {
+        outOfDescriptors = true;
+        outSince = std::chrono::steady_clock::now();
+        SystemLog("accept failed: %@; new connections wait until descriptors are free",
+                  PosixError(err, "accept"));
       }
+      // The listening socket is not polled for a while; a stop still ends
+      // the wait at once.
+      struct pollfd wake = {wakeFd_, POLLIN, 0};
+      ::poll(&wake, 1, static_cast<int>(kAcceptBackOff.count()));
       continue;
+    }
+    if (outOfDescriptors) {
+      SystemLog("accepting again after %lld ms out of descriptors",
+                static_cast<long long>(std::chrono::duration_cast<std::chrono::milliseconds>(
+                                           std::chrono::steady_clock::now() - outSince)
+                                           .count()));
+      outOfDescriptors = false;
     }
     struct ucred cred;
     socklen_t len = sizeof cred;

@@ -7,6 +7,7 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -16,6 +17,7 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
@@ -26,6 +28,7 @@
 #include <optional>
 #include <random>
 #include <set>
+#include <sstream>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -777,6 +780,239 @@ TEST(ReliabilityTest, ConcurrentClientsGetEveryReplyWithoutLeaking) {
   std::cout << kClients * 300 << " requests served; " << flooded << " malformed frames, " << cycled
             << " connect/disconnect cycles; VmRSS warm " << (warm >> 10) << " KiB, after "
             << (after >> 10) << " KiB\n";
+}
+
+// ---------------------------------------------------------------- hostile connections
+//
+// Peers of the user's own uid that try to stop drd for everyone else: floods
+// of messages that want no reply, frames that decode to far more than their
+// bytes, replayed serials, idle and half-sent connections, and descriptors
+// run out. Each checks that drd's memory stays bounded or that another
+// client is still answered within two seconds.
+
+// A line of /proc/<pid>/status in bytes ("VmHWM", "VmRSS") or as a count
+// ("Threads"); 0 if unknown.
+size_t StatusField(pid_t pid, const std::string& field) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
+  for (std::string line; std::getline(in, line);) {
+    if (line.rfind(field + ":", 0) == 0) {
+      const size_t n = std::stoull(line.substr(field.size() + 1));
+      return line.find("kB") != std::string::npos ? n * 1024 : n;
+    }
+  }
+  return 0;
+}
+
+// Whether a fresh connection's "match" is answered within two seconds.
+bool AnsweredPromptly(const std::string& socket) {
+  Drm1Peer other(socket);
+  return other.connected() && other.send(1, Request("match")) &&
+         other.receive(std::chrono::seconds(2)).has_value();
+}
+
+size_t Occurrences(const std::string& text, const std::string& what) {
+  size_t n = 0;
+  for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+  return n;
+}
+
+// ASan's quarantine of freed memory cut small, so that resident memory
+// measures what drd holds.
+const std::vector<std::string> kSmallQuarantine = {
+    "ASAN_OPTIONS=quarantine_size_mb=4:detect_leaks=0"};
+
+// Messages that want no reply count toward their connection's budget like
+// requests: a peer sending them without pause is read only as fast as drd
+// works them off, so drd's memory stays bounded.
+TEST(ReliabilityTest, FloodsOfMessagesWithoutReplyStayWithinBudget) {
+  World w;
+  ASSERT_TRUE(w.start(kSmallQuarantine)) << w.log();
+  const PlugIns p = RegisterPlugIns(w, "flood", 1);
+  const std::string socket = w.drd().socketPath();
+  const struct {
+    const char* what;
+    Value message;
+  } rows[] = {
+      {"1 MiB annotate",
+       Request("annotate",
+               {{"annotations", Value{{"extension", Value{{"blob", std::string(1 << 20, 'x')}}}}},
+                {"uuids", Value(Array{p.uuids[0]})}})},
+      {"small match", Request("match")},
+  };
+  for (const auto& row : rows) {
+    const size_t before = StatusField(w.drd().pid(), "VmRSS");
+    std::atomic<bool> stop{false};
+    std::atomic<size_t> sent{0};
+    Drm1Peer hog(socket);
+    std::thread flood([&] {
+      for (uint64_t serial = 1; !stop; ++sent) {
+        if (!hog.sendRaw(*drm1::EncodeFrame(serial++, 0, 0, row.message))) return;
+      }
+    });
+    size_t peak = before;
+    for (int i = 0; i < 6; ++i) {
+      std::this_thread::sleep_for(std::chrono::seconds(1));
+      EXPECT_TRUE(AnsweredPromptly(socket)) << row.what << ", second " << i;
+      peak = std::max(peak, StatusField(w.drd().pid(), "VmRSS"));
+    }
+    stop = true;
+    ::shutdown(hog.fd(), SHUT_RDWR);  // unblocks a send drd does not take
+    flood.join();
+    // One connection holds at most 64 messages or 16 MiB of them, which
+    // drd works off; before that bound the resident set grew by hundreds of
+    // MiB within these seconds.
+    EXPECT_LT(peak, before + (128u << 20));
+    std::cout << row.what << ": " << sent << " sent in 6 s, VmRSS " << (before >> 20) << " -> "
+              << (peak >> 20) << " MiB\n";
+  }
+  ASSERT_TRUE(Alive(w.drd().pid())) << w.log();
+}
+
+// A frame decodes to a bounded multiple of its bytes: past 1,048,576 values
+// it is refused before the rest is made, and all connections together bring
+// in a bounded amount at a time. Three peers each send a 16 MiB frame of
+// nulls, which used to decode to about 680 MiB each.
+TEST(ReliabilityTest, FramesOfMillionsOfValuesAreRefusedWithinBound) {
+  World w;
+  ASSERT_TRUE(w.start(kSmallQuarantine)) << w.log();
+  const std::string socket = w.drd().socketPath();
+  auto u32 = [](uint32_t v) { return std::string(reinterpret_cast<const char*>(&v), 4); };
+  // {"k": [null, null, ...]}, 16 MiB in all.
+  const uint32_t nulls = drm1::kMaxBodySize - 15;
+  std::string frame = "DRM1" + u32(drm1::kMaxBodySize) + u32(1) + u32(0) + u32(0) + u32(0) +
+                      u32(drm1::kFlagWantsReply) + u32(0);
+  frame += "\x0b" + u32(1) + u32(1) + "k" + "\x0a" + u32(nulls) + std::string(nulls, '\0');
+  ASSERT_EQ(frame.size(), drm1::kHeaderSize + drm1::kMaxBodySize);
+  const size_t before = StatusField(w.drd().pid(), "VmRSS");
+  constexpr int kPeers = 3;
+  std::atomic<int> closed{0}, done{0};
+  std::vector<std::thread> peers;
+  for (int i = 0; i < kPeers; ++i) {
+    peers.emplace_back([&] {
+      Drm1Peer peer(socket);
+      if (peer.sendRaw(frame) && peer.sawEndOfStream(std::chrono::seconds(60))) ++closed;
+      ++done;
+    });
+  }
+  while (done < kPeers) {
+    EXPECT_TRUE(AnsweredPromptly(socket)) << done << " of the peers done";
+    std::this_thread::sleep_for(std::chrono::milliseconds(250));
+  }
+  for (std::thread& t : peers) t.join();
+  EXPECT_EQ(closed, kPeers);
+  EXPECT_EQ(Occurrences(w.log(), "more than 1048576 values"), size_t{kPeers}) << w.log();
+  const size_t peak = StatusField(w.drd().pid(), "VmHWM");
+  EXPECT_LT(peak, before + (384u << 20));
+  std::cout << "VmRSS before " << (before >> 20) << " MiB, VmHWM after " << (peak >> 20)
+            << " MiB\n";
+}
+
+// A serial not above the one before breaks the protocol; gaps are allowed.
+TEST(ReliabilityTest, SerialsThatDoNotIncreaseCloseTheConnection) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const struct {
+    uint64_t first, second;
+    bool closes;
+  } rows[] = {{5, 5, true}, {5, 3, true}, {5, 9, false}};
+  for (const auto& row : rows) {
+    Drm1Peer peer(w.drd().socketPath());
+    ASSERT_TRUE(peer.send(row.first, Request("match")));
+    std::optional<drm1::Frame> reply = peer.receive();
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(reply->header.replyTo, row.first);
+    ASSERT_TRUE(peer.send(row.second, Request("match")));
+    if (row.closes) {
+      EXPECT_TRUE(peer.sawEndOfStream()) << row.second << " after " << row.first;
+    } else {
+      reply = peer.receive();
+      ASSERT_TRUE(reply);
+      EXPECT_EQ(reply->header.replyTo, row.second);
+    }
+  }
+  EXPECT_TRUE(w.log().find("serial 3 not above the one before, 5") != std::string::npos) << w.log();
+}
+
+// A peer that stops in the middle of a frame is closed after 30 s, whether
+// it stopped in the header or in the body; one idle between frames is kept
+// as long as it likes and holds no thread of drd's.
+TEST(ReliabilityTest, StalledFramesEndWhileIdleConnectionsStay) {
+  World w;
+  ASSERT_TRUE(w.start()) << w.log();
+  const std::string socket = w.drd().socketPath();
+  const size_t threads = StatusField(w.drd().pid(), "Threads");
+  std::vector<std::unique_ptr<Drm1Peer>> idle;
+  for (int i = 0; i < 100; ++i) {
+    idle.push_back(std::make_unique<Drm1Peer>(socket));
+    ASSERT_TRUE(idle.back()->send(1, Request("match")));
+    ASSERT_TRUE(idle.back()->receive()) << i;
+  }
+  EXPECT_LE(StatusField(w.drd().pid(), "Threads"), threads + 4);
+  const std::string frame = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Request("match"));
+  Drm1Peer inHeader(socket), inBody(socket);
+  ASSERT_TRUE(inHeader.sendRaw(frame.substr(0, 10)));
+  ASSERT_TRUE(inBody.sendRaw(frame.substr(0, frame.size() - 1)));
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_TRUE(AnsweredPromptly(socket));
+  EXPECT_TRUE(inHeader.sawEndOfStream(std::chrono::seconds(40)));
+  EXPECT_TRUE(inBody.sawEndOfStream(std::chrono::seconds(5)));
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(29));
+  EXPECT_EQ(Occurrences(w.log(), "no byte for 30 s in the middle of a frame"), 2u) << w.log();
+  for (size_t i = 0; i < idle.size(); i += 33) {
+    ASSERT_TRUE(idle[i]->send(2, Request("match")));
+    EXPECT_TRUE(idle[i]->receive(std::chrono::seconds(2))) << "idle connection " << i;
+  }
+}
+
+// Soft limit of descriptors and hard limit of `pid`, from /proc.
+std::pair<std::string, std::string> DescriptorLimits(pid_t pid) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/limits");
+  for (std::string line; std::getline(in, line);) {
+    if (line.rfind("Max open files", 0) != 0) continue;
+    std::istringstream fields(line.substr(14));
+    std::string soft, hard;
+    fields >> soft >> hard;
+    return {soft, hard};
+  }
+  return {};
+}
+
+// drd raises its soft limit of descriptors to the hard one. Out of them all
+// the same, it goes on serving the connections it has, says so once, waits
+// instead of trying to accept again and again, and takes new peers again
+// once descriptors are free.
+TEST(ReliabilityTest, OutOfDescriptorsDrdServesItsConnectionsAndResumes) {
+  struct rlimit mine {};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &mine), 0);
+  if (mine.rlim_max <= 256) GTEST_SKIP() << "the hard limit of descriptors is too low";
+  World w;
+  struct rlimit low = mine;
+  low.rlim_cur = 256;
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
+  const bool started = w.start();
+  ::setrlimit(RLIMIT_NOFILE, &mine);
+  ASSERT_TRUE(started) << w.log();
+  const auto [soft, hard] = DescriptorLimits(w.drd().pid());
+  EXPECT_EQ(soft, hard);
+
+  const std::string socket = w.drd().socketPath();
+  Drm1Peer early(socket);
+  ASSERT_TRUE(early.send(1, Request("match")));
+  ASSERT_TRUE(early.receive());
+  const std::string limit = "prlimit --pid " + std::to_string(w.drd().pid()) + " --nofile=64:64";
+  ASSERT_EQ(std::system(limit.c_str()), 0);
+  std::vector<std::unique_ptr<Drm1Peer>> crowd;
+  for (int i = 0; i < 80; ++i) crowd.push_back(std::make_unique<Drm1Peer>(socket));
+  std::this_thread::sleep_for(std::chrono::seconds(3));
+  ASSERT_TRUE(early.send(2, Request("match")));
+  EXPECT_TRUE(early.receive(std::chrono::seconds(2))) << "an established client was not served";
+  EXPECT_EQ(Occurrences(w.log(), "accept failed"), 1u) << w.log();
+  crowd.clear();
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  bool served = false;
+  while (!served && std::chrono::steady_clock::now() < deadline) served = AnsweredPromptly(socket);
+  EXPECT_TRUE(served) << "no new peer was taken once descriptors were free";
+  EXPECT_NE(w.log().find("accepting again"), std::string::npos) << w.log();
 }
 
 }  // namespace

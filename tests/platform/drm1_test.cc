@@ -134,6 +134,14 @@ TEST(Drm1Test, RefusesFramesThatBreakTheRules) {
              Str("k") + Tag(kTagFalse)),
        "duplicate key"},
       {Frame(OneEntry(Nested(kMaxDepth + 1))), "deeper than 64"},
+      // The top dictionary and the array count too, so these nulls are two
+      // values too many, refused at the array's count.
+      {Frame(OneEntry(Tag(kTagArray) + U32(kMaxValues) + std::string(kMaxValues, '\0'))),
+       "more than 1048576 values"},
+      {Frame(OneEntry(Tag(kTagArray) + U32(2) + Tag(kTagArray) + U32(kMaxValues / 2) +
+                      std::string(kMaxValues / 2, '\0') + Tag(kTagArray) + U32(kMaxValues / 2) +
+                      std::string(kMaxValues / 2, '\0'))),
+       "more than 1048576 values"},
   };
   for (const auto& row : rows) {
     Result<Value> v = DecodeWhole(row.bytes);
@@ -145,11 +153,21 @@ TEST(Drm1Test, RefusesFramesThatBreakTheRules) {
   }
   // 64 levels of containers is the limit, the top dictionary being level 1.
   EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Nested(kMaxDepth)))));
+  EXPECT_TRUE(
+      DecodeWhole(Frame(OneEntry(Tag(kTagArray) + U32(kMaxValues - 2) +
+                                 std::string(kMaxValues - 2, static_cast<char>(kTagTrue))))));
+  // Frames from the daemon may be larger and hold any number of values.
+  EXPECT_TRUE(DecodeHeader(HeaderBytes(kMaxReplyBodySize, 1, 1, kFlagIsReply), kFromDaemon));
+  EXPECT_FALSE(DecodeHeader(HeaderBytes(kMaxReplyBodySize + 1, 1, 1, kFlagIsReply), kFromDaemon));
+  FrameDecoder fromDaemon(kFromDaemon);
+  fromDaemon.feed(
+      Frame(OneEntry(Tag(kTagArray) + U32(kMaxValues) + std::string(kMaxValues, '\0'))));
+  EXPECT_TRUE(fromDaemon.next());
 }
 
 TEST(Drm1Test, DecoderSplitsAStreamFedInPiecesAndStaysBrokenAfterAnError) {
   std::string stream;
-  for (uint64_t serial = 1; serial <= 3; ++serial) {
+  for (uint64_t serial : {1, 2, 5}) {  // increasing, gaps allowed
     stream += *EncodeFrame(serial, 0, kFlagWantsReply, Value{{"n", serial}});
   }
   FrameDecoder decoder;
@@ -163,12 +181,15 @@ TEST(Drm1Test, DecoderSplitsAStreamFedInPiecesAndStaysBrokenAfterAnError) {
       serials.push_back((**f).header.serial);
     }
   }
-  EXPECT_EQ(serials, (std::vector<uint64_t>{1, 2, 3}));
+  EXPECT_EQ(serials, (std::vector<uint64_t>{1, 2, 5}));
   EXPECT_EQ(decoder.buffered(), 0u);
 
-  decoder.feed("XXXX" + std::string(28, '\0'));
-  EXPECT_FALSE(decoder.next());
-  decoder.feed(*EncodeFrame(4, 0, 0, Value::EmptyDictionary()));
+  // A serial again is refused at its header, before its body is in.
+  decoder.feed(EncodeFrame(5, 0, 0, Value::EmptyDictionary())->substr(0, kHeaderSize));
+  Result<std::optional<drm1::Frame>> again = decoder.next();
+  ASSERT_FALSE(again);
+  EXPECT_NE(again.error().localizedDescription().find("serial 5 not above"), std::string::npos);
+  decoder.feed(*EncodeFrame(6, 0, 0, Value::EmptyDictionary()));
   EXPECT_FALSE(decoder.next());
 }
 
@@ -227,21 +248,29 @@ TEST(Drm1Test, RefusesTextWhereverTheBadByteFalls) {
 }
 
 // A body of up to 16 MiB is encoded whole, one byte more is refused: at the
-// limit less the header, at the limit, and past it.
+// limit less the header, at the limit, and past it; a reply may pass it.
 TEST(Drm1Test, EncodesBodiesUpTo16MiB) {
   // {"k": "<padding>"}: 5 + 4 + 1 + 1 + 4 bytes around the padding.
   constexpr size_t kAround = 15;
   struct Row {
     size_t bodySize;
     bool encoded;
-  } rows[] = {{kMaxBodySize - kHeaderSize, true}, {kMaxBodySize, true}, {kMaxBodySize + 1, false}};
+    uint32_t flags = 0;
+  } rows[] = {{kMaxBodySize - kHeaderSize, true},
+              {kMaxBodySize, true},
+              {kMaxBodySize + 1, false},
+              {kMaxBodySize + 1, true, kFlagIsReply}};  // replies may be larger
   for (const Row& row : rows) {
     const Value body{{"k", std::string(row.bodySize - kAround, 'x')}};
-    Result<std::string> f = EncodeFrame(1, 0, 0, body);
+    Result<std::string> f = EncodeFrame(1, row.flags ? 1 : 0, row.flags, body);
     ASSERT_EQ(f.ok(), row.encoded) << row.bodySize;
     if (row.encoded) {
       EXPECT_EQ(f->size(), kHeaderSize + row.bodySize);
-      EXPECT_EQ(DecodeWhole(*f).value_or(Value()), body);
+      FrameDecoder decoder(kFromDaemon);
+      decoder.feed(*f);
+      Result<std::optional<drm1::Frame>> decoded = decoder.next();
+      ASSERT_TRUE(decoded && decoded->has_value());
+      EXPECT_EQ((*decoded)->body, body);
     } else {
       EXPECT_EQ(f.error().code(), kUnencodable);
     }

@@ -82,7 +82,7 @@ class Peer {
   int fd_ = -1;
   bool connected_ = false;
   bool eof_ = false;
-  drm1::FrameDecoder decoder_;
+  drm1::FrameDecoder decoder_{drm1::kFromDaemon};
 };
 
 class MessageServiceTest : public ::testing::Test {
@@ -143,6 +143,40 @@ TEST_F(MessageServiceTest, AnswersEachRequestWithOneBoundReplyInOrder) {
   }
 }
 
+// Every message holds its connection's budget until the last copy of it is
+// gone, whether it wants a reply or not: at the limit the connection is not
+// read, and a message let go lets the next one in.
+TEST_F(MessageServiceTest, MessagesHoldTheirConnectionsBudgetUntilLetGo) {
+  struct Held {  // outlives the test: the connection delivers until it ends
+    std::mutex mu;
+    std::condition_variable cv;
+    std::vector<PeerMessage> messages;
+  };
+  auto held = std::make_shared<Held>();
+  auto listener = testing::StartStandInListener(
+      options_.socketDirectory, options_.serviceName, &queue_,
+      [held](const std::shared_ptr<PeerConnection>&, const ConnectionEvent& e) {
+        if (e.kind != ConnectionEvent::Kind::kMessage) return;
+        std::lock_guard<std::mutex> lock(held->mu);
+        held->messages.push_back(e.message);
+        held->cv.notify_all();
+      },
+      context_);
+  ASSERT_TRUE(listener);
+  Peer peer(listener->path());
+  for (uint64_t serial = 1; serial <= 100; ++serial) {
+    peer.sendRaw(*drm1::EncodeFrame(serial, 0, 0, Value{{"n", serial}}));
+  }
+  constexpr size_t kLimit = PeerConnection::kMaxMessagesInFlight;
+  std::unique_lock<std::mutex> lock(held->mu);
+  auto& messages = held->messages;
+  ASSERT_TRUE(held->cv.wait_for(lock, 5s, [&] { return messages.size() >= kLimit; }));
+  EXPECT_FALSE(held->cv.wait_for(lock, 300ms, [&] { return messages.size() > kLimit; }));
+  messages.erase(messages.begin());
+  ASSERT_TRUE(held->cv.wait_for(lock, 5s, [&] { return messages.size() == kLimit; }));
+  EXPECT_EQ(messages.back().serial, kLimit + 1);
+}
+
 TEST_F(MessageServiceTest, ProtocolErrorClosesOnlyThatConnectionAndReleasesItsContext) {
   auto listener = EchoListener();
   ASSERT_TRUE(listener);
@@ -168,7 +202,7 @@ TEST_F(MessageServiceTest, ProtocolErrorClosesOnlyThatConnectionAndReleasesItsCo
   EXPECT_EQ(context_.use_count(), 2);
 }
 
-// Connections one after another are read on threads that served earlier
+// Connections one after another are read by the loop that served earlier
 // ones: nothing a connection left behind (a cut frame, a protocol error, an
 // unanswered request) may reach the next one, and each still ends with its
 // one connection-invalid event and lets go of its context.
@@ -187,7 +221,8 @@ TEST_F(MessageServiceTest, ConnectionsOneAfterAnotherStartClean) {
       {"a header without its body", request.substr(0, drm1::kHeaderSize)},
       {"a frame without its last byte", request.substr(0, request.size() - 1)},
       {"bad magic", "DRM2" + std::string(28, '\0')},
-      {"an unanswered request", *drm1::EncodeFrame(2, 0, drm1::kFlagWantsReply, Value{{"n", 2}})},
+      {"an unanswered request",
+       *drm1::EncodeFrame(1000, 0, drm1::kFlagWantsReply, Value{{"n", 1000}})},
   };
   int ended = 0;
   for (int round = 0; round < 5; ++round) {

@@ -41,7 +41,7 @@ class Drm1Peer {
   int fd_ = -1;
   bool connected_ = false;
   bool eof_ = false;
-  drm1::FrameDecoder decoder_;
+  drm1::FrameDecoder decoder_{drm1::kFromDaemon};
 };
 
 // A drd of the build tree (../daemon/drd next to the test binary's folder),
