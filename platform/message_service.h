@@ -35,7 +35,8 @@
 // written at once by the sender, as far as the socket takes it without
 // waiting, and the rest by the loop, so sending never blocks the caller; a
 // peer whose queue passes kMaxQueuedReplyBytes (the reply being written not
-// counted) is closed.
+// counted) is not read until it takes them, and is closed when it takes
+// none for kReplyStallLimit.
 //
 // Ownership: a connection keeps itself alive while the loop serves it, and
 // holds its context object until its last event has been delivered; callers
@@ -107,6 +108,9 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   static constexpr size_t kSmallFrameBytes = 4096;
   // How long a peer may stop in the middle of a frame.
   static constexpr std::chrono::seconds kFrameStallLimit{30};
+  // A connection not read for its unread replies is closed when its peer
+  // takes none of them for this long.
+  static constexpr std::chrono::seconds kReplyStallLimit{30};
 
   ~PeerConnection();
   PeerConnection(const PeerConnection&) = delete;
@@ -175,6 +179,9 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   size_t inFlightBytes_ = 0;       // guarded by mu_
   bool reading_ = true;            // guarded by mu_: wants to read the socket
   bool waitingForBudget_ = false;  // guarded by mu_: a release must wake the loop
+  // Over kMaxQueuedReplyBytes of replies unread: not read until they go.
+  bool repliesBacklogged_ = false;                           // guarded by mu_
+  std::chrono::steady_clock::time_point lastReplyProgress_;  // guarded by mu_
   uint32_t interest_ = 0;          // guarded by mu_: the events asked of epoll
   std::shared_ptr<void> context_;  // guarded by mu_
   std::function<void(const ConnectionEvent&)> handler_;  // set before resume

@@ -163,6 +163,7 @@ class ConnectionLoop {
   void remove(PeerConnection& c) {
     ::epoll_ctl(epollFd_, EPOLL_CTL_DEL, c.fd_, nullptr);
     midFrame_.erase(c.id_);
+    backlogged_.erase(c.id_);
   }
 
   void forget(uint64_t id) {
@@ -180,6 +181,15 @@ class ConnectionLoop {
       midFrame_.insert(c.id_);
     } else {
       midFrame_.erase(c.id_);
+    }
+  }
+
+  // Whether `c` is not read because its peer does not take its replies.
+  void noteBacklogged(PeerConnection& c, bool backlogged) {
+    if (backlogged) {
+      backlogged_.insert(c.id_);
+    } else {
+      backlogged_.erase(c.id_);
     }
   }
 
@@ -238,8 +248,10 @@ class ConnectionLoop {
     struct epoll_event events[64];
     auto lastSweep = std::chrono::steady_clock::now();
     for (;;) {
-      // Only a connection in the middle of a frame has a deadline.
-      const int timeout = midFrame_.empty() ? -1 : 1000;
+      // Only a connection in the middle of a frame, or one whose peer does
+      // not take its replies, has a deadline.
+      const bool deadlines = !midFrame_.empty() || !backlogged_.empty();
+      const int timeout = deadlines ? 1000 : -1;
       const int n = ::epoll_wait(epollFd_, events, 64, timeout);
       if (n < 0 && errno != EINTR) {
         SystemLog("the connection loop failed: %@", PosixError(errno, "epoll_wait"));
@@ -261,7 +273,7 @@ class ConnectionLoop {
         if (std::shared_ptr<PeerConnection> c = find(id)) c->serve(0);
       }
       const auto now = std::chrono::steady_clock::now();
-      if (!midFrame_.empty() && now - lastSweep >= std::chrono::seconds(1)) {
+      if (deadlines && now - lastSweep >= std::chrono::seconds(1)) {
         lastSweep = now;
         sweepStalled(now);
       }
@@ -277,6 +289,20 @@ class ConnectionLoop {
                 static_cast<int>(PeerConnection::kFrameStallLimit.count()));
       c->end();
     }
+    ids.assign(backlogged_.begin(), backlogged_.end());
+    for (uint64_t id : ids) {
+      std::shared_ptr<PeerConnection> c = find(id);
+      if (!c) continue;
+      std::chrono::steady_clock::time_point last;
+      {
+        std::lock_guard<std::mutex> lock(c->mu_);
+        last = c->lastReplyProgress_;
+      }
+      if (now - last < PeerConnection::kReplyStallLimit) continue;
+      SystemLog("closing %@: took none of its replies for %d s", c->description(),
+                static_cast<int>(PeerConnection::kReplyStallLimit.count()));
+      c->end();
+    }
   }
 
   const int epollFd_;
@@ -286,7 +312,8 @@ class ConnectionLoop {
   std::unordered_map<uint64_t, std::shared_ptr<PeerConnection>> connections_;  // guarded by mu_
   std::vector<uint64_t> posted_;                                               // guarded by mu_
   uint64_t nextId_ = 1;                                                        // guarded by mu_
-  std::set<uint64_t> midFrame_;  // the loop thread's alone
+  std::set<uint64_t> midFrame_;    // the loop thread's alone
+  std::set<uint64_t> backlogged_;  // the loop thread's alone
 };
 
 // The budget all connections share, and the connections waiting for room.
@@ -399,12 +426,15 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
   if (!frame) return frame.error();
   ++nextSerial_;
   const bool queuedBefore = !outbox_.empty();
-  if (queuedBefore && outboxQueued_ + frame->size() > kMaxQueuedReplyBytes) {
-    SystemLog("closing %@: more than 64 MiB of replies unread", description());
-    endSoon();
-    return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "reply queue full");
-  }
   if (queuedBefore) outboxQueued_ += frame->size();
+  // A peer that does not take its replies gets no more of its requests
+  // read; the loop closes it if it then takes nothing for long.
+  if (outboxQueued_ > kMaxQueuedReplyBytes && !repliesBacklogged_) {
+    repliesBacklogged_ = true;
+    lastReplyProgress_ = std::chrono::steady_clock::now();
+    SystemLog("not reading %@: more than 64 MiB of replies unread", description());
+    if (id_ != 0) loop_->post(id_);
+  }
   outbox_.push_back(std::move(*frame));
   outboxDescriptors_.push_back(std::move(descriptors));
   // Nothing ahead of it: write it from here rather than have the loop do
@@ -454,6 +484,7 @@ bool PeerConnection::writeSomeLocked() {
       return errno == EAGAIN || errno == EWOULDBLOCK;
     }
     if (attach) outboxDescriptors_.front().clear();  // sent: ours are closed
+    lastReplyProgress_ = std::chrono::steady_clock::now();
     size_t sent = static_cast<size_t>(n);
     while (sent > 0) {
       const size_t left = outbox_.front().size() - outboxSent_;
@@ -466,6 +497,10 @@ bool PeerConnection::writeSomeLocked() {
       outboxDescriptors_.pop_front();
       outboxSent_ = 0;
       if (!outbox_.empty()) outboxQueued_ -= outbox_.front().size();
+    }
+    if (repliesBacklogged_ && outboxQueued_ <= kMaxQueuedReplyBytes) {
+      repliesBacklogged_ = false;  // the loop reads again when it next serves it
+      SystemLog("reading %@ again: its replies are taken", description());
     }
   }
   return true;
@@ -552,6 +587,12 @@ bool PeerConnection::serve(uint32_t events) {
     updateInterestLocked();
   }
   loop.noteMidFrame(*this, reading && decoder_.buffered() > 0);
+  bool backlogged;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    backlogged = repliesBacklogged_;
+  }
+  loop.noteBacklogged(*this, backlogged);
   return true;
 }
 
@@ -560,6 +601,7 @@ PeerConnection::Pump PeerConnection::deliverFrames() {
     bool idle;
     {
       std::lock_guard<std::mutex> lock(mu_);
+      if (repliesBacklogged_) return Pump::kWaiting;  // writing its replies resumes it
       if (inFlight_ >= kMaxMessagesInFlight || inFlightBytes_ >= kMaxBytesInFlight) {
         waitingForBudget_ = true;
         return Pump::kWaiting;

@@ -285,14 +285,17 @@ TEST_F(MessageServiceTest, ReplacesAStaleSocketButNeverALiveOneOrAnotherFile) {
   }
 }
 
-TEST_F(MessageServiceTest, APeerThatNeverReadsNeitherBlocksTheSenderNorGrowsWithoutBound) {
+TEST_F(MessageServiceTest, APeerThatTakesNoRepliesIsNotReadAndThenClosed) {
   auto listener = Listener::Create(options_, &queue_);
   ASSERT_TRUE(listener);
   std::shared_ptr<PeerConnection> connection;
+  std::atomic<int> delivered{0};
   std::mutex mu;
   std::condition_variable cv;
   (*listener)->setEventHandler([&](std::shared_ptr<PeerConnection> c) {
-    c->setEventHandler([](const ConnectionEvent&) {});
+    c->setEventHandler([&](const ConnectionEvent& e) {
+      if (e.kind == ConnectionEvent::Kind::kMessage) ++delivered;
+    });
     c->resume();
     std::lock_guard<std::mutex> lock(mu);
     connection = c;
@@ -306,16 +309,30 @@ TEST_F(MessageServiceTest, APeerThatNeverReadsNeitherBlocksTheSenderNorGrowsWith
   }
   ScopedLogCapture log;
   const Value big = Value{{"blob", Value(Data(1 << 20, 0x5A))}};
-  int accepted = 0;
-  for (int i = 0; i < 80; ++i) {
-    if (connection->sendReply(static_cast<uint64_t>(i + 1), big).ok()) ++accepted;
-  }
-  // Queuing never waits for the peer, which reads nothing: were it to wait,
-  // this loop would never end.
-  EXPECT_GE(accepted, 60);
-  EXPECT_LT(accepted, 80);
-  EXPECT_FALSE(connection->isOpen());
+  uint64_t serial = 0;
+  auto flood = [&] {
+    // Queuing never waits for the peer, which reads nothing: were it to
+    // wait, this loop would never end.
+    for (int i = 0; i < 80; ++i) EXPECT_TRUE(connection->sendReply(++serial, big).ok());
+  };
+  flood();
   EXPECT_TRUE(log.contains("more than 64 MiB of replies unread"));
+  // Its requests wait while its replies do, and go once it takes them.
+  peer.sendRequest(1, Value{{"request", "x"}});
+  std::this_thread::sleep_for(300ms);
+  EXPECT_EQ(delivered.load(), 0);
+  for (int i = 0; i < 80; ++i) ASSERT_TRUE(peer.receive()) << i;
+  for (int i = 0; i < 100 && delivered.load() == 0; ++i) std::this_thread::sleep_for(50ms);
+  EXPECT_EQ(delivered.load(), 1);
+  EXPECT_TRUE(connection->isOpen());
+  // Taking none of them for long ends it.
+  flood();
+  const auto deadline = std::chrono::steady_clock::now() + PeerConnection::kReplyStallLimit + 5s;
+  while (connection->isOpen() && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(100ms);
+  }
+  EXPECT_FALSE(connection->isOpen());
+  EXPECT_TRUE(log.contains("took none of its replies for 30 s"));
 }
 
 TEST_F(MessageServiceTest, RefusesPeersOfAnotherUser) {
