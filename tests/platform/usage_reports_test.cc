@@ -9,6 +9,7 @@
 #include <nlohmann/json.hpp>
 #include <sstream>
 
+#include "core/log.h"
 #include "platform/file_system.h"
 #include "tests/support/process_fixtures.h"
 
@@ -22,6 +23,14 @@ TEST(UsageReportsTest, LineHasTheDocumentedLayoutAndEscapes) {
             R"({"domain": "d", "level": 5, "keys": {"b": "1", "a": "say \"hi\"\n"}})");
   // Bytes that are not UTF-8 are replaced, never a crash or a broken line.
   EXPECT_TRUE(nlohmann::json::accept(UsageReportJson("d", 5, {{"k", "bad \xff byte"}})));
+}
+
+// Without a report file a report is a log line that says it is one.
+TEST(UsageReportsTest, WithoutAFileAReportIsAMarkedLogLine) {
+  ScopedLogCapture log;
+  MakeUsageReports({})->sendReport("d", 5, {{"k", "v"}});
+  EXPECT_EQ(log.lines(), std::vector<std::string>{
+                             R"(usage report: {"domain": "d", "level": 5, "keys": {"k": "v"}})"});
 }
 
 TEST(UsageReportsTest, ConcurrentProcessesNeverInterleaveLines) {
