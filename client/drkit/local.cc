@@ -38,7 +38,7 @@ std::string ParentFolder(const std::string& path) { return path.substr(0, path.r
 int RunExtension(const Invocation& inv, Io& io) {
   Result<std::string> path = client::consumeExtension(inv.operands[1]);
   if (!path) return Fail(io, path.error().localizedDescription());
-  io.out << *path << "\n";
+  io.out << (inv.json ? Json(io, Value{{"path", *path}}) : *path) << "\n";
   return 0;
 }
 
@@ -52,6 +52,10 @@ int RunExclude(const Invocation& inv, Io& io) {
     if (exclusions.isPresent() && !exclusions.isArray()) {
       return Fail(io, "the stored exclusions are not a list; drd ignores them: " +
                           exclusions.description());
+    }
+    if (inv.json) {
+      io.out << Json(io, Value(exclusions.array())) << "\n";
+      return 0;
     }
     size_t n = 0;
     for (const Value& e : exclusions.array()) io.out << ++n << ": " << ToJson(e, false) << "\n";
@@ -114,7 +118,13 @@ int RunWatch(const Invocation& inv, Io& io) {
         (*observer)->waitForPost(std::chrono::milliseconds(250));
     if (!post) return Fail(io, post.error().localizedDescription());
     if (!*post) continue;
-    io.out << (*post)->name << " " << (*post)->count << std::endl;
+    if (inv.json) {
+      // One object a line, whatever standard output is: a stream of events.
+      io.out << ToJson(Value{{"name", (*post)->name}, {"count", (*post)->count}}, false)
+             << std::endl;
+    } else {
+      io.out << (*post)->name << " " << (*post)->count << std::endl;
+    }
     ++printed;
   }
   return 0;
