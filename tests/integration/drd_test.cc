@@ -118,7 +118,7 @@ TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
 // When JOURNAL_STREAM names drd's standard error, every line starts with
 // its priority; when it names something else, no line does.
 TEST_F(DrdTest, LinesCarryTheirPriorityOnlyOnTheJournalStream) {
-  Start({}, "com.example.first");
+  Start({"-S", "com.example.first"}, "com.example.first");
   const std::string kOwnStream = "$(stat -c %d:%i \"$0\")";
   struct Row {
     std::string stream;   // shell text for JOURNAL_STREAM
