@@ -96,6 +96,12 @@ install)
     if grep -Ei 'drd\.(service|socket).*(unknown|invalid|ignoring|failed)' "$work/verify"; then
       fail "systemd-analyze complains about the units"
     fi
+    # The sandbox stays as tight as drd allows (1.2 when it was made).
+    exposure=$(systemd-analyze security --offline=true --user \
+      "$prefix/share/systemd/user/drd.service" 2>&1 |
+      sed -n 's/.*exposure level for drd.service: \([0-9.]*\).*/\1/p')
+    [ -n "$exposure" ] && awk "BEGIN { exit !($exposure <= 2.0) }" ||
+      fail "systemd-analyze security rates drd.service '$exposure', above 2.0"
   else
     echo "systemd-analyze is not installed: the units' settings were not verified"
   fi
