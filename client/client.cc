@@ -177,4 +177,23 @@ Status Client::release(const std::vector<Uuid>& tokens) {
   return call("lock", {{kUuidsKey, Uuids(tokens)}}).status();
 }
 
+const char* ErrorCodeName(int64_t code) {
+  switch (code) {
+    case kErrorRegistration:
+      return "registration refused";
+    case kErrorMalformed:
+      return "bad request";
+    case kErrorVersion:
+      return "unsupported version";
+    case kErrorBadPath:
+      return "bad path";
+    case kErrorNotPermitted:
+      return "not permitted";
+    case kErrorBusy:
+      return "busy";
+    default:
+      return nullptr;
+  }
+}
+
 }  // namespace dr::client

@@ -1,8 +1,12 @@
 #include "core/log.h"
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cinttypes>
+#include <cstdio>
+#include <cstdlib>
 
 #include "core/utf8.h"
 
@@ -18,8 +22,22 @@ LogSink& CurrentSink() {
   return *sink;
 }
 
-void WriteToStderr(std::string_view line) {
-  std::string buf(line);
+// True when standard error is the stream journald handed this process:
+// JOURNAL_STREAM holds "<device>:<inode>" of that stream, and a process that
+// redirected its standard error elsewhere must not prefix its lines.
+bool StderrIsJournal() {
+  const char* stream = ::getenv("JOURNAL_STREAM");
+  uintmax_t device = 0, inode = 0;
+  struct stat st {};
+  return stream && std::sscanf(stream, "%" SCNuMAX ":%" SCNuMAX, &device, &inode) == 2 &&
+         ::fstat(STDERR_FILENO, &st) == 0 && st.st_dev == device && st.st_ino == inode;
+}
+
+void WriteToStderr(std::string_view line, LogPriority priority) {
+  static const bool journal = StderrIsJournal();
+  std::string buf;
+  if (journal) buf = "<" + std::to_string(static_cast<int>(priority)) + ">";
+  buf += line;
   buf += '\n';
   const char* p = buf.data();
   size_t left = buf.size();
@@ -36,7 +54,7 @@ void WriteToStderr(std::string_view line) {
 
 }  // namespace
 
-void SystemLogLine(std::string_view text) {
+void SystemLogLine(std::string_view text, LogPriority priority) {
   // Every line is one line of UTF-8, whatever bytes a path or a peer put in
   // it: line breaks are written as \n and \r, and bytes that are not UTF-8
   // as \xNN.
@@ -54,7 +72,7 @@ void SystemLogLine(std::string_view text) {
   if (CurrentSink()) {
     CurrentSink()(line);
   } else {
-    WriteToStderr(line);
+    WriteToStderr(line, priority);
   }
 }
 

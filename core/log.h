@@ -2,7 +2,10 @@
 // time and process under systemd). A message is never split over lines: line
 // breaks inside a formatted text are written as "\n", and every line is
 // UTF-8: a byte that is not (from a path, say) is written as "\xNN". Lines
-// from several threads never interleave. Tests may install a sink that captures lines.
+// from several threads never interleave. Tests may install a sink that
+// captures lines. When standard error is the journal's stream
+// (JOURNAL_STREAM names it), each line starts with its priority as "<N>",
+// which journald strips and keeps.
 #pragma once
 
 #include <functional>
@@ -15,13 +18,20 @@
 
 namespace dr {
 
+// A line's priority, as syslog numbers it.
+enum class LogPriority : int { kError = 3, kWarning = 4, kNotice = 5, kInfo = 6, kDebug = 7 };
+
 // Writes `text` as one line of the system log.
-void SystemLogLine(std::string_view text);
+void SystemLogLine(std::string_view text, LogPriority priority = LogPriority::kNotice);
 
 // Formats and writes one line of the system log.
 template <typename... Args>
 void SystemLog(std::string_view format, const Args&... args) {
   SystemLogLine(Format(format, args...));
+}
+template <typename... Args>
+void SystemLogAt(LogPriority priority, std::string_view format, const Args&... args) {
+  SystemLogLine(Format(format, args...), priority);
 }
 
 // Where log lines go. The default writes to standard error.

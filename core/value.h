@@ -32,7 +32,9 @@
 #include <variant>
 #include <vector>
 
-#include "core/key.h"
+// Named from this folder, not from the top, so that the header works where
+// it is installed for hosts too (drd/core/).
+#include "key.h"
 
 namespace dr {
 

@@ -1,21 +1,27 @@
 // drd: the per-user plug-in registry daemon.
 //
-//   drd [-S servicename] [-v]
+//   drd [-S servicename] [-v]      (daemon/command_line.h; also --help, --version)
 //
 // Exit status 2 for a bad command line, 1 when the server cannot be built
 // (for instance another drd already serves the name), 0 after SIGTERM or
-// SIGINT.
+// SIGINT, and for --help and --version. One log line says where drd serves
+// and which registry it opened, one that it stopped.
 #include <signal.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "core/log.h"
+#include "daemon/command_line.h"
 #include "daemon/server.h"
 #include "platform/locations.h"
 #include "platform/notifications.h"
@@ -28,7 +34,7 @@
 
 namespace {
 
-constexpr char kUsage[] = "Usage: drd [-S servicename] [-v]\n";
+using dr::drd_command_line::kUsage;
 
 struct CommandLine {
   std::string serviceName = dr::DRDServer::kDefaultServiceName;
@@ -72,8 +78,43 @@ void RaiseDescriptorLimit() {
   }
 }
 
+// --help and --version are answered before getopt sees the command line,
+// wherever they stand; anything else keeps the usage text and status 2.
+std::optional<int> AnswerHelpOrVersion(int argc, char** argv) {
+  for (int i = 1; i < argc; ++i) {
+    if (std::strcmp(argv[i], "--help") == 0) {
+      std::string help = std::string(kUsage) + "drd, " + dr::drd_command_line::kSummary + ".\n\n";
+      // Each option, its description wrapped at 79 columns beside it.
+      constexpr size_t kColumn = 20, kWidth = 79;
+      for (const auto& o : dr::drd_command_line::kOptions) {
+        std::string line = "  " + std::string(o.option);
+        std::string_view rest = o.description;
+        while (!rest.empty()) {
+          line.resize(std::max(line.size() + 1, kColumn), ' ');
+          size_t take = rest.size();
+          if (kColumn + take > kWidth) take = rest.rfind(' ', kWidth - kColumn);
+          if (take == std::string_view::npos || take == 0) take = rest.size();
+          help += line + std::string(rest.substr(0, take)) + "\n";
+          rest.remove_prefix(std::min(rest.size(), take + 1));
+          line.clear();
+        }
+      }
+      help += "\nSee drd(8).\n";
+      fputs(help.c_str(), stdout);
+      return 0;
+    }
+  }
+  for (int i = 1; i < argc; ++i) {
+    if (std::strcmp(argv[i], "--version") == 0) {
+      fputs("drd " DRD_VERSION "\n", stdout);
+      return 0;
+    }
+  }
+  return std::nullopt;
+}
+
 int Fail(const char* message) {
-  dr::SystemLogLine(message);
+  dr::SystemLogLine(message, dr::LogPriority::kError);
   sd_notifyf(0, "STATUS=%s", message);
   return 1;
 }
@@ -81,6 +122,7 @@ int Fail(const char* message) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  if (std::optional<int> status = AnswerHelpOrVersion(argc, argv)) return *status;
   std::optional<CommandLine> line = ParseCommandLine(argc, argv);
   if (!line) {
     fputs(kUsage, stderr);
@@ -95,12 +137,17 @@ int main(int argc, char** argv) {
   signal(SIGPIPE, SIG_IGN);
   RaiseDescriptorLimit();
 
+  // Read before the server takes the passed sockets: a socket systemd passed
+  // is systemd's to remove, one drd bound is drd's.
+  const bool activated = sd_listen_fds(0) > 0;
+
   dr::Result<dr::RegistryOptions> registryOptions = dr::RegistryOptionsFromEnvironment();
   dr::Result<std::unique_ptr<dr::Registry>> registry =
       registryOptions ? dr::Registry::Open(*registryOptions)
                       : dr::Result<std::unique_ptr<dr::Registry>>(registryOptions.error());
   if (!registry) {
-    dr::SystemLog("unable to open the plug-in registry: %@", registry.error());
+    dr::SystemLogAt(dr::LogPriority::kError, "unable to open the plug-in registry: %@",
+                    registry.error());
     return Fail("unable to construct server");
   }
   std::unique_ptr<dr::ServiceManager> serviceManager =
@@ -135,10 +182,23 @@ int main(int argc, char** argv) {
       dr::DRDServer::initForServiceDatabase(line->serviceName, line->annotationFile, options);
   if (!server) return Fail("unable to construct server");
   server->setVerbose(line->verbose);
+  const std::string socketPath = server->service()->path();
+  struct stat bound {};
+  const bool ownsSocket = !activated && ::lstat(socketPath.c_str(), &bound) == 0;
 
+  dr::SystemLogAt(dr::LogPriority::kInfo, "drd %s listening on %@ (registry %@)", DRD_VERSION,
+                  socketPath, registryOptions->databasePath);
   sd_notify(0, "READY=1");
   server->run();
   sd_notify(0, "STOPPING=1");
+  // The socket file drd bound goes with it, so that nothing looks served; it
+  // is still drd's own while drd lives (a live socket is never replaced).
+  struct stat now {};
+  if (ownsSocket && ::lstat(socketPath.c_str(), &now) == 0 && now.st_dev == bound.st_dev &&
+      now.st_ino == bound.st_ino) {
+    ::unlink(socketPath.c_str());
+  }
+  dr::SystemLogAt(dr::LogPriority::kInfo, "drd stopped");
   // Connection threads may still be delivering their last events; the
   // process ends here rather than tearing the server down under them.
   fflush(stderr);

@@ -5,7 +5,9 @@
 // with the keys in the order given. It is appended to the file in
 // UsageReportOptions::logPath when one is set (one write of the whole line
 // on a descriptor opened with O_APPEND, so lines of several processes never
-// interleave), otherwise written as one system log line. Thread-safe; a
+// interleave), otherwise written as one system log line of priority info
+// that starts with "usage report: ", so that it is never taken for a message
+// of drd's (nor one of drd's lines for a report). Thread-safe; a
 // failed append is logged and the report dropped.
 #pragma once
 

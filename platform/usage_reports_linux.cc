@@ -13,6 +13,7 @@ namespace dr {
 namespace {
 
 constexpr const char* kUsageLogVariable = "DR_USAGE_LOG";
+constexpr char kSystemLogPrefix[] = "usage report: ";
 
 std::string Quoted(std::string_view text) {
   return nlohmann::json(std::string(text))
@@ -26,7 +27,7 @@ class FileUsageReports final : public UsageReports {
   void sendReport(std::string_view domain, int level, const UsageReportKeys& keys) override {
     std::string line = UsageReportJson(domain, level, keys);
     if (!options_.logPath) {
-      SystemLogLine(line);
+      SystemLogLine(kSystemLogPrefix + line, LogPriority::kInfo);
       return;
     }
     line += '\n';

@@ -6,6 +6,8 @@
 #include <charconv>
 #include <string_view>
 
+#include "client/drkit/output.h"
+
 namespace dr::drkit {
 namespace {
 
@@ -48,7 +50,8 @@ constexpr OptionSpec kOptions[] = {
     {kOptSystemOnly, "system-only", false},
     {kOptJson, "json", false},
     {kOptApp, "app", true},
-    {kOptPlugIn, "plugin", true},
+    {kOptPlugIn, "plug-in", true},
+    {kOptPlugIn, "plugin", true},  // the spelling of earlier versions
     {kOptUnset, "unset", true},
     {kOptCount, "count", true},
     {kOptHost, "host", true},
@@ -69,7 +72,10 @@ struct VerbSpec {
 constexpr const char* kDiscoveryOptionsHelp =
     "  -p, --extension-point POINT  plug-ins of this extension point\n"
     "  -i, --identifier ID          plug-ins with this identifier\n"
-    "      --rule KEY=PATTERN       any rule; a KEY given again adds an alternative\n"
+    "      --rule KEY=PATTERN       any rule, PATTERN a string; a KEY given again\n"
+    "                               adds an alternative\n"
+    "      --rule KEY:=JSON         a rule whose pattern is a number, boolean,\n"
+    "                               list or dictionary, written as JSON\n"
     "      --all-versions           every version of an identifier, not just the newest\n"
     "      --duplicates             equal versions too (implies --all-versions)\n"
     "      --hybrid                 include plug-ins with embedded code\n"
@@ -91,7 +97,14 @@ const std::vector<VerbSpec>& Verbs() {
        "Options:\n"
        "$DISCOVERY"
        "  -v, --verbose                also print UUID, path and registration time\n"
-       "      --json                   print the plug-ins' forms as JSON\n"},
+       "      --json                   print the plug-ins' forms as JSON\n\n"
+       "Rules: each names a key of the plug-ins' attributes (then of their\n"
+       "information dictionary) and a pattern. After '=' the pattern is a string,\n"
+       "so \"1.0\" stays a version text; after ':=' it is JSON:\n"
+       "  --rule BNBundleVersion='>=2'                 a version range (a string)\n"
+       "  --rule 'AcceptedTypes:={\"image/png\": 1}'    offers one PNG: a dictionary of\n"
+       "                                               type to number of items\n"
+       "  --rule Count:=3  --rule Enabled:=true        a number, a boolean\n"},
       {"add",
        {},
        1,
@@ -120,25 +133,28 @@ const std::vector<VerbSpec>& Verbs() {
        "  default  no choice (election 0); a plug-in entitled to automatic\n"
        "           election is turned on again when drd next loads it\n"},
       {"annotate",
-       {kOptIdentifier, kOptUnset},
+       {kOptIdentifier, kOptUnset, kOptJson},
        0,
        kUnlimited,
        "annotate -i ID [KEY=VALUE...] [--unset KEY...]",
        "change a plug-in's settings",
        "Sets each KEY to the string VALUE and removes each --unset KEY in the\n"
        "settings of every installed copy of plug-in ID; the other settings stay.\n"
-       "Without changes, prints the settings as JSON.\n"},
+       "Without changes, prints the settings as JSON.\n\n"
+       "Options:\n"
+       "      --json                   print the settings on one line when piped\n"},
       {"hold",
-       {kOptApp, kOptPlugIn},
+       {kOptApp, kOptPlugIn, kOptJson},
        0,
        0,
-       "hold --app PATH... | --plugin PATH...",
+       "hold --app PATH... | --plug-in PATH...",
        "keep plug-ins out of use while they are replaced",
        "Holds every plug-in of the application at each --app PATH, or the plug-in\n"
-       "bundle at each --plugin PATH (options may repeat; the two do not mix).\n"
+       "bundle at each --plug-in PATH (options may repeat; the two do not mix).\n"
        "Prints the hold's token and keeps the hold until SIGINT or SIGTERM, or\n"
        "until standard input ends. Ends with status 1 if drd goes away (the hold\n"
-       "goes with it). Refused while a plug-in of an application is running.\n"},
+       "goes with it). Refused while a plug-in of an application is running.\n"
+       "With --json the token is printed as {\"token\": TOKEN}.\n"},
       {"release",
        {},
        1,
@@ -155,24 +171,27 @@ const std::vector<VerbSpec>& Verbs() {
        "Asks drd to make the plug-ins' services reachable from drkit's process;\n"
        "shows whether a host could use them.\n"},
       {"access",
-       {},
+       {kOptJson},
        1,
        kUnlimited,
        "access UUID...",
        "get read tokens for plug-in bundles",
-       "Prints one read token per plug-in, in order (see 'extension consume').\n"},
+       "Prints one read token per plug-in, in order (see 'extension consume');\n"
+       "with --json, a list of {\"uuid\": UUID, \"token\": TOKEN}.\n"},
       {"extension",
-       {},
+       {kOptJson},
        2,
        3,
        "extension consume TOKEN | extension open TOKEN [FILE]",
        "check or open a read token",
-       "consume: checks TOKEN against the user's key and prints the path it grants.\n"
+       "consume: checks TOKEN against the user's key and prints the path it grants\n"
+       "(with --json, {\"path\": PATH}).\n"
        "open: hands TOKEN to drd, which opens what it grants; prints FILE (a path\n"
-       "inside the granted folder) read through that, or lists the folder. Works\n"
-       "inside a sandbox that can reach drd's socket but not the plug-in.\n"},
+       "inside the granted folder) read through that, or lists the folder (with\n"
+       "--json, {\"path\": PATH, \"names\": [...]}). Works inside a sandbox that\n"
+       "can reach drd's socket but not the plug-in.\n"},
       {"exclude",
-       {kOptPoint, kOptIdentifier, kOptRule},
+       {kOptPoint, kOptIdentifier, kOptRule, kOptJson},
        1,
        2,
        "exclude add RULES | exclude remove RULES|N | exclude list",
@@ -182,19 +201,22 @@ const std::vector<VerbSpec>& Verbs() {
        "  add RULES      add the exclusion made of RULES\n"
        "  remove RULES   remove every exclusion equal to RULES\n"
        "  remove N       remove the N-th exclusion of 'list'\n"
-       "  list           print the exclusions, numbered, as JSON\n"
+       "  list           print the exclusions, numbered, as JSON (with --json,\n"
+       "                 one JSON list of them)\n"
        "RULES:\n"
-       "  -p, --extension-point POINT, -i, --identifier ID, --rule KEY=PATTERN\n"},
+       "  -p, --extension-point POINT, -i, --identifier ID, --rule KEY=PATTERN,\n"
+       "  --rule KEY:=JSON (see 'drkit help match')\n"},
       {"watch",
-       {kOptCount},
+       {kOptCount, kOptJson},
        0,
        0,
        "watch [--count N]",
        "print drd's change notifications",
        "Prints one line per posted change notification: its name and count.\n"
-       "Runs until SIGINT or SIGTERM, or until N notifications were printed.\n"},
+       "Runs until SIGINT or SIGTERM, or until N notifications were printed.\n"
+       "With --json each line is {\"name\": NAME, \"count\": COUNT}.\n"},
       {"raw",
-       {},
+       {kOptJson},
        0,
        1,
        "raw [JSON]",
@@ -205,15 +227,16 @@ const std::vector<VerbSpec>& Verbs() {
        "{\"$uuid\": \"TEXT\"}, {\"$data\": \"BASE64\"}, {\"$date\": SECONDS}.\n"
        "Example: {\"request\": \"match\", \"version\": 2, \"flags\": 1}\n"},
       {"status",
-       {},
+       {kOptJson},
        0,
        0,
        "status",
        "tell whether drd is answering",
-       "Prints drd's socket and whether drd answers a request there.\n"},
+       "Prints drd's socket and whether drd answers a request there; with --json,\n"
+       "{\"service\": NAME, \"socket\": PATH, \"answering\": true|false}.\n"},
       {"explain",
        {kOptHost, kOptPoint, kOptRule, kOptAllVersions, kOptDuplicates, kOptAll, kOptHybrid,
-        kOptSystemOnly, kOptVerbose},
+        kOptSystemOnly, kOptVerbose, kOptJson},
        1,
        1,
        "explain PATH|IDENTIFIER [--host APP] [OPTIONS]",
@@ -225,7 +248,8 @@ const std::vector<VerbSpec>& Verbs() {
        "      --host APP               the host application's bundle (default: a\n"
        "                               host outside any bundle)\n"
        "$DISCOVERY"
-       "  -v, --verbose                also print what drd would log\n"},
+       "  -v, --verbose                also print what drd would log\n"
+       "      --json                   print the same as one JSON object\n"},
       {"help", {}, 0, 1, "help [VERB]", "print help", "Prints the help of VERB, or of drkit.\n"},
   };
   return verbs;
@@ -242,12 +266,12 @@ Error UsageError(std::string message) { return Error(kUsageErrorDomain, 2, std::
 
 // Adds KEY=PATTERN to a rules dictionary; a second pattern for one key turns
 // the entry into an array of alternatives.
-Status AddRule(Dictionary& rules, std::string_view key, std::string_view pattern) {
+Status AddRule(Dictionary& rules, std::string_view key, Value pattern) {
   if (key.empty()) return UsageError("a rule needs a key: KEY=PATTERN");
-  auto [it, inserted] = rules.try_emplace(std::string(key), Value(pattern));
+  auto [it, inserted] = rules.try_emplace(std::string(key), pattern);
   if (inserted) return Status();
   Array alternatives = it->second.isArray() ? it->second.array() : Array{it->second};
-  alternatives.emplace_back(pattern);
+  alternatives.push_back(std::move(pattern));
   it->second = Value(std::move(alternatives));
   return Status();
 }
@@ -282,8 +306,8 @@ Status Validate(Invocation& inv, const std::vector<bool>& seen) {
     return Status();
   }
   if (inv.verb == "hold") {
-    if (seen[kOptApp] && seen[kOptPlugIn]) return need(false, "--app and --plugin do not mix");
-    return need(inv.holdTarget.has_value(), "--app PATH or --plugin PATH is required");
+    if (seen[kOptApp] && seen[kOptPlugIn]) return need(false, "--app and --plug-in do not mix");
+    return need(inv.holdTarget.has_value(), "--app PATH or --plug-in PATH is required");
   }
   if (inv.verb == "release" || inv.verb == "ready" || inv.verb == "access") {
     for (const std::string& text : ops) {
@@ -367,21 +391,36 @@ Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Inv
         inv.help = true;
         break;
       case kOptPoint:
-        s = AddRule(rules, client::kRuleExtensionPoint, value);
+        s = AddRule(rules, client::kRuleExtensionPoint, Value(value));
         break;
       case kOptIdentifier:
         if (verb == "elect" || verb == "annotate") {
           if (!inv.identifier.empty()) return UsageError(verb + ": -i may be given once");
           inv.identifier = value;
         } else {
-          s = AddRule(rules, client::kRuleIdentifier, value);
+          s = AddRule(rules, client::kRuleIdentifier, Value(value));
         }
         break;
       case kOptRule: {
+        // KEY=PATTERN takes the text as it is; KEY:=JSON reads a typed
+        // pattern (a number, boolean, list or dictionary).
         size_t eq = value.find('=');
-        if (eq == std::string::npos) return UsageError(verb + ": expected --rule KEY=PATTERN");
-        s = AddRule(rules, std::string_view(value).substr(0, eq),
-                    std::string_view(value).substr(eq + 1));
+        if (eq == std::string::npos) {
+          return UsageError(verb + ": expected --rule KEY=PATTERN or --rule KEY:=JSON");
+        }
+        std::string_view key = std::string_view(value).substr(0, eq);
+        const std::string_view text = std::string_view(value).substr(eq + 1);
+        Value pattern(text);
+        if (!key.empty() && key.back() == ':') {
+          key.remove_suffix(1);
+          Result<Value> typed = FromJson(text);
+          if (!typed) {
+            return UsageError(verb + ": --rule " + std::string(key) + ":=" + std::string(text) +
+                              ": " + typed.error().localizedDescription());
+          }
+          pattern = *typed;
+        }
+        s = AddRule(rules, key, std::move(pattern));
         break;
       }
       case kOptAllVersions:
@@ -504,6 +543,34 @@ std::string GeneralHelp() {
       "\nRun 'drkit help VERB' for a verb's options. drd's socket folder is\n"
       "$DR_SOCKET_DIR, else $XDG_RUNTIME_DIR/dromon.\n";
   return out;
+}
+
+std::string HelpCommandFor(const std::vector<std::string>& argv) {
+  for (size_t i = 1; i < argv.size(); ++i) {
+    const std::string& a = argv[i];
+    if (a == "-S" || a == "--service") {
+      ++i;
+    } else if (a.empty() || a[0] != '-') {
+      return FindVerb(a) ? "drkit help " + a : "drkit help";
+    }
+  }
+  return "drkit help";
+}
+
+std::vector<VerbDoc> VerbDocs() {
+  std::vector<VerbDoc> docs;
+  for (const VerbSpec& v : Verbs()) {
+    VerbDoc doc{v.name, v.synopsis, v.summary, VerbHelp(v.name), {}};
+    std::vector<Option> allowed = v.options;
+    allowed.push_back(kOptHelp);
+    for (const OptionSpec& o : kOptions) {
+      if (std::find(allowed.begin(), allowed.end(), o.id) == allowed.end()) continue;
+      if (o.id < 256) doc.options.push_back(std::string("-") + static_cast<char>(o.id));
+      doc.options.push_back(std::string("--") + o.longName);
+    }
+    docs.push_back(std::move(doc));
+  }
+  return docs;
 }
 
 std::string VerbHelp(const std::string& verb) {

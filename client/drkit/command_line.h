@@ -58,4 +58,19 @@ std::string GeneralHelp();
 // The help of one verb; empty for an unknown verb.
 std::string VerbHelp(const std::string& verb);
 
+// Where a refused command line points for help: "drkit help VERB" when argv
+// names a verb, else "drkit help".
+std::string HelpCommandFor(const std::vector<std::string>& argv);
+
+// Each verb as its help, drkit's manual page and its shell completion tell
+// it, from the one table the parser uses.
+struct VerbDoc {
+  std::string name;
+  std::string synopsis;              // "match [OPTIONS]"
+  std::string summary;               // one line
+  std::string help;                  // VerbHelp(name)
+  std::vector<std::string> options;  // "-p", "--extension-point", ... "--help"
+};
+std::vector<VerbDoc> VerbDocs();
+
 }  // namespace dr::drkit

@@ -16,7 +16,11 @@ struct Io {
   std::ostream& out;
   std::ostream& err;
   std::istream& in;
+  bool prettyJson = false;  // standard output is a terminal
 };
+
+// `value` as JSON for io.out: indented on a terminal, one line otherwise.
+std::string Json(const Io& io, const Value& value);
 
 // Runs any verb (and help and --version).
 int Run(const Invocation& invocation, Io& io);
@@ -36,7 +40,8 @@ int RunExclude(const Invocation& inv, Io& io);
 int RunWatch(const Invocation& inv, Io& io);
 int RunExplain(const Invocation& inv, Io& io);
 
-// Prints "drkit: <error>" on io.err; answers 1.
+// Prints "drkit: <error>" on io.err, and a hint to start drd when its socket
+// is missing or nobody listens on it; answers 1.
 int Fail(Io& io, const Error& error);
 int Fail(Io& io, const std::string& message);
 

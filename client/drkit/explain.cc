@@ -151,7 +151,7 @@ int RunExplain(const Invocation& inv, Io& io) {
     if (!client.hasEntitlement(kManagerEntitlement) || sandboxed) {
       return Fail(io,
                   "drd would refuse this host's request: unauthorized discovery flag "
-                  "(DRDiscoverAll) (drd error 11)");
+                  "(DRDiscoverAll) (not permitted, code 11)");
     }
   }
 
@@ -199,40 +199,69 @@ int RunExplain(const Invocation& inv, Io& io) {
   }
   discovery.finish();
 
-  io.out << "host: " << hostName << "\n";
-  if (inv.rules.isPresent()) io.out << "rules: " << ToJson(inv.rules, false) << "\n";
-  if (inv.flags) io.out << "flags: 0x" << std::hex << inv.flags << std::dec << "\n";
-  int status = 0;
-  if (wanted.empty()) {
-    io.out << target << ": not registered\n";
-    status = 1;
-  }
+  // One report, printed as text or as JSON.
+  Dictionary report;
+  report["host"] = hostName;
+  report["target"] = target;
+  report["registered"] = !wanted.empty();
+  if (inv.rules.isPresent()) report["rules"] = inv.rules;
+  if (inv.flags) report["flags"] = inv.flags;
+  Array plugIns;
   for (const RegistryEntryPtr& entry : wanted) {
     const Discovery::Verdict* verdict = nullptr;
     for (const Discovery::Verdict& v : discovery.verdicts()) {
       if (entryOf[v.plugIn.get()] == entry) verdict = &v;
     }
-    io.out << entry->plugInIdentifier() << " " << entry->uuid().string() << "\n"
-           << "    path: " << entry->url() << "\n"
-           << "    registered: "
-           << FormatTime(static_cast<int64_t>(entry->registrationDate().seconds)) << "\n";
+    Dictionary p;
+    p["identifier"] = entry->plugInIdentifier();
+    p["uuid"] = entry->uuid().string();
+    p["path"] = entry->url();
+    p["registered"] = static_cast<int64_t>(entry->registrationDate().seconds);
     if (!verdict) {
-      io.out << "    discovery: never offered: drd cannot make a record of it\n";
-      continue;
+      p["discovery"] = "never offered";
+      p["detail"] = "drd cannot make a record of it";
+    } else {
+      const DRDPlugIn& record = *verdict->plugIn;
+      p["version"] = record.version().value_or("?");
+      p["election"] = ElectionText(annotations->annotationForPlugIn(record)["election"]);
+      p["discovery"] = DiscoveryOutcomeName(verdict->outcome);
+      if (!verdict->detail.empty()) p["detail"] = verdict->detail;
+      if (verdict->by) p["by"] = Describe(*verdict->by);
     }
-    const DRDPlugIn& p = *verdict->plugIn;
-    io.out << "    version: " << p.version().value_or("?") << "\n";
-    const Value annotation = annotations->annotationForPlugIn(p);
-    io.out << "    election: " << ElectionText(annotation["election"]) << "\n";
-    io.out << "    discovery: " << DiscoveryOutcomeName(verdict->outcome);
-    if (!verdict->detail.empty()) io.out << ": " << verdict->detail;
-    if (verdict->by) io.out << " by " << Describe(*verdict->by);
+    plugIns.push_back(Value(std::move(p)));
+  }
+  report["plugins"] = Value(std::move(plugIns));
+  if (inv.verbose) {
+    Array lines;
+    for (const std::string& line : log.lines()) lines.push_back(Value(line));
+    report["log"] = Value(std::move(lines));
+  }
+  const int status = wanted.empty() ? 1 : 0;
+  if (inv.json) {
+    io.out << Json(io, Value(std::move(report))) << "\n";
+    return status;
+  }
+
+  const Value r(std::move(report));
+  io.out << "host: " << hostName << "\n";
+  if (inv.rules.isPresent()) io.out << "rules: " << ToJson(inv.rules, false) << "\n";
+  if (inv.flags) io.out << "flags: 0x" << std::hex << inv.flags << std::dec << "\n";
+  if (wanted.empty()) io.out << target << ": not registered\n";
+  for (const Value& p : r["plugins"].array()) {
+    io.out << p["identifier"].stringValue() << " " << p["uuid"].stringValue() << "\n"
+           << "    path: " << p["path"].stringValue() << "\n"
+           << "    registered: " << FormatTime(p["registered"].intValue()) << "\n";
+    if (p.has("version")) {
+      io.out << "    version: " << p["version"].stringValue() << "\n"
+             << "    election: " << p["election"].stringValue() << "\n";
+    }
+    io.out << "    discovery: " << p["discovery"].stringValue();
+    if (p.has("detail")) io.out << ": " << p["detail"].stringValue();
+    if (p.has("by")) io.out << " by " << p["by"].stringValue();
     io.out << "\n";
   }
   io.out << "note: holds exist only inside a running drd and are not shown\n";
-  if (inv.verbose) {
-    for (const std::string& line : log.lines()) io.out << "log: " << line << "\n";
-  }
+  for (const Value& line : r["log"].array()) io.out << "log: " << line.stringValue() << "\n";
   return status;
 }
 

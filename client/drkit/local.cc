@@ -45,6 +45,12 @@ int RunExtension(const Invocation& inv, Io& io) {
     const std::string file = inv.operands.size() > 2 ? inv.operands[2] : "";
     // A folder is listed, a file printed.
     if (Result<std::vector<std::string>> names = opened->listFolder(file)) {
+      if (inv.json) {
+        Array list(names->begin(), names->end());
+        io.out << Json(io, Value{{"path", opened->path()}, {"names", Value(std::move(list))}})
+               << "\n";
+        return 0;
+      }
       for (const std::string& name : *names) io.out << name << "\n";
       return 0;
     }
@@ -58,7 +64,7 @@ int RunExtension(const Invocation& inv, Io& io) {
   }
   Result<std::string> path = client::consumeExtension(inv.operands[1]);
   if (!path) return Fail(io, path.error().localizedDescription());
-  io.out << *path << "\n";
+  io.out << (inv.json ? Json(io, Value{{"path", *path}}) : *path) << "\n";
   return 0;
 }
 
@@ -72,6 +78,10 @@ int RunExclude(const Invocation& inv, Io& io) {
     if (exclusions.isPresent() && !exclusions.isArray()) {
       return Fail(io, "the stored exclusions are not a list; drd ignores them: " +
                           exclusions.description());
+    }
+    if (inv.json) {
+      io.out << Json(io, Value(exclusions.array())) << "\n";
+      return 0;
     }
     size_t n = 0;
     for (const Value& e : exclusions.array()) io.out << ++n << ": " << ToJson(e, false) << "\n";
@@ -134,7 +144,13 @@ int RunWatch(const Invocation& inv, Io& io) {
         (*observer)->waitForPost(std::chrono::milliseconds(250));
     if (!post) return Fail(io, post.error().localizedDescription());
     if (!*post) continue;
-    io.out << (*post)->name << " " << (*post)->count << std::endl;
+    if (inv.json) {
+      // One object a line, whatever standard output is: a stream of events.
+      io.out << ToJson(Value{{"name", (*post)->name}, {"count", (*post)->count}}, false)
+             << std::endl;
+    } else {
+      io.out << (*post)->name << " " << (*post)->count << std::endl;
+    }
     ++printed;
   }
   return 0;

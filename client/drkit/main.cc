@@ -1,5 +1,7 @@
 // drkit: drd's command-line tool. Parses the command line, runs the verb,
 // exits with its status (0 success, 1 failure, 2 usage error).
+#include <unistd.h>
+
 #include <iostream>
 #include <string>
 #include <vector>
@@ -9,11 +11,12 @@
 
 int main(int argc, char** argv) {
   std::vector<std::string> args(argv, argv + argc);
-  dr::drkit::Io io{std::cout, std::cerr, std::cin};
+  // JSON for people is indented; JSON for a pipe or a file is one line.
+  dr::drkit::Io io{std::cout, std::cerr, std::cin, ::isatty(STDOUT_FILENO) == 1};
   dr::Result<dr::drkit::Invocation> invocation = dr::drkit::ParseCommandLine(args);
   if (!invocation) {
     std::cerr << "drkit: " << invocation.error().localizedDescription() << "\n"
-              << "Try 'drkit --help'.\n";
+              << "Try '" << dr::drkit::HelpCommandFor(args) << "'.\n";
     return dr::drkit::kExitUsage;
   }
   return dr::drkit::Run(*invocation, io);

@@ -173,7 +173,9 @@ std::string PlugInLines(const client::PlugIn& p, bool verbose) {
 std::string DescribeError(const Error& error) {
   std::string text = error.localizedDescription();
   if (error.domain() == client::kDaemonErrorDomain) {
-    text += " (drd error " + std::to_string(error.code()) + ")";
+    const char* name = client::ErrorCodeName(error.code());
+    text += std::string(" (") + (name ? name : "drd error") + ", code " +
+            std::to_string(error.code()) + ")";
   }
   return text;
 }

@@ -35,8 +35,8 @@ std::string PlugInLines(const client::PlugIn& plugIn, bool verbose);
 // A registration time as "2026-01-31 12:00:00 UTC".
 std::string FormatTime(int64_t secondsSince1970);
 
-// An error for standard error: its text, and drd's code for drd's errors:
-// "unable to register plug-in at /x (drd error 2)".
+// An error for standard error: its text as it came, and for drd's errors
+// the code's name and number: "no plugin at /x (bad path, code 9)".
 std::string DescribeError(const Error& error);
 
 }  // namespace dr::drkit

@@ -58,7 +58,17 @@ std::string AbsolutePath(const std::string& path) {
   return out;
 }
 
-int Fail(Io& io, const Error& error) { return Fail(io, DescribeError(error)); }
+std::string Json(const Io& io, const Value& value) { return ToJson(value, io.prettyJson); }
+
+int Fail(Io& io, const Error& error) {
+  Fail(io, DescribeError(error));
+  if (error.domain() == kPosixErrorDomain &&
+      (error.code() == ENOENT || error.code() == ECONNREFUSED)) {
+    io.err << "drkit: drd is not running; start it with 'systemctl --user start drd.socket'"
+              " (or run 'drd' in another terminal)\n";
+  }
+  return 1;
+}
 
 int Fail(Io& io, const std::string& message) {
   io.err << "drkit: " << message << "\n";
@@ -73,7 +83,7 @@ int RunMatch(const Invocation& inv, Io& io) {
   if (inv.json) {
     Array forms;
     for (const PlugIn& p : *found) forms.push_back(p.form);
-    io.out << ToJson(Value(std::move(forms))) << "\n";
+    io.out << Json(io, Value(std::move(forms))) << "\n";
     return 0;
   }
   // People read the list by identifier; copies of one identifier keep drd's
@@ -116,7 +126,7 @@ int RunAnnotate(const Invocation& inv, Io& io) {
   if (!copies) return Fail(io, copies.error());
   if (inv.operands.empty() && inv.unset.empty()) {
     const Value& settings = copies->front().settings();
-    io.out << ToJson(settings.isDictionary() ? settings : Value::EmptyDictionary()) << "\n";
+    io.out << Json(io, settings.isDictionary() ? settings : Value::EmptyDictionary()) << "\n";
     return 0;
   }
   // drd replaces the settings dictionary as a whole, so each copy's own
@@ -159,7 +169,11 @@ int RunHold(const Invocation& inv, Io& io) {
     ::close(signals);
     return status;
   }
-  io.out << token->string() << std::endl;
+  if (inv.json) {
+    io.out << Json(io, Value{{"token", token->string()}}) << std::endl;
+  } else {
+    io.out << token->string() << std::endl;
+  }
 
   // Kept until a signal comes or standard input ends, or drd goes away: the
   // hold lives in drd, so a drkit that stayed would hold nothing.
@@ -210,6 +224,14 @@ int RunReadyAccess(const Invocation& inv, Io& io) {
   }
   Result<std::vector<std::string>> tokens = (*c)->access(uuids);
   if (!tokens) return Fail(io, tokens.error());
+  if (inv.json) {
+    Array pairs;
+    for (size_t i = 0; i < tokens->size() && i < uuids.size(); ++i) {
+      pairs.push_back(Value{{"uuid", uuids[i].string()}, {"token", (*tokens)[i]}});
+    }
+    io.out << Json(io, Value(std::move(pairs))) << "\n";
+    return 0;
+  }
   for (const std::string& t : *tokens) io.out << t << "\n";
   return 0;
 }
@@ -234,25 +256,27 @@ int RunRaw(const Invocation& inv, Io& io) {
   if (!c) return Fail(io, c.error());
   Result<Value> reply = (*c)->send(*message);
   if (!reply) return Fail(io, reply.error());
-  io.out << ToJson(*reply) << "\n";
+  io.out << Json(io, *reply) << "\n";
   if (std::optional<Error> error = client::ReplyError(*reply)) return Fail(io, *error);
   return 0;
 }
 
 int RunStatus(const Invocation& inv, Io& io) {
   const std::string directory = client::DefaultSocketDirectory();
-  io.out << "service: " << inv.service << "\n"
-         << "socket: " << directory << "/" << inv.service << "\n";
   auto c = Client::Open(inv.service, directory);
   // An empty annotation changes nothing and is answered at once: a request
   // that proves drd serves, without side effects.
   Status s = c ? (*c)->annotate({}, client::AnnotationChange{}) : c.status();
-  if (!s.ok()) {
-    io.out << "state: not answering\n";
-    return Fail(io, s.error());
+  const std::string socket = directory + "/" + inv.service;
+  if (inv.json) {
+    io.out << Json(io, Value{{"service", inv.service}, {"socket", socket}, {"answering", s.ok()}})
+           << "\n";
+  } else {
+    io.out << "service: " << inv.service << "\n"
+           << "socket: " << socket << "\n"
+           << "state: " << (s.ok() ? "answering" : "not answering") << "\n";
   }
-  io.out << "state: answering\n";
-  return 0;
+  return s.ok() ? 0 : Fail(io, s.error());
 }
 
 }  // namespace dr::drkit

@@ -44,6 +44,15 @@ TEST(DrkitCommandLineTest, ParsesEachVerbsOptions) {
                                    {"k", "=v"},
                                    {"e", ""}}));
        }},
+      // After ':=' a pattern is JSON; after '=' it stays text, even "1.0".
+      {{"match", "--rule", "n:=3", "--rule", "b:=true", "--rule", "v=1.0", "--rule",
+        R"(AcceptedTypes:={"image/png": 1})", "--rule", "n:=-1"},
+       [](const Invocation& i) {
+         EXPECT_EQ(i.rules, (Value{{"n", Value(Array{uint64_t{3}, int64_t{-1}})},
+                                   {"b", true},
+                                   {"v", "1.0"},
+                                   {"AcceptedTypes", Value{{"image/png", uint64_t{1}}}}}));
+       }},
       {{"add", "a", "/b"},
        [](const Invocation& i) {
          EXPECT_EQ(i.operands, (std::vector<std::string>{"a", "/b"}));
@@ -108,17 +117,22 @@ TEST(DrkitCommandLineTest, RefusesMalformedCommandLines) {
       {{"Match"}, "unknown verb 'Match'"},
       {{"match", "--bogus=1"}, "match: unknown option '--bogus'"},
       {{"match", "--rule"}, "match: option '--rule' needs a value"},
-      {{"match", "--rule", "novalue"}, "match: expected --rule KEY=PATTERN"},
+      {{"match", "--rule", "novalue"}, "match: expected --rule KEY=PATTERN or --rule KEY:=JSON"},
+      {{"match", "--rule", "n:=three"}, "match: --rule n:=three: not valid JSON"},
+      {{"match", "--rule", "n:=null"}, "match: --rule n:=null: null is not a value drd knows"},
+      {{"match", "--rule", ":=1"}, "match: a rule needs a key: KEY=PATTERN"},
       {{"match", "--rule", "=x"}, "match: a rule needs a key: KEY=PATTERN"},
       {{"match", "stray"}, "match: unexpected operand 'stray'"},
       {{"add", "--json", "/a"}, "add: unknown option '--json'"},
+      {{"elect", "--json", "-i", "a", "use"}, "elect: unknown option '--json'"},
       {{"elect", "-i", "a"}, "elect: missing operand"},
       {{"elect", "-i", "a", "on"}, "elect: expected use, ignore or default, not 'on'"},
       {{"elect", "-i", "a", "-i", "b", "use"}, "elect: -i may be given once"},
       {{"annotate", "-i", "a", "novalue"}, "annotate: expected KEY=VALUE, not 'novalue'"},
       {{"annotate", "-i", "a", "=v"}, "annotate: expected KEY=VALUE, not '=v'"},
       {{"annotate", "x=1"}, "annotate: -i ID is required"},
-      {{"hold"}, "hold: --app PATH or --plugin PATH is required"},
+      {{"hold"}, "hold: --app PATH or --plug-in PATH is required"},
+      {{"hold", "--app", "/a", "--plug-in", "/b"}, "hold: --app and --plug-in do not mix"},
       {{"hold", "--app", "/a", "/b"}, "hold: unexpected operand '/b'"},
       {{"ready", "1B4E28BA-2FA1-11D2-883F-0016D3CCA42"},
        "ready: not a UUID: '1B4E28BA-2FA1-11D2-883F-0016D3CCA42'"},

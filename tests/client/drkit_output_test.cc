@@ -84,7 +84,10 @@ TEST(DrkitOutputTest, FormsWithoutIdentityAreRefused) {
 
 TEST(DrkitOutputTest, ErrorsNameDrdsCode) {
   EXPECT_EQ(DescribeError(Error(client::kDaemonErrorDomain, 9, "no plugin at /x")),
-            "no plugin at /x (drd error 9)");
+            "no plugin at /x (bad path, code 9)");
+  EXPECT_EQ(DescribeError(Error(client::kDaemonErrorDomain, 14, "busy")), "busy (busy, code 14)");
+  EXPECT_EQ(DescribeError(Error(client::kDaemonErrorDomain, 99, "new")),
+            "new (drd error, code 99)");
   EXPECT_EQ(DescribeError(Error(kPosixErrorDomain, 2, "connect: No such file or directory")),
             "connect: No such file or directory");
 }

@@ -6,11 +6,13 @@
 
 #include <atomic>
 #include <chrono>
+#include <fstream>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "platform/drm1.h"
+#include "tests/integration/drkit_runner.h"
 #include "tests/support/drm1_peer.h"
 #include "tests/support/process_fixtures.h"
 
@@ -76,6 +78,82 @@ TEST_F(DrdTest, BadCommandLinesPrintUsageAndExit2) {
     DrdProcess drd(root_.path(), arguments);
     EXPECT_EQ(drd.waitForExit(), 2) << arguments[0];
     EXPECT_EQ(drd.standardError(), kUsage) << arguments[0];
+  }
+}
+
+// --help and --version win over everything else on the line; both go to
+// standard output and end with status 0.
+TEST_F(DrdTest, HelpAndVersionPrintToStandardOutput) {
+  const std::vector<std::pair<std::vector<std::string>, std::string>> rows = {
+      {{"--version"}, "drd 0.1.0\n"},
+      {{"-v", "--version", "stray"}, "drd 0.1.0\n"},
+      {{"--help"}, "Usage: drd [-S servicename] [-v]\ndrd, the per-user plug-in registry daemon"},
+      {{"-x", "--help"}, "Usage: drd [-S servicename] [-v]\n"},
+  };
+  for (const auto& [arguments, start] : rows) {
+    testing::Child drd(DrdProcess::BinaryPath(), arguments,
+                       testing::DrkitEnvironment(root_.path()));
+    EXPECT_EQ(drd.wait(), 0) << arguments[0];
+    EXPECT_EQ(drd.out().rfind(start, 0), 0u) << drd.out();
+    EXPECT_EQ(drd.err(), "");
+  }
+}
+
+// drd says where it serves and which registry it opened, and that it
+// stopped; the socket file it made goes with it.
+TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
+  Start();
+  const std::string socket = drd_->socketPath();
+  EXPECT_EQ(drd_->standardError(), "drd 0.1.0 listening on " + socket + " (registry " +
+                                       root_.path() + "/registry/r.sqlite3)\n");
+  ASSERT_TRUE(drd_->signal(SIGTERM));
+  EXPECT_EQ(drd_->waitForExit(), 0);
+  EXPECT_EQ(drd_->standardError().substr(
+                drd_->standardError().rfind('\n', drd_->standardError().size() - 2) + 1),
+            "drd stopped\n");
+  EXPECT_NE(::access(socket.c_str(), F_OK), 0) << "the socket file is left behind";
+  drd_.reset();
+}
+
+// When JOURNAL_STREAM names drd's standard error, every line starts with
+// its priority; when it names something else, no line does.
+TEST_F(DrdTest, LinesCarryTheirPriorityOnlyOnTheJournalStream) {
+  Start({"-S", "com.example.first"}, "com.example.first");
+  const std::string kOwnStream = "$(stat -c %d:%i \"$0\")";
+  struct Row {
+    std::string stream;   // shell text for JOURNAL_STREAM
+    std::string service;  // the second drd's service name
+    int status;           // its exit status
+    std::string first;    // the start of its first line of standard error
+    std::string last;     // its last line
+  };
+  const std::vector<Row> rows = {
+      {kOwnStream, "com.example.second", 0, "<6>drd 0.1.0 listening on ", "<6>drd stopped"},
+      {kOwnStream, "com.example.first", 1, "<5>unable to listen as ",
+       "<3>unable to construct server"},
+      {"0:0", "com.example.first", 1, "unable to listen as ", "unable to construct server"},
+  };
+  const std::string errorFile = root_.path() + "/journal.stderr";
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.stream + " " + row.service);
+    testing::Child drd(
+        "/bin/sh",
+        {"-c", "exec 2>\"$0\"; JOURNAL_STREAM=" + row.stream + " exec \"$1\" -S \"$2\"", errorFile,
+         DrdProcess::BinaryPath(), row.service},
+        testing::DrkitEnvironment(root_.path()));
+    if (row.status == 0) {
+      for (int i = 0; i < 200 && !Drm1Peer(drd_->socketPath(row.service)).connected(); ++i) {
+        std::this_thread::sleep_for(50ms);
+      }
+      drd.signal(SIGTERM);
+    }
+    EXPECT_EQ(drd.wait(), row.status);
+    std::ifstream in(errorFile);
+    std::string first, last;
+    std::getline(in, first);
+    for (std::string line; std::getline(in, line);) last = line;
+    EXPECT_EQ(first.rfind(row.first, 0), 0u) << first;
+    EXPECT_EQ(last, row.last);
   }
 }
 

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -109,6 +110,14 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
       {{"match", "--rule", "BNBundleVersion=>=2"},
        "  com.example.b (2.0)\n  com.example.other (3.0)\n"},
       {{"match", "-p", "com.example.nowhere"}, ""},
+      // Typed patterns: true asks for a key that is present (and not 0),
+      // false for one that is absent; the text "true" is a version text.
+      {{"match", "--rule", "UXExtensionPointName:=true"},
+       "  com.example.a (1.0)\n  com.example.b (2.0)\n  com.example.other (3.0)\n"},
+      {{"match", "--rule", "UXExtensionPointName=true"}, ""},
+      {{"match", "--rule", "NoSuchKey:=false", "-i", "com.example.a"}, "  com.example.a (1.0)\n"},
+      {{"match", "--rule", "BNBundleVersion:=[\"1.0\", \"3.0\"]"},
+       "  com.example.a (1.0)\n  com.example.other (3.0)\n"},
   };
   for (const Row& row : rows) EXPECT_EQ(ok(row.args), row.out) << row.args.back();
 
@@ -127,10 +136,11 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
 
   // drd's refusals: message and code on standard error, status 1.
   const std::vector<std::pair<std::vector<std::string>, std::string>> failures = {
-      {{"remove", a}, "drkit: no plugin at " + a + " (drd error 9)\n"},
+      {{"remove", a}, "drkit: no plugin at " + a + " (bad path, code 9)\n"},
       {{"add", root() + "/missing.appex"},
-       "drkit: invalid plugin path: " + root() + "/missing.appex (drd error 9)\n"},
-      {{"match", "--all"}, "drkit: unauthorized discovery flag (DRDiscoverAll) (drd error 11)\n"},
+       "drkit: invalid plugin path: " + root() + "/missing.appex (bad path, code 9)\n"},
+      {{"match", "--all"},
+       "drkit: unauthorized discovery flag (DRDiscoverAll) (not permitted, code 11)\n"},
   };
   for (const auto& [args, err] : failures) {
     Ran r = drkit(args);
@@ -159,8 +169,7 @@ TEST_F(DrkitTest, ElectionsAndSettingsAreRecorded) {
   ok({"elect", "-i", "com.example.b", "use"});
   EXPECT_EQ(ok({"annotate", "-i", "com.example.b", "color=red", "size=3", "note=a=b"}), "");
   EXPECT_EQ(ok({"annotate", "-i", "com.example.b", "--unset", "color", "size=4"}), "");
-  EXPECT_EQ(ok({"annotate", "-i", "com.example.b"}),
-            "{\n  \"note\": \"a=b\",\n  \"size\": \"4\"\n}\n");
+  EXPECT_EQ(ok({"annotate", "-i", "com.example.b"}), "{\"note\":\"a=b\",\"size\":\"4\"}\n");
   EXPECT_EQ(ok({"match", "-i", "com.example.b"}), "+ com.example.b (1.0)\n");
   EXPECT_EQ(ok({"annotate", "-i", "com.example.a"}), "{}\n");
 }
@@ -190,7 +199,7 @@ TEST_F(DrkitTest, AccessTokensGrantTheBundleAndReadyChecksThePlugIn) {
   for (const char* verb : {"ready", "access"}) {
     Ran r = drkit({verb, uuid, unknown});
     EXPECT_EQ(r.status, 1) << verb;
-    EXPECT_EQ(r.err, "drkit: no such plugin (uuid not found) (drd error 4)\n") << verb;
+    EXPECT_EQ(r.err, "drkit: no such plugin (uuid not found) (bad request, code 4)\n") << verb;
   }
 }
 
@@ -210,7 +219,7 @@ TEST_F(DrkitTest, HoldLastsUntilInputEndsOrASignalOrARelease) {
     EXPECT_EQ(refused.status, 1);
     EXPECT_EQ(refused.err,
               "drkit: access to plugin com.example.a denied: the plug-in is on hold "
-              "(drd error 11)\n");
+              "(not permitted, code 11)\n");
     holder.closeInput();
     EXPECT_EQ(holder.wait(), 0) << holder.err();
     EXPECT_EQ(ok({"match"}), listed);
@@ -236,7 +245,8 @@ TEST_F(DrkitTest, HoldLastsUntilInputEndsOrASignalOrARelease) {
   }
   Ran nothing = drkit({"hold", "--plugin", root() + "/Apps/Host.app"});
   EXPECT_EQ(nothing.status, 1);
-  EXPECT_EQ(nothing.err, "drkit: no plug-in at path:" + root() + "/Apps/Host.app (drd error 9)\n");
+  EXPECT_EQ(nothing.err,
+            "drkit: no plug-in at path:" + root() + "/Apps/Host.app (bad path, code 9)\n");
   {
     // The hold dies with drd; a drkit that kept waiting would claim a hold
     // nobody keeps.
@@ -292,9 +302,14 @@ TEST_F(DrkitTest, ExclusionsHidePlugInsAndKeepTheRestOfTheFile) {
 TEST_F(DrkitTest, WatchPrintsOneLinePerPost) {
   ok({"add", makePlugIn("a")});
   Child watcher(ClientBinaryPath("drkit"), {"watch", "--count", "2"}, DrkitEnvironment(root()));
+  Child json(ClientBinaryPath("drkit"), {"watch", "--count", "1", "--json"},
+             DrkitEnvironment(root()));
   ASSERT_EQ(watcher.readErrorLine(), "drkit: watching " + root() + "/notify");
+  ASSERT_EQ(json.readErrorLine(), "drkit: watching " + root() + "/notify");
   ok({"elect", "-i", "com.example.a", "use"});
   EXPECT_EQ(watcher.readLine(), "com.corvel.dromon.annotation-change 1");
+  EXPECT_EQ(json.readLine(), R"({"count":1,"name":"com.corvel.dromon.annotation-change"})");
+  EXPECT_EQ(json.wait(), 0) << json.err();
   ok({"elect", "-i", "com.example.a", "ignore"});
   EXPECT_EQ(watcher.readLine(), "com.corvel.dromon.annotation-change 2");
   EXPECT_EQ(watcher.wait(), 0) << watcher.err();
@@ -304,12 +319,11 @@ TEST_F(DrkitTest, RawSendsAnyRequestAndStatusTellsWhetherDrdAnswers) {
   EXPECT_EQ(ok({"raw", R"({"request": "lock", "version": 2, "uuids": [{"$uuid": ")" +
                            Uuid::random().string() + "\"}]}"}),
             "{}\n");
-  EXPECT_EQ(ok({"raw"}, R"({"request": "match", "version": 2, "flags": 1})"),
-            "{\n  \"matches\": []\n}\n");
+  EXPECT_EQ(ok({"raw"}, R"({"request": "match", "version": 2, "flags": 1})"), "{\"matches\":[]}\n");
   Ran refused = drkit({"raw", R"({"request": "frobnicate", "version": 2})"});
   EXPECT_EQ(refused.status, 1);
-  EXPECT_EQ(refused.out, "{\n  \"error\": \"unrecognized request\",\n  \"errorcode\": 4\n}\n");
-  EXPECT_EQ(refused.err, "drkit: unrecognized request (drd error 4)\n");
+  EXPECT_EQ(refused.out, "{\"error\":\"unrecognized request\",\"errorcode\":4}\n");
+  EXPECT_EQ(refused.err, "drkit: unrecognized request (bad request, code 4)\n");
   for (const char* bad : {"{", "[1]", R"({"a": null})", R"({"u": {"$uuid": "nope"}})"}) {
     EXPECT_EQ(drkit({"raw", bad}).status, 2) << bad;
   }
@@ -321,7 +335,78 @@ TEST_F(DrkitTest, RawSendsAnyRequestAndStatusTellsWhetherDrdAnswers) {
   EXPECT_EQ(absent.status, 1);
   EXPECT_EQ(absent.out, "service: com.example.none\nsocket: " + socket +
                             "com.example.none\nstate: not answering\n");
-  EXPECT_NE(absent.err.find("No such file or directory"), std::string::npos) << absent.err;
+  EXPECT_NE(absent.err.find("No such file or directory\ndrkit: drd is not running; start it with "
+                            "'systemctl --user start drd.socket'"),
+            std::string::npos)
+      << absent.err;
+}
+
+// --json on every verb that prints: one line of JSON when piped, with the
+// fields the text shows.
+TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
+  const std::string a = makePlugIn("a");
+  ok({"add", a, makePlugIn("b")});
+  const std::string uuid = uuidOf("com.example.a");
+  ok({"annotate", "-i", "com.example.a", "color=red"});
+  ok({"exclude", "add", "-i", "com.example.b"});
+  const std::string access = ok({"access", uuid});
+  const std::string token = access.substr(0, access.find('\n'));
+
+  struct Row {
+    std::vector<std::string> args;
+    std::function<void(const Value&)> check;
+  };
+  const std::vector<Row> rows = {
+      {{"match", "--json"},
+       [&](const Value& v) {
+         ASSERT_EQ(v.size(), 1u);
+         EXPECT_EQ(v.at(0)["identifier"], Value("com.example.a"));
+         EXPECT_EQ(v.at(0)["uuid"], Value(uuid));
+       }},
+      {{"annotate", "-i", "com.example.a", "--json"},
+       [](const Value& v) {
+         EXPECT_EQ(v, (Value{{"color", "red"}}));
+       }},
+      {{"access", uuid, "--json"},
+       [&](const Value& v) {
+         EXPECT_EQ(v, Value(Array{Value{{"uuid", uuid}, {"token", token}}}));
+       }},
+      {{"extension", "consume", token, "--json"},
+       [&](const Value& v) {
+         EXPECT_EQ(v, (Value{{"path", a}}));
+       }},
+      {{"exclude", "list", "--json"},
+       [](const Value& v) {
+         EXPECT_EQ(v, Value(Array{Value{{"UXExtensionIdentifier", "com.example.b"}}}));
+       }},
+      {{"status", "--json"},
+       [&](const Value& v) {
+         EXPECT_EQ(v, (Value{{"service", "com.corvel.dromon.drd"},
+                             {"socket", root() + "/sockets/com.corvel.dromon.drd"},
+                             {"answering", true}}));
+       }},
+      {{"explain", "com.example.a", "--json"},
+       [&](const Value& v) {
+         EXPECT_EQ(v["registered"], Value(true));
+         ASSERT_EQ(v["plugins"].size(), 1u);
+         EXPECT_EQ(v["plugins"].at(0)["path"], Value(a));
+         EXPECT_EQ(v["plugins"].at(0)["discovery"], Value("returned"));
+         EXPECT_EQ(v["plugins"].at(0)["election"], Value("not chosen"));
+       }},
+      {{"raw", "--json", R"({"request": "match", "version": 2})"},
+       [](const Value& v) { EXPECT_EQ(v["matches"].size(), 1u); }},
+      // Standard input ends at once: the hold is placed, printed, released.
+      {{"hold", "--plugin", a, "--json"},
+       [](const Value& v) { EXPECT_TRUE(Uuid::parse(v["token"].stringValue())); }},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.args[0]);
+    const std::string out = ok(row.args);
+    EXPECT_EQ(out.find('\n'), out.size() - 1) << "not one line: " << out;
+    Result<Value> parsed = pdoc::Parse(out);
+    ASSERT_TRUE(parsed) << out;
+    row.check(*parsed);
+  }
 }
 
 TEST_F(DrkitTest, ExplainTellsTheFateOfEveryCopy) {
@@ -390,13 +475,14 @@ TEST_F(DrkitTest, HostExampleDiscoversAndReadiesAPlugIn) {
 TEST(DrkitProcessTest, UsageErrorsExit2AndHelpExits0) {
   TempFolder root;
   const std::vector<std::pair<std::vector<std::string>, std::string>> errors = {
-      {{}, "drkit: missing verb\n"},
-      {{"match", "-x"}, "drkit: match: unknown option '-x'\n"},
+      {{}, "drkit: missing verb\nTry 'drkit help'.\n"},
+      {{"-S", "x", "match", "-x"}, "drkit: match: unknown option '-x'\nTry 'drkit help match'.\n"},
+      {{"nothing"}, "drkit: unknown verb 'nothing'\nTry 'drkit help'.\n"},
   };
   for (const auto& [args, err] : errors) {
     Ran r = RunDrkit(root.path(), args);
     EXPECT_EQ(r.status, 2) << err;
-    EXPECT_EQ(r.err, err + "Try 'drkit --help'.\n");
+    EXPECT_EQ(r.err, err);
     EXPECT_EQ(r.out, "");
   }
   const std::vector<std::pair<std::vector<std::string>, std::string>> helps = {

@@ -27,6 +27,14 @@ TEST(UsageReportsTest, LineHasTheDocumentedLayoutAndEscapes) {
   EXPECT_TRUE(nlohmann::json::accept(UsageReportJson("d", 5, {{"k", "bad \xff byte"}})));
 }
 
+// Without a report file a report is a log line that says it is one.
+TEST(UsageReportsTest, WithoutAFileAReportIsAMarkedLogLine) {
+  ScopedLogCapture log;
+  MakeUsageReports({})->sendReport("d", 5, {{"k", "v"}});
+  EXPECT_EQ(log.lines(), std::vector<std::string>{
+                             R"(usage report: {"domain": "d", "level": 5, "keys": {"k": "v"}})"});
+}
+
 TEST(UsageReportsTest, ConcurrentProcessesNeverInterleaveLines) {
   TempFolder folder;
   UsageReportOptions options{folder / "usage.log"};

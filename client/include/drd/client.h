@@ -42,6 +42,10 @@ inline constexpr int64_t kErrorBadPath = 9;        // relative, unresolvable, or
 inline constexpr int64_t kErrorNotPermitted = 11;  // not permitted for this process
 inline constexpr int64_t kErrorBusy = 14;          // plug-ins are busy (hold refused)
 
+// A short name for one of drd's error codes ("bad path" for kErrorBadPath),
+// for messages beside drd's own text; nullptr for a code drd does not use.
+DRD_EXPORT const char* ErrorCodeName(int64_t code);
+
 // kClientErrorDomain: a reply without the keys its request promises.
 inline constexpr int64_t kUnexpectedReply = 4;
 
