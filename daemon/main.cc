@@ -15,6 +15,7 @@
 
 #include "core/log.h"
 #include "daemon/server.h"
+#include "platform/install_folders.h"
 #include "platform/locations.h"
 #include "platform/notifications.h"
 #include "platform/policy.h"
@@ -118,6 +119,13 @@ int main(int argc, char** argv) {
       dr::DRDServer::initForServiceDatabase(line->serviceName, line->annotationFile, options);
   if (!server) return Fail("unable to construct server");
   server->setVerbose(line->verbose);
+
+  // Reconciles the install folders off the service queue and then follows
+  // them; requests are answered from the registry as it stands meanwhile.
+  dr::InstallFolderOptions installOptions;
+  installOptions.folders = registryOptions->installFolders;
+  installOptions.registry = registry->get();
+  std::unique_ptr<dr::InstallFolders> installFolders = dr::InstallFolders::Start(installOptions);
 
   sd_notify(0, "READY=1");
   server->run();
