@@ -26,9 +26,7 @@
 
 #include <cerrno>
 #include <climits>
-#include <condition_variable>
 #include <map>
-#include <mutex>
 #include <set>
 #include <thread>
 
@@ -55,15 +53,21 @@ bool IsFolder(const std::string& path) {
   return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
 
-// The names in `folder` that end in `suffix`; an error text when it cannot
-// be read.
-Result<std::vector<std::string>> NamesIn(const std::string& folder, const char* suffix) {
+// One name in a folder, and whether it is a folder itself (not a link).
+struct Name {
+  std::string name;
+  bool plainFolder;
+};
+
+// The names in `folder` that end in `suffix`; an error when it cannot be
+// read.
+Result<std::vector<Name>> NamesIn(const std::string& folder, const char* suffix) {
   DIR* dir = ::opendir(folder.c_str());
   if (dir == nullptr) return PosixError(errno, "open");
-  std::vector<std::string> names;
+  std::vector<Name> names;
   while (dirent* e = ::readdir(dir)) {
     std::string name = e->d_name;
-    if (EndsWith(name, suffix)) names.push_back(std::move(name));
+    if (EndsWith(name, suffix)) names.push_back({std::move(name), e->d_type == DT_DIR});
   }
   ::closedir(dir);
   return names;
@@ -100,11 +104,6 @@ class LinuxInstallFolders final : public InstallFolders {
     return true;
   }
 
-  bool waitUntilReconciled(std::chrono::milliseconds timeout) override {
-    std::unique_lock<std::mutex> lock(mu_);
-    return reconciledCv_.wait_for(lock, timeout, [this] { return reconciled_; });
-  }
-
  private:
   enum class Unit { kFolder, kApp, kBundle };
   struct Folder {
@@ -129,13 +128,16 @@ class LinuxInstallFolders final : public InstallFolders {
   };
 
   void run() {
+    const auto started = Clock::now();
     for (size_t i = 0; i < folders_.size(); ++i) scanFolder(i);
     reconcileRegistry();
-    {
-      std::lock_guard<std::mutex> lock(mu_);
-      reconciled_ = true;
+    if (!folders_.empty()) {
+      o_.log(Format("install folders: %@ bundles in %@ folders reconciled in %@ ms",
+                    static_cast<int64_t>(known_.size()), static_cast<int64_t>(folders_.size()),
+                    static_cast<int64_t>(std::chrono::duration_cast<std::chrono::milliseconds>(
+                                             Clock::now() - started)
+                                             .count())));
     }
-    reconciledCv_.notify_all();
     if (inotify_ < 0 || stop_ < 0) return;
     for (;;) {
       int timeout = -1;
@@ -204,12 +206,15 @@ class LinuxInstallFolders final : public InstallFolders {
     f.readable = true;
     failed_.erase(f.path);
     addWatch(f.path, {Unit::kFolder, "", i});
+    // A bundle that is a plain folder lies at the folder's canonical path
+    // plus its name: only links need resolving, one lookup each.
+    const std::string canonical = CanonicalPath(f.path).value_or("");
     std::set<std::string> seen;
-    for (const std::string& name : *names) {
+    for (const auto& [name, plainFolder] : *names) {
       const std::string location = f.path + "/" + name;
       if (EndsWith(name, ".appex")) {
         seen.insert(location);
-        processBundle(location, i);
+        processBundle(location, i, plainFolder && !canonical.empty() ? canonical + "/" + name : "");
       } else if (EndsWith(name, ".app")) {
         seen.insert(location);
         scanApp(location, i);
@@ -237,19 +242,24 @@ class LinuxInstallFolders final : public InstallFolders {
                        plugIns, names.error()));
         return;
       }
-      for (const std::string& name : *names) {
+      const std::string canonical = CanonicalPath(plugIns).value_or("");
+      for (const auto& [name, plainFolder] : *names) {
         seen.insert(plugIns + "/" + name);
-        processBundle(plugIns + "/" + name, i);
+        processBundle(plugIns + "/" + name, i,
+                      plainFolder && !canonical.empty() ? canonical + "/" + name : "");
       }
     }
     forgetUnder(plugIns + "/", &seen);
   }
 
-  void processBundle(const std::string& location, size_t i) {
+  // `known`: the canonical path of a bundle that is a plain folder, when
+  // the scan knows it; "" to resolve `location`.
+  void processBundle(const std::string& location, size_t i, const std::string& known = "") {
     const std::string& folder = folders_[i].path;
-    auto canonical = CanonicalPath(location);
+    auto canonical = known.empty() ? CanonicalPath(location) : Result<std::string>(known);
     if (!canonical) {
-      if (errno == ENOENT) {
+      const auto code = canonical.error().code();
+      if (canonical.error().domain() == kPosixErrorDomain && (code == ENOENT || code == ENOTDIR)) {
         gone(location);
         return;
       }
@@ -260,7 +270,7 @@ class LinuxInstallFolders final : public InstallFolders {
                      canonical.error()));
       return;
     }
-    if (!IsFolder(*canonical)) {
+    if (known.empty() && !IsFolder(*canonical)) {
       gone(location);
       return;
     }
@@ -514,10 +524,7 @@ class LinuxInstallFolders final : public InstallFolders {
   // The last failure logged per location or folder: the stamp of its files
   // then, and the line.
   std::map<std::string, std::pair<std::string, std::string>> failed_;
-  std::mutex mu_;
-  std::condition_variable reconciledCv_;
-  bool reconciled_ = false;  // guarded by mu_
-  std::thread thread_;       // last: started once the rest is built
+  std::thread thread_;  // last: started once the rest is built
 };
 
 }  // namespace

@@ -8,8 +8,8 @@
 // the canonical path of the bundle it points to.
 //
 // At start the folders are reconciled with the registry (an unchanged bundle
-// costs a few stat calls); then inotify watches each folder, each installed
-// application's Contents/PlugIns/ and each bundle's Contents/, and a change
+// costs a few stat calls; the end is logged with the time it took); then inotify watches each
+// folder, each installed application's Contents/PlugIns/ and each bundle's Contents/, and a change
 // takes effect once the bundle has been quiet for `settle`. A folder that
 // does not exist yet is picked up when it appears.
 //
@@ -46,11 +46,8 @@ class InstallFolders {
   // Starts the watcher thread, which reconciles the folders first and then
   // follows their changes until the object is destroyed.
   static std::unique_ptr<InstallFolders> Start(InstallFolderOptions options);
+  // Stops the watcher: a scan under way ends first.
   virtual ~InstallFolders() = default;
-
-  // Waits until the reconcile at start is done; false when `timeout` passed
-  // first. For tests and benchmarks.
-  virtual bool waitUntilReconciled(std::chrono::milliseconds timeout) = 0;
 };
 
 }  // namespace dr

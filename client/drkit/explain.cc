@@ -9,6 +9,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <map>
 #include <mutex>
 
@@ -200,8 +201,25 @@ int RunExplain(const Invocation& inv, Io& io) {
   if (inv.rules.isPresent()) io.out << "rules: " << ToJson(inv.rules, false) << "\n";
   if (inv.flags) io.out << "flags: 0x" << std::hex << inv.flags << std::dec << "\n";
   int status = 0;
-  if (wanted.empty()) {
+  // An installed bundle the user removed is not registered, but known.
+  std::vector<RemovedBundle> removed;
+  for (RemovedBundle& r : (*registry)->removedBundles()) {
+    const auto& ids = r.plugInIdentifiers;
+    if (byPath ? r.path == targetPath : std::find(ids.begin(), ids.end(), target) != ids.end()) {
+      removed.push_back(std::move(r));
+    }
+  }
+  if (wanted.empty() && removed.empty()) {
     io.out << target << ": not registered\n";
+    status = 1;
+  }
+  for (const RemovedBundle& r : removed) {
+    io.out << target << ": not registered: removed by the user on "
+           << FormatTime(static_cast<int64_t>(r.removed.seconds)) << "\n"
+           << "    path: " << r.path << "\n"
+           << "    install folder: " << r.installFolder << "\n"
+           << "    it comes back when its files change, or when it leaves the install folder "
+              "and comes back\n";
     status = 1;
   }
   for (const RegistryEntryPtr& entry : wanted) {
@@ -213,6 +231,7 @@ int RunExplain(const Invocation& inv, Io& io) {
            << "    path: " << entry->url() << "\n"
            << "    registered: "
            << FormatTime(static_cast<int64_t>(entry->registrationDate().seconds)) << "\n";
+    if (entry->installFolder()) io.out << "    install folder: " << *entry->installFolder() << "\n";
     if (!verdict) {
       io.out << "    discovery: never offered: drd cannot make a record of it\n";
       continue;
