@@ -80,6 +80,11 @@ int main(int argc, char** argv) {
   signal(SIGPIPE, SIG_IGN);
 
   dr::Result<dr::RegistryOptions> registryOptions = dr::RegistryOptionsFromEnvironment();
+  // The install folders are scanned while the registry opens, and
+  // reconciled with it off the service queue once the server follows it.
+  dr::InstallFolderOptions installOptions;
+  if (registryOptions) installOptions.folders = registryOptions->installFolders;
+  std::unique_ptr<dr::InstallFolders> installFolders = dr::InstallFolders::Start(installOptions);
   dr::Result<std::unique_ptr<dr::Registry>> registry =
       registryOptions ? dr::Registry::Open(*registryOptions)
                       : dr::Result<std::unique_ptr<dr::Registry>>(registryOptions.error());
@@ -120,12 +125,7 @@ int main(int argc, char** argv) {
   if (!server) return Fail("unable to construct server");
   server->setVerbose(line->verbose);
 
-  // Reconciles the install folders off the service queue and then follows
-  // them; requests are answered from the registry as it stands meanwhile.
-  dr::InstallFolderOptions installOptions;
-  installOptions.folders = registryOptions->installFolders;
-  installOptions.registry = registry->get();
-  std::unique_ptr<dr::InstallFolders> installFolders = dr::InstallFolders::Start(installOptions);
+  if (installFolders) installFolders->attach(registry->get());
 
   sd_notify(0, "READY=1");
   server->run();

@@ -26,7 +26,9 @@
 
 #include <cerrno>
 #include <climits>
+#include <condition_variable>
 #include <map>
+#include <mutex>
 #include <set>
 #include <thread>
 
@@ -81,6 +83,11 @@ class LinuxInstallFolders final : public InstallFolders {
   }
 
   ~LinuxInstallFolders() override {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      stopping_ = true;
+    }
+    attached_.notify_all();
     if (stop_ >= 0) {
       uint64_t one = 1;
       (void)!::write(stop_, &one, sizeof one);
@@ -88,6 +95,14 @@ class LinuxInstallFolders final : public InstallFolders {
     if (thread_.joinable()) thread_.join();
     if (inotify_ >= 0) ::close(inotify_);
     if (stop_ >= 0) ::close(stop_);
+  }
+
+  void attach(Registry* registry) override {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      attachedRegistry_ = registry;
+    }
+    attached_.notify_all();
   }
 
   bool start() {
@@ -126,10 +141,23 @@ class LinuxInstallFolders final : public InstallFolders {
     std::string canonical;
     size_t folder;
   };
+  struct Found {
+    std::string location, canonical;
+    size_t folder;
+    std::string stamp;
+  };
 
   void run() {
     const auto started = Clock::now();
     for (size_t i = 0; i < folders_.size(); ++i) scanFolder(i);
+    {
+      std::unique_lock<std::mutex> lock(mu_);
+      attached_.wait(lock, [this] { return attachedRegistry_ != nullptr || stopping_; });
+      if (stopping_) return;
+      registry_ = attachedRegistry_;
+    }
+    for (const Found& f : found_) registerFound(f.location, f.canonical, f.folder, f.stamp);
+    found_.clear();
     reconcileRegistry();
     if (!folders_.empty()) {
       o_.log(Format("install folders: %@ bundles in %@ folders reconciled in %@ ms",
@@ -163,12 +191,12 @@ class LinuxInstallFolders final : public InstallFolders {
   void reconcileRegistry() {
     std::set<std::string> found;
     for (const auto& [location, known] : known_) found.insert(known.canonical);
-    for (const InstalledBundle& b : o_.registry->installedBundles()) {
+    for (const InstalledBundle& b : registry_->installedBundles()) {
       if (found.count(b.path) != 0) continue;
       bool keep = false;
       for (const Folder& f : folders_) keep |= !f.readable && f.path == b.installFolder;
       if (keep) continue;
-      if (Status s = o_.registry->unregisterInstalledBundle(b.path); !s) {
+      if (Status s = registry_->unregisterInstalledBundle(b.path); !s) {
         o_.log(Format("install folder \"%@\": %@", b.installFolder, s));
       }
     }
@@ -278,14 +306,29 @@ class LinuxInstallFolders final : public InstallFolders {
       gone(location);  // the link now points elsewhere
     }
     known_[location] = {*canonical, i};
-    const std::string contents = *canonical + "/Contents";
-    addWatch(IsFolder(contents) ? contents : *canonical, {Unit::kBundle, location, i});
+    // Contents/ when there is one (tried directly: one call for the usual
+    // case), else the bundle folder, to see Contents/ being made.
+    if (!addWatch(*canonical + "/Contents", {Unit::kBundle, location, i}, /*mayBeMissing=*/true)) {
+      addWatch(*canonical, {Unit::kBundle, location, i});
+    }
 
     const std::string stamp = BundleFileStamp(*canonical);
     if (auto it = failed_.find(location); it != failed_.end() && it->second.first == stamp) {
       return;  // the same files failed before; logged then
     }
-    Result<InstallOutcome> outcome = o_.registry->registerInstalledBundle(*canonical, folder);
+    if (registry_ == nullptr) {
+      // The first scan runs while the registry is being opened; what it
+      // found is registered once the registry is there.
+      found_.push_back({location, *canonical, i, stamp});
+      return;
+    }
+    registerFound(location, *canonical, i, stamp);
+  }
+
+  void registerFound(const std::string& location, const std::string& canonical, size_t i,
+                     const std::string& stamp) {
+    const std::string& folder = folders_[i].path;
+    Result<InstallOutcome> outcome = registry_->registerInstalledBundle(canonical, folder, stamp);
     if (outcome) {
       failed_.erase(location);
       return;
@@ -310,7 +353,11 @@ class LinuxInstallFolders final : public InstallFolders {
     for (const auto& [other, k] : known_) {
       if (k.canonical == known.canonical) return;  // still installed through another link
     }
-    if (Status s = o_.registry->unregisterInstalledBundle(known.canonical); !s) {
+    if (registry_ == nullptr) {
+      std::erase_if(found_, [&](const Found& f) { return f.location == location; });
+      return;
+    }
+    if (Status s = registry_->unregisterInstalledBundle(known.canonical); !s) {
       o_.log(Format("install folder \"%@\": %@", folders_[known.folder].path, s));
     }
   }
@@ -331,24 +378,28 @@ class LinuxInstallFolders final : public InstallFolders {
 
   // ---- inotify -------------------------------------------------------------
 
-  void addWatch(const std::string& path, Watch watch) {
-    if (inotify_ < 0) return;
+  // False when `path` cannot be watched (logged, unless `mayBeMissing` and
+  // it is not there).
+  bool addWatch(const std::string& path, Watch watch, bool mayBeMissing = false) {
+    if (inotify_ < 0) return true;
     int wd = ::inotify_add_watch(inotify_, path.c_str(), kFolderEvents);
     if (wd < 0) {
+      if (mayBeMissing && (errno == ENOENT || errno == ENOTDIR)) return false;
       logOnce(path, "",
               Format("install folders: cannot watch \"%@\": %@%@", path,
                      PosixError(errno, "inotify_add_watch"),
                      errno == ENOSPC ? " (raise fs.inotify.max_user_watches)" : ""));
-      return;
+      return false;
     }
     if (!watch.key.empty()) byKey_[watch.key].insert(wd);
     // One inode may be watched for several units (a folder that is the
     // parent of another, missing, one).
     auto& units = watches_[wd];
     for (const Watch& u : units) {
-      if (u.unit == watch.unit && u.key == watch.key && u.ancestor == watch.ancestor) return;
+      if (u.unit == watch.unit && u.key == watch.key && u.ancestor == watch.ancestor) return true;
     }
     units.push_back(std::move(watch));
+    return true;
   }
 
   void removeWatches(const std::string& key) {
@@ -524,7 +575,13 @@ class LinuxInstallFolders final : public InstallFolders {
   // The last failure logged per location or folder: the stamp of its files
   // then, and the line.
   std::map<std::string, std::pair<std::string, std::string>> failed_;
-  std::thread thread_;  // last: started once the rest is built
+  Registry* registry_ = nullptr;  // once attached; the watcher thread's
+  std::vector<Found> found_;      // by the first scan, before the registry came
+  std::mutex mu_;
+  std::condition_variable attached_;
+  Registry* attachedRegistry_ = nullptr;  // guarded by mu_
+  bool stopping_ = false;                 // guarded by mu_
+  std::thread thread_;                    // last: started once the rest is built
 };
 
 }  // namespace

@@ -33,8 +33,6 @@ struct InstallFolderOptions {
   // Lexically normal absolute folders, in order (RegistryOptions'
   // installFolders); none: the watcher does nothing.
   std::vector<std::string> folders;
-  // Required; must outlive the watcher.
-  Registry* registry = nullptr;
   // How long a bundle must be quiet before a change to it is acted on.
   std::chrono::milliseconds settle{500};
   // Receives each log line; null: the system log.
@@ -43,9 +41,14 @@ struct InstallFolderOptions {
 
 class InstallFolders {
  public:
-  // Starts the watcher thread, which reconciles the folders first and then
-  // follows their changes until the object is destroyed.
+  // Starts the watcher thread. It scans the folders at once, and once a
+  // registry is attached reconciles it with them and then follows their
+  // changes until the object is destroyed. Scanning while the registry is
+  // being opened hides most of the cost of a start.
   static std::unique_ptr<InstallFolders> Start(InstallFolderOptions options);
+  // The registry to keep in step (must outlive the watcher); its observers
+  // should be subscribed first, so that they see the reconcile's changes.
+  virtual void attach(Registry* registry) = 0;
   // Stops the watcher: a scan under way ends first.
   virtual ~InstallFolders() = default;
 };

@@ -260,11 +260,13 @@ class Registry {
   virtual std::vector<RemovedBundle> removedBundles() const = 0;
 
   // Registers the bundle at canonical `path`, found in `installFolder`, as
-  // "add" does, unless its stamp shows files already registered from there
-  // (kUnchanged: nothing is read) or files the user removed
-  // (kRemovedByUser). Errors as registerBundle's.
+  // "add" does, unless `stamp` (BundleFileStamp(path), taken by the caller
+  // before) shows files already registered from there (kUnchanged: nothing
+  // is read) or files the user removed (kRemovedByUser). Errors as
+  // registerBundle's.
   virtual Result<InstallOutcome> registerInstalledBundle(const std::string& path,
-                                                         const std::string& installFolder) = 0;
+                                                         const std::string& installFolder,
+                                                         const std::string& stamp) = 0;
   // The bundle at canonical `path` left its install folder: its entries are
   // unregistered when they came from an install folder (an uninstall event),
   // and a removal by the user is forgotten. OK also when there was nothing

@@ -153,8 +153,8 @@ class SqliteRegistry final : public Registry {
   }
 
   Result<InstallOutcome> registerInstalledBundle(const std::string& path,
-                                                 const std::string& installFolder) override {
-    const std::string stamp = BundleFileStamp(path);
+                                                 const std::string& installFolder,
+                                                 const std::string& stamp) override {
     if (!stamp.empty()) {
       // Unchanged files cost these two stat calls and no read.
       std::shared_lock<std::shared_mutex> lock(indexMu_);
