@@ -29,6 +29,9 @@
 //   W7 64 clients each sending 2,000 mixed requests, alone and then beside
 //      hostile peers (malformed frames, a peer that never reads, a
 //      connect/disconnect loop) in another process; drd's memory afterwards
+//   W4 also: the same 10,000 found in an install folder, reconciled at start
+//   W8 1,000 bundles dropped into an install folder at once: time until all
+//      are registered, and another client's latency meanwhile
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/prctl.h>
@@ -889,6 +892,49 @@ int Main(int argc, char** argv) {
                       Latency(median), "", "", "< 300 ms", Verdict(judged, median < 300000)});
       rows.push_back(
           {"", "drd CPU until that reply (mean)", Latency(cold.cpuMicros), "", "", "", ""});
+
+      // The same bundles found in an install folder instead: each start
+      // reconciles the folder (a few stat calls per unchanged bundle) beside
+      // serving. Timed to the later of the first reply and the reconcile's
+      // end.
+      log("W4 with the install folder");
+      Drd installed(o.drd, root.path() + "/drd-installed", sdk);
+      installed.pluginPath = root.path() + "/apps-big";
+      auto reconciled = [&](int count, Clock::time_point started) {
+        while (installed.reconciles() < count) {
+          if (Micros(started, Clock::now()) > 60e6) Die("W4: the reconcile took over 60 s");
+          std::this_thread::sleep_for(std::chrono::microseconds(500));
+        }
+      };
+      reconciled(0, installed.start());
+      reconciled(1, Clock::now());  // the first start registers them all
+      installed.stop();
+      Samples withFolder;
+      for (int run = 0; run < z.w4Runs; ++run) {
+        const Clock::time_point started = installed.start();
+        std::unique_ptr<Connection> conn;
+        while (!conn) {
+          auto attempt = Connection::Open(kServiceName, installed.socketFolder());
+          if (attempt) {
+            conn = std::move(attempt).value();
+          } else {
+            std::this_thread::sleep_for(std::chrono::microseconds(200));
+          }
+          if (Micros(started, Clock::now()) > 30e6) Die("W4: drd did not serve within 30 s");
+        }
+        check(Ask(*conn, MatchPoint(run % z.w2Points), "match"));
+        reconciled(run + 2, started);
+        withFolder.add(Micros(started, Clock::now()));
+        conn.reset();
+        installed.stop();
+      }
+      const double ratio = withFolder.quantile(0.5) / median;
+      rows.push_back({"",
+                      "the same " + std::to_string(total) +
+                          " in an install folder, reconciled: start → first reply and "
+                          "reconcile done, median",
+                      Latency(withFolder.quantile(0.5)), "", "", "≤ 1.1× the above",
+                      Verdict(judged, ratio <= 1.1) + " (" + Fixed(ratio, 2) + "×)"});
     }
     rows.push_back({"W5 memory (VmHWM)",
                     std::to_string(total) + " registered, after registering + W2", Mib(bigPeakKiB),
@@ -907,6 +953,59 @@ int Main(int argc, char** argv) {
                     Mib(smallPeakKiB), "", "", "< 64 MiB",
                     Verdict(judged, smallPeakKiB < 64 * 1024)});
   }
+  // ---- W8: a package manager drops bundles into an install folder ----------
+  if (o.runs("W8")) {
+    const int apps = o.smoke ? 2 : 10;
+    const int dropped = o.smoke ? 6 : 1000;
+    log("W8: making " + std::to_string(dropped) + " bundles");
+    MakeBundles(root.path() + "/staging", sdk, apps, 1, dropped);
+    const std::string folder = root.path() + "/drop";
+    std::filesystem::create_directories(folder);
+    Drd d(o.drd, root.path() + "/drd-drop", sdk);
+    d.pluginPath = folder;
+    d.start();
+    d.waitUntilServing();
+    auto asker = Open(d.socketFolder());
+    auto counter = Open(d.socketFolder());
+    std::atomic<bool> done{false};
+    double registeredMicros = 0;
+    log("W8");
+    const Clock::time_point t0 = Clock::now();
+    for (int a = 0; a < apps; ++a) {
+      const std::string name = "/App" + std::to_string(a) + ".app";
+      std::filesystem::rename(root.path() + "/staging" + name, folder + name);
+    }
+    std::thread count([&] {
+      while (Micros(t0, Clock::now()) < 30e6) {
+        if (static_cast<int>(Ask(*counter, MatchPoint(0), "match")["matches"].size()) == dropped) {
+          registeredMicros = Micros(t0, Clock::now());
+          break;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+      }
+      done = true;
+    });
+    // Another client meanwhile: a "match" that finds nothing but still
+    // walks every registered plug-in.
+    Samples meanwhile;
+    while (!done) {
+      const Clock::time_point t = Clock::now();
+      Ask(*asker, MatchPoint(1), "match");
+      meanwhile.add(Micros(t, Clock::now()));
+    }
+    count.join();
+    if (registeredMicros == 0) Die("W8: the dropped bundles were not all registered within 30 s");
+    rows.push_back({"W8 install folder",
+                    std::to_string(dropped) + " bundles dropped in at once → all registered",
+                    Latency(registeredMicros), "", "", "< 5 s",
+                    Verdict(judged, registeredMicros < 5e6)});
+    rows.push_back(
+        {"",
+         "another client's \"match\" meanwhile, p99 of " + std::to_string(meanwhile.micros.size()),
+         Latency(meanwhile.quantile(0.99)), "", "", "< 50 ms",
+         Verdict(judged, meanwhile.quantile(0.99) < 50000)});
+    d.stop();
+  }
   if (addRate > 0) {
     rows.push_back(
         {"setup", "\"add\" registration, 100 paths a request", Rate(addRate), "", "", "", ""});
@@ -922,7 +1021,8 @@ int Main(int argc, char** argv) {
       " requests over " + std::to_string(z.w2Points) + " points × " + std::to_string(z.w2PerPoint) +
       " in " + std::to_string(z.w2Apps) + " apps; W3 " + std::to_string(z.w3Requests) +
       " requests; W4 " + std::to_string(z.w4Runs) + " starts; W6 " + std::to_string(z.w6Requests) +
-      " requests; W7 " + std::to_string(z.w7Clients) + " × " + std::to_string(z.w7Requests) +
+      " requests; W8 " + std::to_string(o.smoke ? 6 : 1000) + " bundles; W7 " +
+      std::to_string(z.w7Clients) + " × " + std::to_string(z.w7Requests) +
       " requests twice; W1-W6 each in " + std::to_string(z.rounds) +
       " rounds alternating with the floor and D-Bus";
   // The workloads in their order (the 1,000-plug-in drd ran W1, W3 and W6

@@ -89,6 +89,11 @@ class Drd {
 
   pid_t pid() const { return pid_; }
   const std::string& home() const { return home_; }
+  // Its install folders (DR_PLUGIN_PATH): none unless set.
+  std::string pluginPath;
+  // How many times drd has logged the end of its install folders'
+  // reconcile so far (in all its runs).
+  int reconciles() const;
   std::string socketFolder() const { return home_ + "/sockets"; }
   std::string annotationFile() const { return home_ + "/state/com.corvel.dromon/Annotations"; }
   // VmHWM and VmRSS of the running drd, in KiB (0 when unreadable).

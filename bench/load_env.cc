@@ -139,6 +139,8 @@ Clock::time_point Drd::start() {
       "DR_USAGE_LOG=" + home_ + "/usage.log",
       "DR_SDK_PATH=" + sdkFolder_,
       "HOME=" + home_,
+      // Nothing installed on the machine joins in.
+      "DR_PLUGIN_PATH=" + pluginPath,
   };
   const std::string log = home_ + "/drd.log";
   std::vector<char*> argv{binary_.data(), nullptr};
@@ -218,6 +220,14 @@ double Drd::cpuSeconds() const {
     if (in >> run) ns += run;
   }
   return ns / 1e9;
+}
+
+int Drd::reconciles() const {
+  std::ifstream in(home_ + "/drd.log");
+  std::string line;
+  int n = 0;
+  while (std::getline(in, line)) n += line.find(" reconciled in ") != std::string::npos;
+  return n;
 }
 
 long Drd::peakResidentKiB() const { return statusField("VmHWM"); }

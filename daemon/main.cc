@@ -23,6 +23,7 @@
 #include "core/log.h"
 #include "daemon/command_line.h"
 #include "daemon/server.h"
+#include "platform/install_folders.h"
 #include "platform/locations.h"
 #include "platform/notifications.h"
 #include "platform/policy.h"
@@ -142,6 +143,11 @@ int main(int argc, char** argv) {
   const bool activated = sd_listen_fds(0) > 0;
 
   dr::Result<dr::RegistryOptions> registryOptions = dr::RegistryOptionsFromEnvironment();
+  // The install folders are scanned while the registry opens, and
+  // reconciled with it off the service queue once the server follows it.
+  dr::InstallFolderOptions installOptions;
+  if (registryOptions) installOptions.folders = registryOptions->installFolders;
+  std::unique_ptr<dr::InstallFolders> installFolders = dr::InstallFolders::Start(installOptions);
   dr::Result<std::unique_ptr<dr::Registry>> registry =
       registryOptions ? dr::Registry::Open(*registryOptions)
                       : dr::Result<std::unique_ptr<dr::Registry>>(registryOptions.error());
@@ -185,6 +191,8 @@ int main(int argc, char** argv) {
   const std::string socketPath = server->service()->path();
   struct stat bound {};
   const bool ownsSocket = !activated && ::lstat(socketPath.c_str(), &bound) == 0;
+
+  if (installFolders) installFolders->attach(registry->get());
 
   dr::SystemLogAt(dr::LogPriority::kInfo, "drd %s listening on %@ (registry %@)", DRD_VERSION,
                   socketPath, registryOptions->databasePath);

@@ -109,6 +109,9 @@ class RegistryEntry {
     std::optional<RegistryApplication> containingApplication;
     std::optional<std::string> displayName;  // "BNBundleDisplayName", else "BNBundleName"
     std::optional<std::string> shortName;    // "BNBundleShortName"
+    // The install folder the bundle was found in (or "add"-ed from);
+    // nothing for a bundle "add"-ed from anywhere else.
+    std::optional<std::string> installFolder;
   };
 
   RegistryEntry(Fields fields, std::shared_ptr<const RegistryBundleFiles> files);
@@ -126,6 +129,7 @@ class RegistryEntry {
   }
   const std::optional<std::string>& displayName() const { return f_.displayName; }
   const std::optional<std::string>& shortName() const { return f_.shortName; }
+  const std::optional<std::string>& installFolder() const { return f_.installFolder; }
 
   // The bundle's information dictionary (parsed on first use).
   const Value& infoDictionary() const { return files_->infoDictionary(); }
@@ -160,6 +164,37 @@ class RegistryObserver {
   virtual void pluginsDidUninstall(const RegistryEntries& entries) = 0;
 };
 
+// An installed bundle the user removed: it stays unregistered until its
+// files change (another stamp) or it leaves its install folder.
+struct RemovedBundle {
+  std::string path;                            // canonical path of the bundle
+  std::string installFolder;                   // the install folder it lies in
+  std::string stamp;                           // BundleFileStamp of its files when removed
+  std::vector<std::string> plugInIdentifiers;  // of its entries when removed
+  Date removed;
+};
+
+// What the registry knows of a bundle that came from an install folder.
+struct InstalledBundle {
+  std::string path;  // canonical
+  std::string installFolder;
+  std::string stamp;  // of the registered files, or of the removed ones
+  bool removedByUser = false;
+};
+
+// The stamp of a bundle's files: size, modification time and inode of
+// Contents/Info.pdoc and Contents/Entitlements.pdoc, as text. Two stat calls,
+// no read: equal stamps mean files the registry need not read again. Empty
+// when Info.pdoc cannot be stat-ed.
+std::string BundleFileStamp(const std::string& path);
+
+// How registerInstalledBundle ended.
+enum class InstallOutcome {
+  kRegistered,     // new entries (an install event, after an uninstall one for old ones)
+  kUnchanged,      // the registered files are the ones there: nothing happened
+  kRemovedByUser,  // the user removed these very files: nothing happened
+};
+
 struct RegistryOptions {
   // The database file. Its folder is created (0700) when missing; a new
   // database file is made 0600.
@@ -172,13 +207,20 @@ struct RegistryOptions {
   // How long to wait for a database held by another process before failing
   // with kRegistryBusy.
   std::chrono::milliseconds busyTimeout{5000};
+  // The install folders: a bundle registered by "add" whose canonical path
+  // is an installed place in one of them (directly inside it, or a
+  // "*.appex" directly in Contents/PlugIns/ of a "*.app" directly inside
+  // it) takes that folder as its origin.
+  std::vector<std::string> installFolders;
 };
 
 // The options from the environment: DR_REGISTRY, else
 // $XDG_DATA_HOME/dromon/registry.sqlite3 (XDG_DATA_HOME defaulting to
 // $HOME/.local/share); DR_SYSTEM_ROOTS (colon-separated; unset or empty means
-// /usr). Relative folders are ignored, as XDG asks. Fails when no location can
-// be made (no HOME and no XDG_DATA_HOME).
+// /usr); DR_PLUGIN_PATH (colon-separated install folders; set but empty
+// means none; unset means $XDG_DATA_HOME/dromon/PlugIns, then dromon/PlugIns
+// in each $XDG_DATA_DIRS folder). Relative folders are ignored, as XDG asks. Fails when no location
+// can be made (no HOME and no XDG_DATA_HOME).
 Result<RegistryOptions> RegistryOptionsFromEnvironment(
     const std::function<const char*(const char*)>& getenv = nullptr);
 
@@ -221,6 +263,31 @@ class Registry {
   // Removes every entry of the bundle at `url` (the bundle need not exist any
   // more). Errors: kRegistryNotRegistered, kRegistryBusy, kRegistryStorage.
   virtual Status unregisterBundle(const std::string& url) = 0;
+
+  // ---- Install folders -------------------------------------------------
+  // "remove" (unregisterBundle) of a bundle that came from an install folder
+  // also remembers it as removed by the user, across restarts; "add"
+  // (registerBundle) forgets that again.
+
+  // Every bundle that came from an install folder, registered or removed by
+  // the user, in no particular order.
+  virtual std::vector<InstalledBundle> installedBundles() const = 0;
+  // The installed bundles the user removed, in no particular order.
+  virtual std::vector<RemovedBundle> removedBundles() const = 0;
+
+  // Registers the bundle at canonical `path`, found in `installFolder`, as
+  // "add" does, unless `stamp` (BundleFileStamp(path), taken by the caller
+  // before) shows files already registered from there (kUnchanged: nothing
+  // is read) or files the user removed (kRemovedByUser). Errors as
+  // registerBundle's.
+  virtual Result<InstallOutcome> registerInstalledBundle(const std::string& path,
+                                                         const std::string& installFolder,
+                                                         const std::string& stamp) = 0;
+  // The bundle at canonical `path` left its install folder: its entries are
+  // unregistered when they came from an install folder (an uninstall event),
+  // and a removal by the user is forgotten. OK also when there was nothing
+  // to do. Errors: kRegistryBusy, kRegistryStorage.
+  virtual Status unregisterInstalledBundle(const std::string& path) = 0;
 };
 
 }  // namespace dr

@@ -5,6 +5,9 @@
 //           app_path, app_name, parsed)               one row per registered bundle
 //   plugins(uuid PRIMARY KEY, bundle_id -> bundles.id, identifier, multiple)
 //                                                     one row per plug-in
+//   removed(path PRIMARY KEY, origin, stamp, identifiers, removed)
+//                                                     installed bundles the
+//                                                     user removed
 //
 // The information and entitlements dictionaries are stored as the bytes read
 // from the bundle, not re-encoded: the same bytes are what the content hash
@@ -19,6 +22,15 @@
 // copy that is missing (NULL), damaged or made from other bytes is ignored
 // and the bytes are parsed when an entry's dictionaries are first used; the
 // bytes stay the store of record.
+//
+// "origin" and "stamp" (since version 3) say which install folder a bundle
+// came from (NULL: "add"-ed from elsewhere) and the size, modification time
+// and inode of its files when registered, so that the install folders are
+// reconciled at start with a few stat calls per bundle and no parse. A NULL
+// stamp never matches, so rows of older versions are read once more.
+// "removed" keeps the installed bundles the user removed, with the stamp of
+// their files then: they stay away until the stamp changes or they leave.
+// "identifiers" are their plug-ins', newline-separated, for explaining.
 //
 // The schema is versioned by PRAGMA user_version; kMigrations[v] takes a
 // database from version v to v + 1, each step in its own transaction, so a
@@ -79,6 +91,19 @@ CREATE INDEX plugins_by_bundle ON plugins(bundle_id);
     // 1 -> 2: the parsed copy of each bundle's files, made for the rows there
     // are, so that the next open already decodes them.
     {"ALTER TABLE bundles ADD COLUMN parsed BLOB;", true},
+    // 2 -> 3: install folders.
+    {R"sql(
+ALTER TABLE bundles ADD COLUMN origin TEXT;
+ALTER TABLE bundles ADD COLUMN stamp TEXT;
+CREATE TABLE removed (
+  path TEXT PRIMARY KEY,
+  origin TEXT NOT NULL,
+  stamp TEXT NOT NULL,
+  identifiers TEXT NOT NULL,
+  removed REAL NOT NULL
+);
+)sql",
+     false},
 };
 constexpr int kSchemaVersion = static_cast<int>(std::size(kMigrations));
 
@@ -156,7 +181,7 @@ RegistryDatabase::RegistryDatabase(std::string path, sqlite3* db)
 
 RegistryDatabase::~RegistryDatabase() {
   for (auto* s : {&begin_, &commit_, &rollback_, &deletePlugIns_, &deleteBundle_, &insertBundle_,
-                  &insertPlugIn_}) {
+                  &insertPlugIn_, &forgetRemoved_, &rememberRemoved_, &updateOrigin_}) {
     s->reset();
   }
   sqlite3_close_v2(db_);  // the last connection checkpoints and removes the WAL file
@@ -365,9 +390,15 @@ Status RegistryDatabase::prepareAll() {
       {&insertBundle_,
        "INSERT INTO bundles (path, content_hash, info, entitlements, bundle_identifier, "
        "bundle_version, display_name, short_name, registered, system_volume, app_path, app_name, "
-       "parsed) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13)"},
+       "parsed, origin, stamp) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13, "
+       "?14, ?15)"},
       {&insertPlugIn_,
        "INSERT INTO plugins (uuid, bundle_id, identifier, multiple) VALUES (?1, ?2, ?3, ?4)"},
+      {&forgetRemoved_, "DELETE FROM removed WHERE path = ?1"},
+      {&rememberRemoved_,
+       "INSERT OR REPLACE INTO removed (path, origin, stamp, identifiers, removed) "
+       "VALUES (?1, ?2, ?3, ?4, ?5)"},
+      {&updateOrigin_, "UPDATE bundles SET origin = ?2, stamp = ?3 WHERE path = ?1"},
   };
   for (const auto& [slot, sql] : statements) {
     sqlite3_stmt* raw = nullptr;
@@ -441,8 +472,8 @@ Result<std::vector<BundleRow>> RegistryDatabase::loadAll() {
   rc = sqlite3_prepare_v2(db_,
                           "SELECT id, path, content_hash, info, entitlements, "
                           "bundle_identifier, bundle_version, display_name, short_name, "
-                          "registered, system_volume, app_path, app_name, parsed "
-                          "FROM bundles ORDER BY id",
+                          "registered, system_volume, app_path, app_name, parsed, origin, "
+                          "stamp FROM bundles ORDER BY id",
                           -1, &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
   {
@@ -477,6 +508,8 @@ Result<std::vector<BundleRow>> RegistryDatabase::loadAll() {
       if (auto app = ColumnText(raw, 11)) {
         b.containingApplication = RegistryApplication{*app, ColumnText(raw, 12)};
       }
+      row.origin = ColumnText(raw, 14);
+      row.stamp = ColumnText(raw, 15).value_or("");
       indexOf[row.id] = rows.size();
       rows.push_back(std::move(row));
     }
@@ -549,6 +582,9 @@ Status RegistryDatabase::runChange(const std::string& removePath, BundleRow* ins
   } else {
     sqlite3_bind_null(s, 13);
   }
+  BindOptionalText(s, 14, insert->origin);
+  sqlite3_bind_text(s, 15, insert->stamp.data(), static_cast<int>(insert->stamp.size()),
+                    SQLITE_STATIC);
   if (int rc = insertBundle_->run(); rc != SQLITE_DONE) {
     return errorOf(rc, "cannot store a bundle");
   }
@@ -567,9 +603,85 @@ Status RegistryDatabase::runChange(const std::string& removePath, BundleRow* ins
   return Status::OK();
 }
 
-Status RegistryDatabase::commit(const std::string& removePath, BundleRow* insert) {
+Status RegistryDatabase::runRemovedChange(const RemovedChange& removed) {
+  if (!removed.forget.empty()) {
+    sqlite3_stmt* s = forgetRemoved_->get();
+    sqlite3_bind_text(s, 1, removed.forget.data(), static_cast<int>(removed.forget.size()),
+                      SQLITE_STATIC);
+    if (int rc = forgetRemoved_->run(); rc != SQLITE_DONE) {
+      return errorOf(rc, "cannot forget a removed bundle");
+    }
+  }
+  if (const RemovedBundle* r = removed.remember) {
+    std::string identifiers;
+    for (const std::string& id : r->plugInIdentifiers) {
+      if (!identifiers.empty()) identifiers += '\n';
+      identifiers += id;
+    }
+    sqlite3_stmt* s = rememberRemoved_->get();
+    sqlite3_bind_text(s, 1, r->path.data(), static_cast<int>(r->path.size()), SQLITE_STATIC);
+    sqlite3_bind_text(s, 2, r->installFolder.data(), static_cast<int>(r->installFolder.size()),
+                      SQLITE_STATIC);
+    sqlite3_bind_text(s, 3, r->stamp.data(), static_cast<int>(r->stamp.size()), SQLITE_STATIC);
+    sqlite3_bind_text(s, 4, identifiers.data(), static_cast<int>(identifiers.size()),
+                      SQLITE_STATIC);
+    sqlite3_bind_double(s, 5, r->removed.seconds);
+    if (int rc = rememberRemoved_->run(); rc != SQLITE_DONE) {
+      return errorOf(rc, "cannot remember a removed bundle");
+    }
+  }
+  return Status::OK();
+}
+
+Result<std::vector<RemovedBundle>> RegistryDatabase::loadRemoved() {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db_, "SELECT path, origin, stamp, identifiers, removed FROM removed",
+                              -1, &raw, nullptr);
+  if (rc != SQLITE_OK) return errorOf(rc, "cannot read the removed bundles");
+  Statement select(raw);
+  std::vector<RemovedBundle> out;
+  while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
+    RemovedBundle r;
+    r.path = ColumnText(raw, 0).value_or("");
+    r.installFolder = ColumnText(raw, 1).value_or("");
+    r.stamp = ColumnText(raw, 2).value_or("");
+    const std::string identifiers = ColumnText(raw, 3).value_or("");
+    for (size_t pos = 0; pos < identifiers.size();) {
+      size_t end = identifiers.find('\n', pos);
+      if (end == std::string::npos) end = identifiers.size();
+      r.plugInIdentifiers.push_back(identifiers.substr(pos, end - pos));
+      pos = end + 1;
+    }
+    r.removed = Date{sqlite3_column_double(raw, 4)};
+    out.push_back(std::move(r));
+  }
+  if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the removed bundles");
+  return out;
+}
+
+Status RegistryDatabase::updateOrigin(const std::string& path,
+                                      const std::optional<std::string>& origin,
+                                      const std::string& stamp) {
+  if (int rc = begin_->run(); rc != SQLITE_DONE) return errorOf(rc, "cannot begin a change");
+  sqlite3_stmt* u = updateOrigin_->get();
+  sqlite3_bind_text(u, 1, path.data(), static_cast<int>(path.size()), SQLITE_STATIC);
+  BindOptionalText(u, 2, origin);
+  sqlite3_bind_text(u, 3, stamp.data(), static_cast<int>(stamp.size()), SQLITE_STATIC);
+  Status s = Status::OK();
+  if (int rc = updateOrigin_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot update a bundle");
+  if (s) s = runRemovedChange(RemovedChange{path, nullptr});
+  if (s) {
+    if (int rc = commit_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot commit a change");
+  }
+  if (!s) rollback_->run();
+  return s;
+}
+
+Status RegistryDatabase::commit(const std::string& removePath, BundleRow* insert,
+                                const RemovedChange& removed) {
   if (int rc = begin_->run(); rc != SQLITE_DONE) return errorOf(rc, "cannot begin a change");
   Status s = runChange(removePath, insert);
+  if (s) s = runRemovedChange(removed);
   if (s) {
     if (int rc = commit_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot commit a change");
   }

@@ -9,6 +9,7 @@
 #include <chrono>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -29,6 +30,16 @@ struct BundleRow {
   ScannedBundle bundle;
   Date registered;
   std::vector<Uuid> uuids;
+  // The install folder it came from (nothing: "add"-ed from elsewhere) and
+  // the stamp of its files when registered (BundleFileStamp).
+  std::optional<std::string> origin;
+  std::string stamp;
+};
+
+// What a change does to the bundles the user removed from install folders.
+struct RemovedChange {
+  std::string forget;                       // path whose removal is forgotten; empty: none
+  const RemovedBundle* remember = nullptr;  // stored (replacing one at its path)
 };
 
 class RegistryDatabase {
@@ -45,10 +56,18 @@ class RegistryDatabase {
   // Every stored bundle, in registration order, plug-ins by identifier.
   Result<std::vector<BundleRow>> loadAll();
 
+  // Every installed bundle the user removed.
+  Result<std::vector<RemovedBundle>> loadRemoved();
+
   // In one transaction: removes the bundle stored at `removePath` (when not
   // empty) with its plug-ins, then stores `insert` (when not null) and sets
-  // its id. On failure nothing changed.
-  Status commit(const std::string& removePath, BundleRow* insert);
+  // its id, then applies `removed`. On failure nothing changed.
+  Status commit(const std::string& removePath, BundleRow* insert,
+                const RemovedChange& removed = {});
+  // Sets the origin and stamp of the bundle stored at `path` (files
+  // unchanged), forgetting a removal of it by the user.
+  Status updateOrigin(const std::string& path, const std::optional<std::string>& origin,
+                      const std::string& stamp);
 
  private:
   class Statement;
@@ -69,11 +88,12 @@ class RegistryDatabase {
   Status decodeParsedCopies(std::vector<PendingCopy>& pending, std::vector<BundleRow>& rows);
   Status prepareAll();
   Status runChange(const std::string& removePath, BundleRow* insert);
+  Status runRemovedChange(const RemovedChange& removed);
 
   const std::string path_;
   sqlite3* db_;
   std::unique_ptr<Statement> begin_, commit_, rollback_, deletePlugIns_, deleteBundle_,
-      insertBundle_, insertPlugIn_;
+      insertBundle_, insertPlugIn_, forgetRemoved_, rememberRemoved_, updateOrigin_;
 };
 
 }  // namespace dr::registry_internal

@@ -1,5 +1,6 @@
 // Registry entries, their lazily parsed dictionaries, what may travel in a
 // reply, and the registry's options from the environment.
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -12,6 +13,7 @@
 #include "platform/registry.h"
 #include "platform/registry_cache.h"
 #include "platform/registry_scan.h"
+#include "platform/types.h"
 
 namespace dr {
 namespace {
@@ -100,6 +102,27 @@ const Value& RegistryEntry::plugInDictionary() const {
   return plugIn_;
 }
 
+std::string BundleFileStamp(const std::string& path) {
+  std::string stamp;
+  for (const char* file : {"/Contents/Info.pdoc", "/Contents/Entitlements.pdoc"}) {
+    struct stat st {};
+    if (::stat((path + file).c_str(), &st) != 0) {
+      if (stamp.empty()) return "";  // no Info.pdoc: nothing to compare
+      stamp += "-";
+      continue;
+    }
+    for (long long n :
+         {static_cast<long long>(st.st_size), static_cast<long long>(st.st_mtim.tv_sec),
+          static_cast<long long>(st.st_mtim.tv_nsec), static_cast<long long>(st.st_ino),
+          static_cast<long long>(st.st_dev)}) {
+      stamp += std::to_string(n);
+      stamp += ',';
+    }
+    stamp += ';';
+  }
+  return stamp;
+}
+
 std::string RegistryEntry::description() const {
   return Format("%@ %@ at %@", f_.plugInIdentifier, f_.uuid, f_.url);
 }
@@ -124,6 +147,17 @@ Result<RegistryOptions> RegistryOptionsFromEnvironment(
   }
   if (std::string roots = get("DR_SYSTEM_ROOTS"); !roots.empty()) {
     options.systemRoots = SplitFolderList(roots);
+  }
+  // Set but empty means no install folder at all.
+  if (const char* path = getenv ? getenv("DR_PLUGIN_PATH") : std::getenv("DR_PLUGIN_PATH")) {
+    options.installFolders = SplitFolderList(path);
+  } else {
+    for (const std::string& data : DataFoldersFromEnvironment(getenv)) {
+      options.installFolders.push_back(data + "/dromon/PlugIns");
+    }
+  }
+  for (std::string& folder : options.installFolders) {
+    folder = registry_internal::LexicalPath(folder);
   }
   return options;
 }

@@ -7,6 +7,11 @@
 // assumes it is the only writer of its file (the daemon owns it); a change
 // made by another process is seen at the next open.
 //
+// Install folders: each bundle row records the install folder it came from
+// and the stamp of its files; the bundles the user removed from an install
+// folder are kept apart (removed_), so that they are not registered again
+// while their files stay as they were.
+//
 // Threads: writes (register, unregister) are serialized by writeMu_, which is
 // held across the transaction, the index update and the queuing of the
 // events, so events leave in commit order. Lookups take indexMu_ shared and
@@ -58,13 +63,25 @@ class SqliteRegistry final : public Registry {
                  std::unique_ptr<registry_internal::RegistryDatabase> db)
       : fs_(options.fileSystem ? options.fileSystem : FileSystem::Default()),
         systemRoots_(std::move(systemRoots)),
-        db_(std::move(db)) {}
+        db_(std::move(db)) {
+    for (const std::string& folder : options.installFolders) {
+      if (std::string normal = LexicalPath(folder); !normal.empty()) {
+        installFolders_.push_back(std::move(normal));
+      }
+    }
+  }
 
   Status load() {
     auto rows = db_->loadAll();
     if (!rows) return rows.status();
+    auto removed = db_->loadRemoved();
+    if (!removed) return removed.status();
     std::unique_lock<std::shared_mutex> lock(indexMu_);
     for (BundleRow& row : *rows) insertIntoIndex(std::move(row));
+    for (RemovedBundle& r : *removed) {
+      const std::string path = r.path;
+      removed_[path] = std::move(r);
+    }
     return Status::OK();
   }
 
@@ -123,38 +140,74 @@ class SqliteRegistry final : public Registry {
   }
 
   Status registerBundle(const std::string& url) override {
+    // The stamp is taken before the files are read: a write in between
+    // leaves a stamp that no longer matches, so the files are read again.
+    const std::string stamp = BundleFileStamp(CanonicalPath(url).value_or(url));
     // The bundle is read before taking the write lock: a slow disk holds up
     // no other registration.
     auto scanned = registry_internal::ScanBundle(url, systemRoots_, fs_);
     if (!scanned) return scanned.status();
+    std::optional<std::string> origin = installFolderOf(scanned->path);
+    auto registered = registerScanned(url, std::move(*scanned), std::move(origin), stamp, true);
+    return registered.status();
+  }
 
+  Result<InstallOutcome> registerInstalledBundle(const std::string& path,
+                                                 const std::string& installFolder,
+                                                 const std::string& stamp) override {
+    if (!stamp.empty()) {
+      // Unchanged files cost these two stat calls and no read.
+      std::shared_lock<std::shared_mutex> lock(indexMu_);
+      if (auto it = byPath_.find(path); it != byPath_.end()) {
+        const Bundle& b = bundles_.at(it->second);
+        if (b.stamp == stamp && b.origin == installFolder) return InstallOutcome::kUnchanged;
+      }
+      if (auto it = removed_.find(path); it != removed_.end() && it->second.stamp == stamp) {
+        return InstallOutcome::kRemovedByUser;
+      }
+    }
+    auto scanned = registry_internal::ScanBundle(path, systemRoots_, fs_);
+    if (!scanned) return scanned.error();
+    return registerScanned(path, std::move(*scanned), installFolder, stamp, false);
+  }
+
+  Status unregisterInstalledBundle(const std::string& path) override {
     std::lock_guard<std::mutex> write(writeMu_);
-    // Only writers change the index, and they hold writeMu_: reading it here
-    // needs no other lock.
-    RegistryEntries old;
-    if (auto it = byPath_.find(scanned->path); it != byPath_.end()) {
-      const Bundle& existing = bundles_.at(it->second);
-      if (existing.contentHash == scanned->contentHash) return Status::OK();
-      old = existing.entries;
-    }
-    BundleRow row;
-    row.bundle = std::move(*scanned);
-    row.registered = Now();
-    for (size_t i = 0; i < row.bundle.plugIns.size(); ++i) row.uuids.push_back(Uuid::random());
-    const std::string path = row.bundle.path;
-    if (Status s = db_->commit(old.empty() ? std::string() : path, &row); !s) {
+    auto it = byPath_.find(path);
+    const bool installed = it != byPath_.end() && bundles_.at(it->second).origin.has_value();
+    const bool removed = removed_.count(path) != 0;
+    if (!installed && !removed) return Status::OK();
+    if (Status s = db_->commit(installed ? path : std::string(), nullptr,
+                               {removed ? path : std::string(), nullptr});
+        !s) {
       return Error(s.error().domain(), s.error().code(),
-                   Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
+                   Format("cannot unregister \"%@\": %@", path, s.error().localizedDescription()));
     }
-    RegistryEntries installed;
+    RegistryEntries gone;
     {
       std::unique_lock<std::shared_mutex> lock(indexMu_);
-      if (!old.empty()) eraseFromIndex(path);
-      installed = insertIntoIndex(std::move(row));
+      if (installed) gone = eraseFromIndex(path);
+      removed_.erase(path);
     }
-    if (!old.empty()) post(false, std::move(old));
-    post(true, std::move(installed));
+    post(false, std::move(gone));
     return Status::OK();
+  }
+
+  std::vector<InstalledBundle> installedBundles() const override {
+    std::shared_lock<std::shared_mutex> lock(indexMu_);
+    std::vector<InstalledBundle> out;
+    for (const auto& [id, bundle] : bundles_) {
+      if (bundle.origin) out.push_back({bundle.path, *bundle.origin, bundle.stamp, false});
+    }
+    for (const auto& [path, r] : removed_) out.push_back({path, r.installFolder, r.stamp, true});
+    return out;
+  }
+
+  std::vector<RemovedBundle> removedBundles() const override {
+    std::shared_lock<std::shared_mutex> lock(indexMu_);
+    std::vector<RemovedBundle> out;
+    for (const auto& [path, r] : removed_) out.push_back(r);
+    return out;
   }
 
   Status unregisterBundle(const std::string& url) override {
@@ -166,7 +219,17 @@ class SqliteRegistry final : public Registry {
                    Format("cannot unregister \"%@\": no plug-in is registered there", url));
     }
     const std::string path = bundle->path;
-    if (Status s = db_->commit(path, nullptr); !s) {
+    // An installed bundle stays away until its files change or it leaves
+    // its install folder.
+    std::optional<RemovedBundle> mark;
+    if (bundle->origin) {
+      mark = RemovedBundle{path, *bundle->origin, BundleFileStamp(path), {}, Now()};
+      if (mark->stamp.empty()) mark->stamp = bundle->stamp;
+      for (const auto& entry : bundle->entries) {
+        mark->plugInIdentifiers.push_back(entry->plugInIdentifier());
+      }
+    }
+    if (Status s = db_->commit(path, nullptr, {std::string(), mark ? &*mark : nullptr}); !s) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot unregister \"%@\": %@", url, s.error().localizedDescription()));
     }
@@ -174,6 +237,7 @@ class SqliteRegistry final : public Registry {
     {
       std::unique_lock<std::shared_mutex> lock(indexMu_);
       removed = eraseFromIndex(path);
+      if (mark) removed_[path] = std::move(*mark);
     }
     post(false, std::move(removed));
     return Status::OK();
@@ -184,7 +248,88 @@ class SqliteRegistry final : public Registry {
     std::string path;
     std::string contentHash;
     RegistryEntries entries;  // never empty; by identifier
+    std::optional<std::string> origin;
+    std::string stamp;
   };
+
+  // Stores a scanned bundle with `origin` and `stamp` (`keepOrigin`: an
+  // origin it already has stays when `origin` is none), forgetting a
+  // removal by the user; replaces its entries when the files changed.
+  Result<InstallOutcome> registerScanned(const std::string& url,
+                                         registry_internal::ScannedBundle scanned,
+                                         std::optional<std::string> origin,
+                                         const std::string& stamp, bool keepOrigin) {
+    std::lock_guard<std::mutex> write(writeMu_);
+    // Only writers change the index, and they hold writeMu_: reading it here
+    // needs no other lock.
+    const std::string path = scanned.path;
+    const bool wasRemoved = removed_.count(path) != 0;
+    RegistryEntries old;
+    if (auto it = byPath_.find(path); it != byPath_.end()) {
+      Bundle& existing = bundles_.at(it->second);
+      if (!origin && keepOrigin) origin = existing.origin;
+      if (existing.contentHash == scanned.contentHash && existing.origin == origin) {
+        if (existing.stamp == stamp && !wasRemoved) return InstallOutcome::kUnchanged;
+        if (Status s = db_->updateOrigin(path, origin, stamp); !s) {
+          return Error(s.error().domain(), s.error().code(),
+                       Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
+        }
+        std::unique_lock<std::shared_mutex> lock(indexMu_);
+        existing.stamp = stamp;
+        removed_.erase(path);
+        return InstallOutcome::kUnchanged;
+      }
+      old = existing.entries;
+    }
+    BundleRow row;
+    row.bundle = std::move(scanned);
+    row.registered = Now();
+    row.origin = std::move(origin);
+    row.stamp = stamp;
+    for (size_t i = 0; i < row.bundle.plugIns.size(); ++i) row.uuids.push_back(Uuid::random());
+    if (Status s = db_->commit(old.empty() ? std::string() : path, &row,
+                               {wasRemoved ? path : std::string(), nullptr});
+        !s) {
+      return Error(s.error().domain(), s.error().code(),
+                   Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
+    }
+    RegistryEntries installed;
+    {
+      std::unique_lock<std::shared_mutex> lock(indexMu_);
+      if (!old.empty()) eraseFromIndex(path);
+      installed = insertIntoIndex(std::move(row));
+      removed_.erase(path);
+    }
+    if (!old.empty()) post(false, std::move(old));
+    post(true, std::move(installed));
+    return InstallOutcome::kRegistered;
+  }
+
+  // The install folder in which canonical `path` is an installed place:
+  // directly inside it, or a "*.appex" directly in Contents/PlugIns/ of a
+  // "*.app" directly inside it; nothing when none.
+  std::optional<std::string> installFolderOf(const std::string& path) const {
+    for (const std::string& folder : installFolders_) {
+      const std::string root = CanonicalPath(folder).value_or(folder);
+      if (!registry_internal::LiesUnder(path, root) || path.size() == root.size()) continue;
+      std::vector<std::string_view> parts;
+      std::string_view rest(path);
+      rest.remove_prefix(root == "/" ? 1 : root.size() + 1);
+      for (size_t slash; (slash = rest.find('/')) != std::string_view::npos;) {
+        parts.push_back(rest.substr(0, slash));
+        rest.remove_prefix(slash + 1);
+      }
+      parts.push_back(rest);
+      if (parts.size() == 1 && parts[0].ends_with(".appex")) {
+        return folder;
+      }
+      if (parts.size() == 4 && parts[0].ends_with(".app") && parts[1] == "Contents" &&
+          parts[2] == "PlugIns" && parts[3].ends_with(".appex")) {
+        return folder;
+      }
+    }
+    return std::nullopt;
+  }
 
   static Date Now() {
     using namespace std::chrono;
@@ -217,7 +362,7 @@ class SqliteRegistry final : public Registry {
                                 std::move(b.parsed->entitlements))
                           : std::make_shared<const RegistryBundleFiles>(
                                 std::move(b.infoBytes), std::move(b.entitlementsBytes));
-    Bundle bundle{b.path, b.contentHash, {}};
+    Bundle bundle{b.path, b.contentHash, {}, row.origin, row.stamp};
     for (size_t i = 0; i < b.plugIns.size(); ++i) {
       RegistryEntry::Fields f;
       f.uuid = row.uuids[i];
@@ -231,6 +376,7 @@ class SqliteRegistry final : public Registry {
       f.containingApplication = b.containingApplication;
       f.displayName = b.displayName;
       f.shortName = b.shortName;
+      f.installFolder = row.origin;
       auto entry = std::make_shared<const RegistryEntry>(std::move(f), files);
       byUuid_[entry->uuid()] = entry;
       bundle.entries.push_back(std::move(entry));
@@ -273,6 +419,8 @@ class SqliteRegistry final : public Registry {
   std::map<int64_t, Bundle> bundles_;      // by database id = registration order
   std::map<std::string, int64_t> byPath_;  // canonical bundle path -> id
   std::map<Uuid, RegistryEntryPtr> byUuid_;
+  std::map<std::string, RemovedBundle> removed_;  // by canonical path
+  std::vector<std::string> installFolders_;       // lexically normal
   const std::shared_ptr<ObserverList> observers_ = std::make_shared<ObserverList>();
   // Last, so that it is destroyed first: pending events are delivered before
   // the rest of the registry goes.

@@ -9,6 +9,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <map>
 #include <mutex>
 
@@ -207,6 +208,17 @@ int RunExplain(const Invocation& inv, Io& io) {
   if (inv.rules.isPresent()) report["rules"] = inv.rules;
   if (inv.flags) report["flags"] = inv.flags;
   Array plugIns;
+  // An installed bundle the user removed is not registered, but known.
+  Array removed;
+  for (const RemovedBundle& r : (*registry)->removedBundles()) {
+    const auto& ids = r.plugInIdentifiers;
+    if (byPath ? r.path == targetPath : std::find(ids.begin(), ids.end(), target) != ids.end()) {
+      removed.push_back(Value{{"path", r.path},
+                              {"installFolder", r.installFolder},
+                              {"removedAt", static_cast<int64_t>(r.removed.seconds)}});
+    }
+  }
+  if (!removed.empty()) report["removed"] = Value(std::move(removed));
   for (const RegistryEntryPtr& entry : wanted) {
     const Discovery::Verdict* verdict = nullptr;
     for (const Discovery::Verdict& v : discovery.verdicts()) {
@@ -217,6 +229,7 @@ int RunExplain(const Invocation& inv, Io& io) {
     p["uuid"] = entry->uuid().string();
     p["path"] = entry->url();
     p["registered"] = static_cast<int64_t>(entry->registrationDate().seconds);
+    if (entry->installFolder()) p["installFolder"] = *entry->installFolder();
     if (!verdict) {
       p["discovery"] = "never offered";
       p["detail"] = "drd cannot make a record of it";
@@ -246,11 +259,22 @@ int RunExplain(const Invocation& inv, Io& io) {
   io.out << "host: " << hostName << "\n";
   if (inv.rules.isPresent()) io.out << "rules: " << ToJson(inv.rules, false) << "\n";
   if (inv.flags) io.out << "flags: 0x" << std::hex << inv.flags << std::dec << "\n";
-  if (wanted.empty()) io.out << target << ": not registered\n";
+  if (wanted.empty() && !r.has("removed")) io.out << target << ": not registered\n";
+  for (const Value& gone : r["removed"].array()) {
+    io.out << target << ": not registered: removed by the user on "
+           << FormatTime(gone["removedAt"].intValue()) << "\n"
+           << "    path: " << gone["path"].stringValue() << "\n"
+           << "    install folder: " << gone["installFolder"].stringValue() << "\n"
+           << "    it comes back when its files change, or when it leaves the install folder "
+              "and comes back\n";
+  }
   for (const Value& p : r["plugins"].array()) {
     io.out << p["identifier"].stringValue() << " " << p["uuid"].stringValue() << "\n"
            << "    path: " << p["path"].stringValue() << "\n"
            << "    registered: " << FormatTime(p["registered"].intValue()) << "\n";
+    if (p.has("installFolder")) {
+      io.out << "    install folder: " << p["installFolder"].stringValue() << "\n";
+    }
     if (p.has("version")) {
       io.out << "    version: " << p["version"].stringValue() << "\n"
              << "    election: " << p["election"].stringValue() << "\n";

@@ -104,8 +104,14 @@ TEST_F(DrdTest, HelpAndVersionPrintToStandardOutput) {
 TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
   Start();
   const std::string socket = drd_->socketPath();
-  EXPECT_EQ(drd_->standardError(), "drd 0.1.0 listening on " + socket + " (registry " +
-                                       root_.path() + "/registry/r.sqlite3)\n");
+  // The install folders' reconcile reports itself on its own thread, before
+  // or after.
+  std::string log = drd_->standardError();
+  if (size_t at = log.find("install folders: "); at != std::string::npos) {
+    log.erase(at, log.find('\n', at) + 1 - at);
+  }
+  EXPECT_EQ(log, "drd 0.1.0 listening on " + socket + " (registry " + root_.path() +
+                     "/registry/r.sqlite3)\n");
   ASSERT_TRUE(drd_->signal(SIGTERM));
   EXPECT_EQ(drd_->waitForExit(), 0);
   EXPECT_EQ(drd_->standardError().substr(
@@ -150,8 +156,11 @@ TEST_F(DrdTest, LinesCarryTheirPriorityOnlyOnTheJournalStream) {
     EXPECT_EQ(drd.wait(), row.status);
     std::ifstream in(errorFile);
     std::string first, last;
-    std::getline(in, first);
-    for (std::string line; std::getline(in, line);) last = line;
+    for (std::string line; std::getline(in, line);) {
+      if (line.find("install folders: ") != std::string::npos) continue;  // on a thread of its own
+      if (first.empty()) first = line;
+      last = line;
+    }
     EXPECT_EQ(first.rfind(row.first, 0), 0u) << first;
     EXPECT_EQ(last, row.last);
   }

@@ -33,6 +33,7 @@ inline std::vector<std::string> DrkitEnvironment(const std::string& root,
       "HOME=" + root,
       "DR_POLICY=" + root + "/policy.pdoc",
       "DR_SYSTEM_ROOTS=" + root + "/system",
+      "DR_PLUGIN_PATH=" + root + "/installed",
       "PATH=/usr/bin:/bin",
   };
   env.insert(env.end(), extra.begin(), extra.end());

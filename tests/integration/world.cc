@@ -92,12 +92,13 @@ bool World::start(std::vector<std::string> environment) {
   return drd_->waitUntilServing();
 }
 
-bool World::restart() {
+bool World::stop() {
   manager_.reset();
   drd_->signal(SIGTERM);
-  if (drd_->waitForExit() != 0) return false;
-  return start(environment_);
+  return drd_->waitForExit() == 0;
 }
+
+bool World::restart() { return stop() && start(environment_); }
 
 bool World::kill9() {
   manager_.reset();

@@ -63,6 +63,8 @@ class World {
   World();
   // Starts drd (-v, plus `environment` entries); false when it did not come up.
   bool start(std::vector<std::string> environment = {});
+  // SIGTERM and wait; true when drd exited cleanly.
+  bool stop();
   // SIGTERM, wait, start again with the same environment.
   bool restart();
   // SIGKILL (a crash: no clean-up runs), reap, start again with the same

@@ -509,7 +509,7 @@ TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
       {"another program's database", "", "CREATE TABLE notes (text TEXT)", kRegistryCorrupt,
        "the file holds another kind of database; it was left as it is"},
       {"a newer schema", good, "PRAGMA user_version = 99", kRegistryStorage,
-       "schema version 99 is newer than this program knows (2); it was left as it is"},
+       "schema version 99 is newer than this program knows (3); it was left as it is"},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
@@ -581,11 +581,15 @@ TEST_F(RegistryTest, DatabaseOfTheFirstSchemaOpensWithTheSameEntriesAndGainsPars
   auto registry = Open();
   RegisterThree(*registry, dir_);
   EXPECT_EQ(QueryInt(DatabasePath(), "SELECT count(*) FROM bundles WHERE parsed IS NULL"), 0);
-  // The file as the first schema left it: no parsed copies, version 1.
+  // The file as the first schema left it: no parsed copies, no install
+  // folders, version 1.
   const RegistryEntries before = registry->allEntries();
   registry.reset();
   ASSERT_EQ(
-      RunSql(DatabasePath(), "ALTER TABLE bundles DROP COLUMN parsed; PRAGMA user_version = 1"),
+      RunSql(DatabasePath(),
+             "ALTER TABLE bundles DROP COLUMN parsed; ALTER TABLE bundles DROP COLUMN origin; "
+             "ALTER TABLE bundles DROP COLUMN stamp; DROP TABLE removed; "
+             "PRAGMA user_version = 1"),
       SQLITE_OK);
   ASSERT_EQ(QueryInt(DatabasePath(),
                      "SELECT count(*) FROM pragma_table_info('bundles') "
@@ -593,7 +597,7 @@ TEST_F(RegistryTest, DatabaseOfTheFirstSchemaOpensWithTheSameEntriesAndGainsPars
             0);
   registry = Open();
   ASSERT_NE(registry, nullptr);
-  EXPECT_EQ(QueryInt(DatabasePath(), "PRAGMA user_version"), 2);
+  EXPECT_EQ(QueryInt(DatabasePath(), "PRAGMA user_version"), 3);
   EXPECT_EQ(QueryInt(DatabasePath(), "SELECT count(*) FROM bundles WHERE parsed IS NULL"), 0);
   ASSERT_EQ(UuidsOf(registry->allEntries()), UuidsOf(before));
   for (const RegistryEntryPtr& e : before) {
@@ -751,16 +755,28 @@ TEST(RegistryOptionsTest, ComeFromTheEnvironment) {
     std::map<std::string, std::string> env;
     std::string path;
     std::vector<std::string> roots;
+    std::vector<std::string> installFolders;
   };
+  const std::vector<std::string> xdg = {"/x/dromon/PlugIns", "/usr/local/share/dromon/PlugIns",
+                                        "/usr/share/dromon/PlugIns"};
   const Row rows[] = {
-      {{{"DR_REGISTRY", "/r/db"}, {"XDG_DATA_HOME", "/x"}, {"HOME", "/h"}}, "/r/db", {"/usr"}},
-      {{{"XDG_DATA_HOME", "/x"}, {"HOME", "/h"}}, "/x/dromon/registry.sqlite3", {"/usr"}},
-      {{{"XDG_DATA_HOME", "rel"}, {"HOME", "/h"}, {"DR_SYSTEM_ROOTS", ""}},
+      {{{"DR_REGISTRY", "/r/db"}, {"XDG_DATA_HOME", "/x"}, {"HOME", "/h"}}, "/r/db", {"/usr"}, xdg},
+      {{{"XDG_DATA_HOME", "/x"}, {"HOME", "/h"}}, "/x/dromon/registry.sqlite3", {"/usr"}, xdg},
+      {{{"XDG_DATA_HOME", "rel"}, {"HOME", "/h"}, {"DR_SYSTEM_ROOTS", ""}, {"DR_PLUGIN_PATH", ""}},
        "/h/.local/share/dromon/registry.sqlite3",
-       {"/usr"}},
-      {{{"HOME", "/h"}, {"DR_SYSTEM_ROOTS", "/a::rel:/b/"}},
+       {"/usr"},
+       {}},
+      {{{"HOME", "/h"},
+        {"DR_SYSTEM_ROOTS", "/a::rel:/b/"},
+        {"XDG_DATA_DIRS", "/d"},
+        {"DR_PLUGIN_PATH", "/p/:rel::/q/../r"}},
        "/h/.local/share/dromon/registry.sqlite3",
-       {"/a", "/b/"}},
+       {"/a", "/b/"},
+       {"/p", "/r"}},
+      {{{"HOME", "/h"}, {"XDG_DATA_DIRS", "/d:/e"}},
+       "/h/.local/share/dromon/registry.sqlite3",
+       {"/usr"},
+       {"/h/.local/share/dromon/PlugIns", "/d/dromon/PlugIns", "/e/dromon/PlugIns"}},
   };
   for (const Row& row : rows) {
     auto options = RegistryOptionsFromEnvironment([&](const char* name) -> const char* {
@@ -770,6 +786,7 @@ TEST(RegistryOptionsTest, ComeFromTheEnvironment) {
     ASSERT_TRUE(options.ok());
     EXPECT_EQ(options->databasePath, row.path);
     EXPECT_EQ(options->systemRoots, row.roots);
+    EXPECT_EQ(options->installFolders, row.installFolders);
   }
 }
 

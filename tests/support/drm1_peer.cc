@@ -87,11 +87,18 @@ DrdProcess::DrdProcess(const std::string& root, std::vector<std::string> argumen
   const std::string errorFile = root_ + "/drd-stderr-" + std::to_string(::getpid()) + "-" +
                                 std::to_string(reinterpret_cast<uintptr_t>(this));
   std::vector<std::string> environment = {
-      "DR_SOCKET_DIR=" + root_ + "/sockets",  "DR_REGISTRY=" + root_ + "/registry/r.sqlite3",
-      "XDG_STATE_HOME=" + root_ + "/state",   "XDG_CONFIG_HOME=" + root_ + "/config",
-      "XDG_DATA_HOME=" + root_ + "/data",     "DR_NOTIFY_DIR=" + root_ + "/notify",
-      "DR_USAGE_LOG=" + root_ + "/usage.log", "HOME=" + root_,
-      "DR_POLICY=" + root_ + "/policy.pdoc",  "DR_SYSTEM_ROOTS=" + root_ + "/system",
+      "DR_SOCKET_DIR=" + root_ + "/sockets",
+      "DR_REGISTRY=" + root_ + "/registry/r.sqlite3",
+      "XDG_STATE_HOME=" + root_ + "/state",
+      "XDG_CONFIG_HOME=" + root_ + "/config",
+      "XDG_DATA_HOME=" + root_ + "/data",
+      "DR_NOTIFY_DIR=" + root_ + "/notify",
+      "DR_USAGE_LOG=" + root_ + "/usage.log",
+      "HOME=" + root_,
+      "DR_POLICY=" + root_ + "/policy.pdoc",
+      "DR_SYSTEM_ROOTS=" + root_ + "/system",
+      // Nothing installed on the machine leaks in.
+      "DR_PLUGIN_PATH=" + root_ + "/installed",
   };
   // Later entries win: drop the defaults that `extraEnvironment` sets.
   for (const std::string& entry : extraEnvironment) {
