@@ -865,13 +865,12 @@ int Main(int argc, char** argv) {
     big.stop();
 
     if (o.runs("W4") || o.runs("W5")) {
-      log("W4");
-      Samples cold;
-      for (int run = 0; run < z.w4Runs; ++run) {
-        const Clock::time_point started = big.start();
+      // Connects to `d` as soon as it serves, started at `started`, and asks
+      // W2's request of `run`.
+      auto firstReply = [&](Drd& d, Clock::time_point started, int run) {
         std::unique_ptr<Connection> conn;
         while (!conn) {
-          auto attempt = Connection::Open(kServiceName, big.socketFolder());
+          auto attempt = Connection::Open(kServiceName, d.socketFolder());
           if (attempt) {
             conn = std::move(attempt).value();
           } else {
@@ -880,10 +879,15 @@ int Main(int argc, char** argv) {
           if (Micros(started, Clock::now()) > 30e6) Die("W4: drd did not serve within 30 s");
         }
         check(Ask(*conn, MatchPoint(run % z.w2Points), "match"));
+      };
+      log("W4");
+      Samples cold;
+      for (int run = 0; run < z.w4Runs; ++run) {
+        const Clock::time_point started = big.start();
+        firstReply(big, started, run);
         cold.add(Micros(started, Clock::now()));
         cold.cpuMicros += big.cpuSeconds() * 1e6 / z.w4Runs;
         coldPeakKiB = std::max(coldPeakKiB, big.peakResidentKiB());
-        conn.reset();
         big.stop();
       }
       const double median = cold.quantile(0.5);
@@ -912,20 +916,9 @@ int Main(int argc, char** argv) {
       Samples withFolder;
       for (int run = 0; run < z.w4Runs; ++run) {
         const Clock::time_point started = installed.start();
-        std::unique_ptr<Connection> conn;
-        while (!conn) {
-          auto attempt = Connection::Open(kServiceName, installed.socketFolder());
-          if (attempt) {
-            conn = std::move(attempt).value();
-          } else {
-            std::this_thread::sleep_for(std::chrono::microseconds(200));
-          }
-          if (Micros(started, Clock::now()) > 30e6) Die("W4: drd did not serve within 30 s");
-        }
-        check(Ask(*conn, MatchPoint(run % z.w2Points), "match"));
+        firstReply(installed, started, run);
         reconciled(run + 2, started);
         withFolder.add(Micros(started, Clock::now()));
-        conn.reset();
         installed.stop();
       }
       const double ratio = withFolder.quantile(0.5) / median;

@@ -15,6 +15,7 @@
 
 #include "platform/drm1.h"
 #include "platform/locations.h"
+#include "platform/unix_socket.h"
 
 namespace dr::client {
 
@@ -118,29 +119,12 @@ void Connection::State::dropDescriptors() {
 
 ssize_t Connection::State::receive() {
   char buffer[65536];
-  // Room for more descriptors than a frame may carry, so that a batch too
-  // large is seen whole (and refused) rather than cut.
-  alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * 2 * drm1::kMaxDescriptors)];
-  struct iovec iov = {buffer, sizeof buffer};
-  struct msghdr msg = {};
-  msg.msg_iov = &iov;
-  msg.msg_iovlen = 1;
-  msg.msg_control = control;
-  msg.msg_controllen = sizeof control;
-  ssize_t n = ::recvmsg(fd, &msg, MSG_CMSG_CLOEXEC);
-  if (n < 0) return n;
   std::vector<int> batch;
-  for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
-    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-    const size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (size_t i = 0; i < count; ++i) {
-      int d;
-      std::memcpy(&d, CMSG_DATA(c) + i * sizeof(int), sizeof d);
-      batch.push_back(d);
-    }
-  }
+  bool cut = false;
+  const ssize_t n = ReceiveWithDescriptors(fd, buffer, sizeof buffer, &batch, &cut);
   if (!batch.empty()) received.push_back(std::move(batch));
-  if (msg.msg_flags & MSG_CTRUNC) {
+  if (n < 0) return n;
+  if (cut) {
     errno = EPROTO;  // descriptors were lost: the stream cannot be trusted
     return -1;
   }

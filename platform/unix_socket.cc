@@ -31,7 +31,8 @@ ssize_t SendWithDescriptors(int fd, const struct iovec* parts, size_t count,
   return ::sendmsg(fd, &msg, MSG_DONTWAIT | MSG_NOSIGNAL);
 }
 
-ssize_t ReceiveRefusingDescriptors(int fd, void* buffer, size_t size, bool* sawDescriptors) {
+ssize_t ReceiveWithDescriptors(int fd, void* buffer, size_t size, std::vector<int>* descriptors,
+                               bool* cut) {
   alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * kControlDescriptors)];
   struct iovec iov = {buffer, size};
   struct msghdr msg = {};
@@ -41,17 +42,25 @@ ssize_t ReceiveRefusingDescriptors(int fd, void* buffer, size_t size, bool* sawD
   msg.msg_controllen = sizeof control;
   const ssize_t n = ::recvmsg(fd, &msg, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
   if (n < 0) return n;
-  if (msg.msg_flags & MSG_CTRUNC) *sawDescriptors = true;  // the kernel closed what did not fit
+  if (msg.msg_flags & MSG_CTRUNC) *cut = true;  // the kernel closed what did not fit
   for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
     if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-    *sawDescriptors = true;
     const size_t received = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
     for (size_t i = 0; i < received; ++i) {
       int d;
       std::memcpy(&d, CMSG_DATA(c) + i * sizeof(int), sizeof d);
-      ::close(d);
+      descriptors->push_back(d);
     }
   }
+  return n;
+}
+
+ssize_t ReceiveRefusingDescriptors(int fd, void* buffer, size_t size, bool* sawDescriptors) {
+  std::vector<int> descriptors;
+  bool cut = false;
+  const ssize_t n = ReceiveWithDescriptors(fd, buffer, size, &descriptors, &cut);
+  for (int d : descriptors) ::close(d);
+  if (cut || !descriptors.empty()) *sawDescriptors = true;
   return n;
 }
 

@@ -20,6 +20,12 @@ namespace dr {
 ssize_t SendWithDescriptors(int fd, const struct iovec* parts, size_t count,
                             const std::vector<UniqueFd>& descriptors);
 
+// Receives up to `size` bytes, and appends the descriptors that came with
+// them (close-on-exec, the caller's to close) to `descriptors`. Sets `cut`
+// when the kernel had to drop some for want of room.
+ssize_t ReceiveWithDescriptors(int fd, void* buffer, size_t size, std::vector<int>* descriptors,
+                               bool* cut);
+
 // Receives up to `size` bytes. Descriptors that came with them are closed at
 // once and `sawDescriptors` set: a peer that may not send any has broken the
 // protocol, and none may leak.
