@@ -10,6 +10,7 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <cstring>
 #include <filesystem>
 #include <memory>
 #include <string>
@@ -212,10 +213,14 @@ BENCHMARK_CAPTURE(BM_Drm1Encode, match_1000, MatchReply(1000))->Unit(benchmark::
 // Decoding through the FrameDecoder, fed in 64 KiB pieces as a socket
 // delivers a large reply.
 void BM_Drm1Decode(benchmark::State& state, Value body) {
-  const std::string frame = *dr::drm1::EncodeFrame(1, 0, dr::drm1::kFlagWantsReply, body);
-  // One decoder for every frame, as a connection keeps one.
+  std::string frame = *dr::drm1::EncodeFrame(1, 0, dr::drm1::kFlagWantsReply, body);
+  // One decoder for every frame, as a connection keeps one; the serials
+  // rise, as a connection's must.
   dr::drm1::FrameDecoder decoder;
+  uint64_t serial = 0;
   for (auto _ : state) {
+    ++serial;
+    std::memcpy(frame.data() + 8, &serial, sizeof serial);
     std::optional<dr::drm1::Frame> got;
     for (size_t at = 0; at < frame.size() && !got; at += 65536) {
       decoder.feed(std::string_view(frame).substr(at, 65536));

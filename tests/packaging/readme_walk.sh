@@ -58,8 +58,11 @@ expect "drkit match -p $filter" "  $filter.brightness (2.0)
   $filter.contrast (2.0)
   $filter.sepia (1.2)
   $filter.vignette (0.9)" drkit match -p "$filter"
-# Registering again changes nothing.
-expect "drkit add (again)" "" drkit add "$PWD"/examples/Gallery.app/Contents/PlugIns/*.appex
+# Gallery was installed by copying it into the install folder; registering
+# its bundles again by hand changes nothing.
+gallery=$DR_PLUGIN_PATH/Gallery.app/Contents/PlugIns
+[ -d "$gallery" ] || fail "./dev examples did not install Gallery into $DR_PLUGIN_PATH"
+expect "drkit add (again)" "" drkit add "$gallery"/*.appex
 # The table of "What a host asks", as typed rules.
 identifiers() { drkit match "$@" | sed 's/^. \([^ ]*\) .*/\1/' | tr '\n' ' '; }
 expect "presets" "org.example.gallery.presets " \
@@ -82,15 +85,15 @@ expect "annotate (show)" '{"strength":"3"}' drkit annotate -i "$sepia"
 expect "match -i after elect" "+ $sepia (1.2)" drkit match -i "$sepia"
 expect "ready" "" drkit ready "$uuid"
 token=$(drkit access "$uuid") || fail "drkit access"
-expect "extension consume" "$PWD/examples/Gallery.app/Contents/PlugIns/Sepia.appex" \
-  drkit extension consume "$token"
+expect "extension consume" "$gallery/Sepia.appex" drkit extension consume "$token"
+expect "extension open" "Contents" drkit extension open "$token"
 expect "exclude add" "" drkit exclude add -i "$sepia"
 expect "exclude list" "1: {\"UXExtensionIdentifier\":\"$sepia\"}" drkit exclude list
 expect "match when excluded" "" drkit match -i "$sepia"
 expect "exclude remove" "" drkit exclude remove 1
 [ ! -e "$HOME/.config/dromon/ByHost" ] || [ "$XDG_CONFIG_HOME" != "$HOME/.config" ] ||
   fail "drkit exclude wrote the user's own preferences"
-hold=$(drkit hold --plug-in "$PWD/examples/Gallery.app/Contents/PlugIns/Sepia.appex" </dev/null) ||
+hold=$(drkit hold --plug-in "$gallery/Sepia.appex" </dev/null) ||
   fail "drkit hold"
 expect "release" "" drkit release "$hold"
 expect "raw" '{"matches":[]}' drkit raw '{"request": "match", "version": 2, "rules": {"UXExtensionIdentifier": "none"}}'
@@ -100,7 +103,7 @@ sleep 0.5
 drkit elect -i "$sepia" default
 wait "$watch_pid" || fail "drkit watch"
 grep -q '^com.corvel.dromon.annotation-change [0-9]*$' "$work/watch" || fail "watch: $(cat "$work/watch")"
-expect "remove" "" drkit remove "$PWD/examples/Gallery.app/Contents/PlugIns/Presets.appex"
+expect "remove" "" drkit remove "$gallery/Presets.appex"
 
 # Leaving ./dev examples stops drd and takes its socket away, quietly.
 kill "$dev_pid"
