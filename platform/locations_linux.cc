@@ -48,22 +48,27 @@ std::string HomeFolder(const EnvironmentLookup& getenv) {
   return std::string();
 }
 
-std::string DataHome(const EnvironmentLookup& getenv) {
-  if (std::string data = EnvironmentValue(getenv, "XDG_DATA_HOME");
-      !data.empty() && data[0] == '/') {
-    return data;
+namespace {
+
+// An XDG base folder: $variable when it is absolute, else <home>/fallback;
+// "" when no absolute folder can be made.
+std::string XdgFolder(const EnvironmentLookup& getenv, const char* variable, const char* fallback) {
+  if (std::string folder = EnvironmentValue(getenv, variable);
+      !folder.empty() && folder[0] == '/') {
+    return folder;
   }
   std::string home = HomeFolder(getenv);
-  return !home.empty() && home[0] == '/' ? home + "/.local/share" : std::string();
+  return !home.empty() && home[0] == '/' ? home + "/" + fallback : std::string();
+}
+
+}  // namespace
+
+std::string DataHome(const EnvironmentLookup& getenv) {
+  return XdgFolder(getenv, "XDG_DATA_HOME", ".local/share");
 }
 
 std::string StateHome(const EnvironmentLookup& getenv) {
-  if (std::string state = EnvironmentValue(getenv, "XDG_STATE_HOME");
-      !state.empty() && state[0] == '/') {
-    return state;
-  }
-  std::string home = HomeFolder(getenv);
-  return !home.empty() && home[0] == '/' ? home + "/.local/state" : std::string();
+  return XdgFolder(getenv, "XDG_STATE_HOME", ".local/state");
 }
 
 std::string SandboxKeyPath(const EnvironmentLookup& getenv) {

@@ -36,13 +36,13 @@ void DRDatabase::subscribe() {
       [weak = weak_from_this()](const Uuid& uuid) -> std::optional<std::string> {
     std::shared_ptr<DRDatabase> db = weak.lock();
     if (!db) return std::nullopt;
-    return db->sync_.syncResult([&]() -> std::optional<std::string> {
-      auto it = db->cache_.find(uuid);
-      if (it != db->cache_.end()) return it->second->version();
-      RegistryEntryPtr entry = db->options_.registry->entryForUuid(uuid);
-      DRDPlugInPtr record = entry ? db->createPlugInForProxy(entry) : nullptr;
-      return record ? record->version() : std::nullopt;
-    });
+    DRDPlugInPtr record = db->cachedPlugIn(uuid);
+    if (!record) {
+      if (RegistryEntryPtr entry = db->options_.registry->entryForUuid(uuid)) {
+        record = db->plugInForProxy(entry);
+      }
+    }
+    return record ? record->version() : std::nullopt;
   };
   options_.registry->addObserver(weak_from_this());
 }
