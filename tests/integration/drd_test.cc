@@ -104,9 +104,14 @@ TEST_F(DrdTest, HelpAndVersionPrintToStandardOutput) {
 TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
   Start();
   const std::string socket = drd_->socketPath();
-  // The install folders' reconcile reports itself on its own thread, before
-  // or after.
-  std::string log = drd_->standardError();
+  // The socket accepts as soon as it is bound, a moment before the line is
+  // written; the install folders' reconcile reports itself on its own
+  // thread, before or after.
+  std::string log;
+  for (int i = 0; i < 200 && (log = drd_->standardError()).find("listening") == std::string::npos;
+       ++i) {
+    std::this_thread::sleep_for(20ms);
+  }
   if (size_t at = log.find("install folders: "); at != std::string::npos) {
     log.erase(at, log.find('\n', at) + 1 - at);
   }
