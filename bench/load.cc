@@ -55,7 +55,7 @@
 
 #include "bench/load.h"
 #include "client/include/drd/connection.h"
-#include "platform/drm1.h"
+#include "wire/drm1.h"
 
 namespace drbench {
 namespace {

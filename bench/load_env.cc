@@ -17,7 +17,7 @@
 #include <sstream>
 
 #include "bench/load.h"
-#include "platform/pdoc.h"
+#include "pdoc/pdoc.h"
 
 namespace drbench {
 

@@ -17,7 +17,7 @@
 #include <map>
 
 #include "bench/load.h"
-#include "platform/drm1.h"
+#include "wire/drm1.h"
 
 namespace drbench {
 

@@ -17,14 +17,14 @@
 #include <vector>
 
 #include "core/value.h"
-#include "model/helpers.h"
+#include "pdoc/pdoc.h"
 #include "platform/code_signing.h"
-#include "platform/drm1.h"
-#include "platform/pdoc.h"
 #include "platform/process_info.h"
-#include "platform/registry.h"
 #include "platform/sandbox.h"
+#include "plugin/helpers.h"
 #include "plugin/plugin.h"
+#include "registry/registry.h"
+#include "wire/drm1.h"
 
 namespace {
 

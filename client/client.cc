@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "platform/message_keys.h"
+#include "wire/protocol.h"
 
 namespace dr::client {
 namespace {

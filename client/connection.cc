@@ -13,9 +13,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/drm1.h"
-#include "platform/locations.h"
-#include "platform/unix_socket.h"
+#include "wire/drm1.h"
+#include "wire/locations.h"
+#include "wire/unix_socket.h"
 
 namespace dr::client {
 

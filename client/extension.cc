@@ -14,8 +14,8 @@
 
 #include "client/include/drd/client.h"
 #include "core/unique_fd.h"
-#include "platform/locations.h"
-#include "platform/message_keys.h"
+#include "wire/locations.h"
+#include "wire/protocol.h"
 #include "wire/token.h"
 
 namespace dr::client {

@@ -3,38 +3,19 @@
 #include "core/format.h"
 #include "daemon/server.h"
 #include "daemon/transaction.h"
-#include "model/helpers.h"
 #include "platform/probes.h"
+#include "plugin/discovery.h"
+#include "plugin/helpers.h"
 
 namespace dr {
 namespace {
 
 constexpr const char* kShortVersionKey = "BNBundleShortVersionString";
 
-// The older hosts that need the workaround below these versions.
-struct WorkaroundHost {
-  const char* identifier;
-  const char* thresholdVersion;
-};
-constexpr WorkaroundHost kWorkaroundHosts[] = {
-    {"com.corvel.Quellor", "4.2"},       {"com.corvel.Brivane", "10.2"},
-    {"com.corvel.BrivaneTrial", "10.2"}, {"com.corvel.vorelapp", "5.2"},
-    {"com.corvel.OdelloApp", "10.2"},
-};
-
 // Each client's line on the service queue; never reused, unlike pids.
 std::atomic<uint64_t> gNextClientId{1};
 
 }  // namespace
-
-bool Needs17732150Workaround(std::string_view identifier, std::string_view version) {
-  for (const WorkaroundHost& host : kWorkaroundHosts) {
-    if (identifier == host.identifier) {
-      return compareVersionString(host.thresholdVersion, version) > 0;
-    }
-  }
-  return false;
-}
 
 std::shared_ptr<DRDIpcClient> DRDIpcClient::initWithConnectionServer(
     std::shared_ptr<PeerConnection> connection, std::shared_ptr<DRDServer> server) {

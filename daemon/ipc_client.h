@@ -22,19 +22,14 @@
 #include <string_view>
 
 #include "core/value.h"
-#include "model/bundle.h"
 #include "platform/code_signing.h"
 #include "platform/message_service.h"
+#include "plugin/bundle.h"
 #include "plugin/plugin_client.h"
 
 namespace dr {
 
 class DRDServer;
-
-// Whether the host application `identifier` at short version `version` is
-// one of the older hosts whose discovery requests need the 17732150
-// workaround.
-bool Needs17732150Workaround(std::string_view identifier, std::string_view version);
 
 class DRDIpcClient : public PlugInClient, public std::enable_shared_from_this<DRDIpcClient> {
  public:

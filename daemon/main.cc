@@ -23,15 +23,17 @@
 #include "core/log.h"
 #include "daemon/command_line.h"
 #include "daemon/server.h"
-#include "platform/install_folders.h"
-#include "platform/locations.h"
 #include "platform/notifications.h"
 #include "platform/policy.h"
 #include "platform/preferences.h"
-#include "platform/registry.h"
 #include "platform/sandbox.h"
 #include "platform/types.h"
 #include "platform/usage_reports.h"
+#include "registry/install_folders.h"
+#include "registry/registry.h"
+#include "registry/service_manager_linux.h"
+#include "registry/types_linux.h"
+#include "wire/locations.h"
 
 namespace {
 

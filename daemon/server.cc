@@ -5,6 +5,7 @@
 #include <algorithm>
 
 #include "daemon/ipc_client.h"
+#include "registry/service_manager_linux.h"
 
 namespace dr {
 
@@ -33,7 +34,7 @@ std::shared_ptr<DRDServer> DRDServer::initForServiceDatabase(
 
 DRDServer::DRDServer(const std::optional<std::string>& databasePath, ServerOptions options)
     : DRDatabase(databasePath, options.database), options_(std::move(options)) {
-  if (!options_.serviceManager) options_.serviceManager = ServiceManager::Default();
+  if (!options_.serviceManager) options_.serviceManager = DefaultServiceManager();
   if (!options_.codeSigning) options_.codeSigning = CodeSigning::Default();
   if (!options_.processInfo) options_.processInfo = ProcessInfo::Default();
   if (!options_.bundleReader) options_.bundleReader = BundleReader::Default();

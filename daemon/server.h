@@ -25,14 +25,15 @@
 #include "core/turn_queue.h"
 #include "daemon/idle_trim.h"
 #include "daemon/plugin_hold.h"
-#include "daemon/user_prefs.h"
 #include "platform/bundle_reader.h"
 #include "platform/code_signing.h"
 #include "platform/message_service.h"
 #include "platform/policy.h"
 #include "platform/process_info.h"
 #include "platform/service_manager.h"
+#include "registry/service_manager_linux.h"
 #include "store/database.h"
+#include "store/user_prefs.h"
 
 namespace dr {
 
@@ -44,7 +45,7 @@ struct ServerOptions {
   // systemd is taken.
   std::string socketDirectory;
   bool useSocketActivation = true;
-  // Stops the instances of uninstalled plug-ins; null: ServiceManager::Default().
+  // Stops the instances of uninstalled plug-ins; null: DefaultServiceManager().
   ServiceManager* serviceManager = nullptr;
   // The entitlements of peers; null: CodeSigning::Default().
   CodeSigning* codeSigning = nullptr;

@@ -10,15 +10,15 @@
 #include "core/format.h"
 #include "core/log.h"
 #include "core/utf8.h"
-#include "daemon/discovery.h"
 #include "daemon/ipc_client.h"
 #include "daemon/server.h"
-#include "model/plugin_keys.h"
+#include "pdoc/pdoc.h"
 #include "platform/file_system.h"
-#include "platform/message_keys.h"
-#include "platform/pdoc.h"
 #include "platform/probes.h"
+#include "plugin/discovery.h"
+#include "plugin/plugin_keys.h"
 #include "store/extension_issuing.h"
+#include "wire/protocol.h"
 
 namespace dr {
 namespace {

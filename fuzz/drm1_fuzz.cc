@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "fuzz/fuzz_support.h"
-#include "platform/drm1.h"
+#include "wire/drm1.h"
 
 namespace dr::fuzz {
 namespace {

@@ -32,15 +32,16 @@
 #include <vector>
 
 #include "fuzz/fuzz_support.h"
-#include "model/plugin_keys.h"
-#include "platform/drm1.h"
-#include "platform/pdoc.h"
-#include "platform/registry.h"
-#include "platform/registry_scan.h"
+#include "pdoc/pdoc.h"
 #include "platform/types.h"
 #include "plugin/plugin.h"
+#include "plugin/plugin_keys.h"
+#include "registry/registry.h"
+#include "registry/scan.h"
+#include "registry/types_linux.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_types.h"
+#include "wire/drm1.h"
 
 namespace dr::fuzz {
 namespace {

@@ -13,7 +13,7 @@
 
 #include "core/utf8.h"
 #include "fuzz/fuzz_support.h"
-#include "platform/pdoc.h"
+#include "pdoc/pdoc.h"
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   dr::fuzz::SilenceLog();

@@ -13,7 +13,7 @@
 #include <string>
 
 #include "fuzz/fuzz_support.h"
-#include "model/helpers.h"
+#include "plugin/helpers.h"
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   dr::fuzz::SilenceLog();

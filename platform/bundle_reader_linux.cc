@@ -6,7 +6,7 @@
 #include <string_view>
 
 #include "platform/bundle_reader.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 
 namespace dr {
 namespace {

@@ -1,8 +1,8 @@
 #include <string>
 #include <utility>
 
+#include "pdoc/pdoc.h"
 #include "platform/code_signing.h"
-#include "platform/pdoc.h"
 
 namespace dr {
 namespace {

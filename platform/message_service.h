@@ -60,7 +60,7 @@
 #include "core/status.h"
 #include "core/unique_fd.h"
 #include "core/value.h"
-#include "platform/drm1.h"
+#include "wire/drm1.h"
 
 namespace dr {
 

@@ -26,7 +26,7 @@
 #include "core/log.h"
 #include "platform/file_system.h"
 #include "platform/message_service.h"
-#include "platform/unix_socket.h"
+#include "wire/unix_socket.h"
 
 namespace dr {
 namespace {

@@ -20,7 +20,7 @@
 
 #include "core/status.h"
 #include "platform/file_system.h"
-#include "platform/locations.h"
+#include "wire/locations.h"
 
 namespace dr {
 

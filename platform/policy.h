@@ -19,8 +19,8 @@
 #include <string_view>
 
 #include "platform/file_system.h"
-#include "platform/locations.h"
 #include "platform/process_info.h"
+#include "wire/locations.h"
 
 namespace dr {
 

@@ -9,8 +9,8 @@
 #include <tuple>
 
 #include "core/log.h"
+#include "pdoc/pdoc.h"
 #include "platform/code_signing.h"
-#include "platform/pdoc.h"
 #include "platform/policy.h"
 
 namespace dr {

@@ -15,7 +15,7 @@
 
 #include "core/value.h"
 #include "platform/file_system.h"
-#include "platform/locations.h"
+#include "wire/locations.h"
 
 namespace dr {
 

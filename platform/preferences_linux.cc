@@ -8,7 +8,7 @@
 #include <tuple>
 
 #include "core/log.h"
-#include "platform/pdoc.h"
+#include "pdoc/pdoc.h"
 #include "platform/preferences.h"
 
 namespace dr {

@@ -18,7 +18,7 @@
 
 #include "core/status.h"
 #include "platform/code_signing.h"
-#include "platform/locations.h"
+#include "wire/locations.h"
 #include "wire/token.h"
 
 namespace dr {

@@ -18,10 +18,6 @@
 
 namespace dr {
 
-class BundleReader;
-class ProcessInfo;
-class Registry;
-
 // What removeExternalServiceInstance answers when no instance was running
 // (the "no such process" error number).
 inline constexpr int kNoInstanceRunning = 3;
@@ -89,25 +85,6 @@ class ServiceManager {
 
   // The grants in force, in the order they were made.
   virtual std::vector<ExternalServiceGrant> externalServiceGrants() const = 0;
-
-  // A service manager that knows no registry: SDK dictionaries and grants
-  // work, and no process counts as an instance of a registered bundle. Never
-  // null; lives for the whole process.
-  static ServiceManager* Default();
 };
-
-struct ServiceManagerOptions {
-  // The registered plug-in bundles; null: none. Must outlive the manager.
-  const Registry* registry = nullptr;
-  // Reads /proc/<pid>/exe; null: ProcessInfo::Default().
-  ProcessInfo* processInfo = nullptr;
-  // Finds the bundle of a granted executable; null: BundleReader::Default().
-  BundleReader* bundleReader = nullptr;
-};
-
-// The Linux service manager. The registered bundles it has seen (at
-// construction and at every call) are remembered for the life of the
-// manager, so the instances of an uninstalled plug-in can still be stopped.
-std::unique_ptr<ServiceManager> NewServiceManager(const ServiceManagerOptions& options);
 
 }  // namespace dr

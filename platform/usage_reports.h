@@ -18,7 +18,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/locations.h"
+#include "wire/locations.h"
 
 namespace dr {
 

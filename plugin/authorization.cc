@@ -8,8 +8,7 @@
 
 #include "core/format.h"
 #include "core/log.h"
-#include "model/bundle.h"
-#include "model/plugin_keys.h"
+#include "plugin/bundle.h"
 #include "plugin/plugin.h"
 #include "plugin/plugin_keys.h"
 

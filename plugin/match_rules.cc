@@ -5,9 +5,8 @@
 #include <string_view>
 
 #include "core/log.h"
-#include "model/helpers.h"
-#include "model/plugin_keys.h"
 #include "platform/types.h"
+#include "plugin/helpers.h"
 #include "plugin/plugin.h"
 #include "plugin/plugin_keys.h"
 

@@ -14,11 +14,11 @@
 
 #include "core/format.h"
 #include "core/log.h"
-#include "model/plugin_keys.h"
 #include "platform/code_signing.h"
 #include "platform/file_system.h"
 #include "platform/sandbox.h"
 #include "plugin/plugin_keys.h"
+#include "registry/service_manager_linux.h"
 
 namespace dr {
 namespace {
@@ -89,7 +89,7 @@ std::shared_ptr<DRDPlugIn> DRDPlugIn::initWithRGData(const RegistryEntryPtr& ent
 }
 
 ServiceManager* DRDPlugIn::serviceManager() const {
-  return services_.serviceManager ? services_.serviceManager : ServiceManager::Default();
+  return services_.serviceManager ? services_.serviceManager : DefaultServiceManager();
 }
 
 void DRDPlugIn::augmentForm(Dictionary& form) const {

@@ -16,11 +16,11 @@
 
 #include "core/status.h"
 #include "core/value.h"
-#include "model/plugin_core.h"
-#include "platform/locations.h"
-#include "platform/registry.h"
 #include "platform/service_manager.h"
 #include "plugin/plugin_client.h"
+#include "plugin/plugin_core.h"
+#include "registry/registry.h"
+#include "wire/locations.h"
 
 namespace dr {
 

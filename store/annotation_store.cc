@@ -8,10 +8,10 @@
 
 #include "core/format.h"
 #include "core/log.h"
-#include "model/plugin_keys.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 #include "platform/probes.h"
 #include "plugin/plugin.h"
+#include "plugin/plugin_keys.h"
 #include "store/usage_report.h"
 
 namespace dr {

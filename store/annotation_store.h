@@ -41,8 +41,8 @@
 #include "core/status.h"
 #include "core/value.h"
 #include "platform/file_system.h"
-#include "platform/locations.h"
 #include "platform/usage_reports.h"
+#include "wire/locations.h"
 
 namespace dr {
 

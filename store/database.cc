@@ -2,7 +2,7 @@
 
 #include "core/format.h"
 #include "core/log.h"
-#include "model/plugin_keys.h"
+#include "plugin/plugin_keys.h"
 #include "store/usage_report.h"
 
 namespace dr {

@@ -26,10 +26,10 @@
 #include "core/status.h"
 #include "core/value.h"
 #include "platform/notifications.h"
-#include "platform/registry.h"
 #include "platform/usage_reports.h"
 #include "plugin/plugin.h"
 #include "plugin/plugin_set.h"
+#include "registry/registry.h"
 #include "store/annotation_store.h"
 
 namespace dr {

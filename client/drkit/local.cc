@@ -9,11 +9,11 @@
 #include "client/drkit/commands.h"
 #include "client/drkit/output.h"
 #include "client/include/drd/extension.h"
-#include "daemon/user_prefs.h"
 #include "platform/file_system.h"
 #include "platform/notifications.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 #include "platform/preferences.h"
+#include "store/user_prefs.h"
 
 namespace dr::drkit {
 namespace {

@@ -2,6 +2,7 @@
 // plug-ins' removals are logged, how holds block and release plug-ins, and
 // which hosts need the discovery workaround.
 #include "daemon/server.h"
+#include "plugin/discovery.h"
 
 #include <gtest/gtest.h>
 
@@ -16,12 +17,12 @@
 
 #include "core/log.h"
 #include "daemon/ipc_client.h"
-#include "platform/drm1.h"
 #include "platform/message_service.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_services.h"
 #include "tests/support/registry_bundles.h"
 #include "tests/support/test_registry.h"
+#include "wire/drm1.h"
 
 namespace dr {
 namespace {

@@ -11,10 +11,10 @@
 #include <thread>
 #include <vector>
 
-#include "platform/drm1.h"
 #include "tests/integration/drkit_runner.h"
 #include "tests/support/drm1_peer.h"
 #include "tests/support/process_fixtures.h"
+#include "wire/drm1.h"
 
 namespace dr {
 namespace {

@@ -8,10 +8,10 @@
 #include <string>
 #include <vector>
 
-#include "daemon/user_prefs.h"
 #include "platform/file_system.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 #include "platform/preferences.h"
+#include "store/user_prefs.h"
 #include "tests/integration/drkit_runner.h"
 #include "tests/support/process_fixtures.h"
 #include "tests/support/registry_bundles.h"

@@ -12,9 +12,9 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/drm1.h"
 #include "tests/integration/drkit_runner.h"
 #include "tests/integration/world.h"
+#include "wire/drm1.h"
 
 namespace dr::testing {
 namespace {

@@ -26,9 +26,10 @@
 #include <vector>
 
 #include "client/include/drd/connection.h"
-#include "platform/registry.h"
 #include "platform/service_manager.h"
 #include "plugin/plugin.h"
+#include "registry/registry.h"
+#include "registry/service_manager_linux.h"
 #include "tests/support/drm1_peer.h"
 #include "tests/support/process_fixtures.h"
 

@@ -35,12 +35,12 @@
 #include <sqlite3.h>
 
 #include "core/utf8.h"
-#include "platform/drm1.h"
 #include "platform/file_system.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 #include "platform/preferences.h"
 #include "platform/sandbox.h"
 #include "tests/integration/world.h"
+#include "wire/drm1.h"
 
 namespace dr::testing {
 namespace {

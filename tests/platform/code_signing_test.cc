@@ -6,7 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include "platform/pdoc.h"
+#include "pdoc/pdoc.h"
 #include "platform/sandbox.h"
 #include "tests/support/process_fixtures.h"
 

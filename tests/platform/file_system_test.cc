@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/pdoc_file.h"
 #include "tests/support/registry_bundles.h"
 
 namespace dr {
@@ -199,6 +200,32 @@ TEST(FileSystemTest, CanonicalPathResolvesAsRealpath) {
       EXPECT_EQ(*resolved, row.canonical) << row.path;
     }
   }
+}
+
+TEST(PdocFileTest, FilesRoundTripAndKeepTheirErrorDomains) {
+  TempFolder dir;
+  const std::string path = dir / "Info.pdoc";
+  Value value{{"BNBundleIdentifier", "org.example.plugin"}, {"count", 2}};
+  ASSERT_TRUE(pdoc::WriteFile(path, value));
+  EXPECT_EQ(ModeOf(path), 0600u);
+  Result<Value> back = pdoc::ReadFile(path);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(value, *back);
+
+  Result<Value> missing = pdoc::ReadFile(dir / "missing.pdoc");
+  ASSERT_FALSE(missing);
+  EXPECT_EQ(missing.error().domain(), kFileErrorDomain);
+  EXPECT_EQ(missing.error().code(), kFileReadNoSuchFileError);
+
+  ASSERT_TRUE(FileSystem::Default()->writeFileAtomically(path, "{\"a\": null}"));
+  Result<Value> broken = pdoc::ReadFile(path);
+  ASSERT_FALSE(broken);
+  EXPECT_EQ(broken.error().domain(), kPdocErrorDomain);
+  EXPECT_NE(broken.error().localizedDescription().find(path), std::string::npos);
+
+  EXPECT_FALSE(pdoc::WriteFile(path, Value(Uuid::random())));
+  EXPECT_NE(pdoc::ReadFile(path).error().localizedDescription().find("null"), std::string::npos)
+      << "a refused write must leave the file alone";
 }
 
 }  // namespace

@@ -8,7 +8,7 @@
 #include <cstdio>
 
 #include "core/log.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 #include "tests/support/process_fixtures.h"
 
 namespace dr {

@@ -10,6 +10,7 @@
 #include "core/log.h"
 #include "platform/code_signing.h"
 #include "plugin/plugin.h"
+#include "registry/service_manager_linux.h"
 #include "tests/plugin/plugin_fixture.h"
 #include "tests/support/bundle_fixture.h"
 

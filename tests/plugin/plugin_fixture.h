@@ -12,9 +12,9 @@
 #include <utility>
 
 #include "core/value.h"
-#include "platform/pdoc.h"
-#include "platform/registry.h"
+#include "pdoc/pdoc.h"
 #include "plugin/plugin.h"
+#include "registry/registry.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/registry_bundles.h"
 

@@ -10,7 +10,7 @@
 #include <string>
 #include <vector>
 
-#include "model/helpers.h"
+#include "plugin/helpers.h"
 #include "tests/plugin/plugin_fixture.h"
 
 namespace dr::test {

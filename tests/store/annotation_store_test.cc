@@ -20,7 +20,7 @@
 
 #include "core/format.h"
 #include "core/log.h"
-#include "platform/pdoc.h"
+#include "platform/pdoc_file.h"
 #include "plugin/plugin.h"
 #include "tests/support/fake_services.h"
 #include "tests/support/process_fixtures.h"

@@ -6,7 +6,7 @@
 
 #include <filesystem>
 
-#include "platform/pdoc.h"
+#include "pdoc/pdoc.h"
 #include "tests/support/registry_bundles.h"
 
 namespace dr::test {

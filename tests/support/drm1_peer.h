@@ -10,8 +10,8 @@
 #include <vector>
 
 #include "core/value.h"
-#include "platform/drm1.h"
 #include "tests/support/process_fixtures.h"
+#include "wire/drm1.h"
 
 namespace dr::testing {
 

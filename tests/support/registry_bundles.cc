@@ -8,7 +8,7 @@
 #include <fstream>
 #include <sstream>
 
-#include "platform/pdoc.h"
+#include "pdoc/pdoc.h"
 
 namespace dr::registry_test {
 

@@ -8,7 +8,7 @@
 #include <string>
 
 #include "core/value.h"
-#include "platform/registry.h"
+#include "registry/registry.h"
 
 namespace dr::test {
 
