@@ -438,7 +438,7 @@ TEST(ReliabilityTest, GarbageFilesDoNotStopDrd) {
   for (int i = 0; i < 100000; ++i) nested += '[';
   const std::string rows[] = {
       std::string("\0\x01\x02\xff\xfe garbage", 14),
-      "<?xml version=\"1.0\"?><plist><dict><key>UXExtension",
+      "<?xml version=\"1.0\"?><pdoc><dict><key>UXExtension",
       nested,
       "{\"exclusions\": {\"UXExtensionIdentifier\": 7}, \"a\": [1, 2",
       "<?xml version=\"1.0\"?><!DOCTYPE x [<!ENTITY a \"aaaaaaaaaa\"><!ENTITY b "
