@@ -120,7 +120,7 @@ Result<OpenedExtension> openExtension(Connection& connection, std::string_view t
                                       std::chrono::milliseconds timeout) {
   std::vector<int> descriptors;
   Result<Value> reply =
-      connection.request(Value{{message::kRequestKey, "open"},
+      connection.request(Value{{message::kRequestKey, message::kRequestOpen},
                                {message::kVersionKey, Value(message::kProtocolVersion)},
                                {message::kTokenKey, Value(token)}},
                          timeout, &descriptors);

@@ -51,4 +51,19 @@ class DRDPlugInHold {
   Date created_;
 };
 
+// The hold list as request handlers use it; DRDServer keeps the one list.
+// REQUIRES (all three): not on the server's "serverSync" queue.
+class PlugInHolds {
+ public:
+  // Whether some hold in force blocks `plugIn`.
+  virtual bool holdOnPlugIn(const DRDPlugIn& plugIn) = 0;
+  // Puts `hold` in force.
+  virtual void addHold(std::shared_ptr<DRDPlugInHold> hold) = 0;
+  // Releases the hold with `token`, if any.
+  virtual void unholdToken(const Uuid& token) = 0;
+
+ protected:
+  ~PlugInHolds() = default;
+};
+
 }  // namespace dr
