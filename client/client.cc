@@ -64,9 +64,9 @@ Election PlugIn::election() const {
   return e == Value(kElectionUse) ? Election::kElected : Election::kIgnored;
 }
 
-std::optional<Error> ReplyError(const Value& reply) {
+Status ReplyStatus(const Value& reply) {
   const Value& code = reply[kErrorCodeKey];
-  if (code.isAbsent()) return std::nullopt;
+  if (code.isAbsent()) return Status::OK();
   std::optional<std::string_view> text = reply[kErrorKey].string();
   std::string message =
       text && !text->empty() ? std::string(*text) : "drd error " + std::to_string(code.intValue());
@@ -97,7 +97,7 @@ Result<Value> Client::exchange(std::string_view name, Dictionary fields) {
 Result<Value> Client::call(std::string_view name, Dictionary fields) {
   Result<Value> reply = exchange(name, std::move(fields));
   if (!reply) return reply;
-  if (std::optional<Error> error = ReplyError(*reply)) return *error;
+  if (Status status = ReplyStatus(*reply); !status.ok()) return status.error();
   return reply;
 }
 
@@ -163,12 +163,12 @@ Result<Uuid> Client::hold(HoldTarget target, const std::vector<std::string>& pat
   Result<Value> reply = exchange(kRequestLock, {{kFlagsKey, Value(static_cast<uint64_t>(target))},
                                                 {kPathsKey, Strings(paths)}});
   if (!reply) return reply.error();
-  if (std::optional<Error> error = ReplyError(*reply)) {
+  if (Status status = ReplyStatus(*reply); !status.ok()) {
     if (conflicts) {
       const Array& busy = (*reply)[kConflictsKey].array();
       conflicts->assign(busy.begin(), busy.end());
     }
-    return *error;
+    return status.error();
   }
   std::optional<Uuid> token = (*reply)[kUuidsKey].uuid();
   if (!token) return UnexpectedReply(kRequestLock, *reply);

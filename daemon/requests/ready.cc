@@ -46,13 +46,13 @@ void readyPlugIns(Transaction& t, DRDatabase& database, PlugInHolds& holds) {
   });
   if (!checked) return;
   // Every plug-in passed the checks; enable them all, even after a failure.
-  std::optional<Error> firstFailure;
+  Status firstFailure;
   for (const DRDPlugInPtr& p : toEnable) {
     std::optional<Error> error = p->enableForPid(pid);
-    if (error && !firstFailure) firstFailure = std::move(error);
+    if (error && firstFailure.ok()) firstFailure = std::move(*error);
   }
-  if (firstFailure) {
-    t.failError(kErrorMalformed, *firstFailure);
+  if (!firstFailure.ok()) {
+    t.failError(kErrorMalformed, firstFailure.error());
   } else {
     t.done();
   }

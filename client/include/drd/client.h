@@ -171,7 +171,7 @@ class DRD_EXPORT Client {
   std::chrono::milliseconds timeout_ = kDefaultTimeout;
 };
 
-// The Error a reply carries, if it carries "errorcode".
-DRD_EXPORT std::optional<Error> ReplyError(const Value& reply);
+// The Error a reply carries when it carries "errorcode", else OK.
+DRD_EXPORT Status ReplyStatus(const Value& reply);
 
 }  // namespace dr::client
