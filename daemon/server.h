@@ -138,9 +138,7 @@ class DRDServer : public DRDatabase, public DRDatabaseDelegate, public PlugInHol
   // REQUIRES: before run.
   void setVerbose(uint32_t verbose) { verbose_.store(verbose); }
 
-  SerialQueue& ipcQueue() { return ipcQueue_; }
   SerialQueue& mainQueue() { return mainQueue_; }
-  SerialQueue& syncQueue() { return syncQueue_; }
   Listener* service() const { return service_.get(); }
   DRDUserPrefs& userPrefs() { return *userPrefs_; }
   const ServerOptions& options() const { return options_; }

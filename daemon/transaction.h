@@ -63,7 +63,6 @@ class Transaction {
 
   const std::shared_ptr<DRDIpcClient>& client() const { return client_; }
   const Value& request() const { return request_.body; }
-  const Value& reply() const { return reply_; }
   // Adds `key` to the reply.
   void setReplyValue(std::string_view key, const Value& value);
   // Sends `fd` with the reply.

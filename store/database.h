@@ -110,8 +110,6 @@ class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<
   void pluginsDidUninstall(const RegistryEntries& entries) override;
 
   void setDelegate(std::weak_ptr<DRDatabaseDelegate> delegate);
-  Registry* workspace() const { return options_.registry; }
-  SerialQueue& sync() { return sync_; }
   // The cached record of `uuid`, without building one. Enters the queue.
   DRDPlugInPtr cachedPlugIn(const Uuid& uuid);
 
