@@ -7,6 +7,10 @@
 
 namespace dr {
 
+bool MayDiscoverAll(const PlugInClient& host, bool sandboxed) {
+  return host.hasEntitlement(kManagerEntitlement) && !sandboxed;
+}
+
 DiscoveryServices MakeDiscoveryServices(std::function<Value(const DRDPlugIn&)> annotation,
                                         std::function<Policy::PlugInJudge()> makeJudge,
                                         std::function<void(const std::string&)> log,

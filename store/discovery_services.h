@@ -16,6 +16,12 @@
 
 namespace dr {
 
+// Whether `host` may ask for message::kDiscoverAll: it must hold the manager
+// entitlement and not be sandboxed. The refusal's text is
+// kDiscoverAllRefused.
+bool MayDiscoverAll(const PlugInClient& host, bool sandboxed);
+inline constexpr const char* kDiscoverAllRefused = "unauthorized discovery flag (DRDiscoverAll)";
+
 // `annotation` answers the user's stored annotation of a plug-in (anything
 // but a dictionary counts as none: the form gets an empty dictionary).
 // `makeJudge` makes the policy's judge of the host; it is called once, when

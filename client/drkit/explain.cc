@@ -150,13 +150,10 @@ int RunExplain(const Invocation& inv, Io& io) {
   ExplainHost client(entitlements);
   host.client = &client;
   if (inv.flags & client::kDiscoverAll) {
-    const bool sandboxed = client.hasEntitlement(kAppSandboxEntitlement);
-    if (!client.hasEntitlement(kManagerEntitlement) || sandboxed) {
-      return Fail(io,
-                  "drd would refuse this host's request: unauthorized discovery flag "
-                  "(DRDiscoverAll) (" +
-                      std::string(client::ErrorCodeName(client::kErrorNotPermitted)) + ", code " +
-                      std::to_string(client::kErrorNotPermitted) + ")");
+    if (!MayDiscoverAll(client, client.hasEntitlement(kAppSandboxEntitlement))) {
+      return Fail(io, std::string("drd would refuse this host's request: ") + kDiscoverAllRefused +
+                          " (" + client::ErrorCodeName(client::kErrorNotPermitted) + ", code " +
+                          std::to_string(client::kErrorNotPermitted) + ")");
     }
   }
 

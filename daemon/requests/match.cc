@@ -26,9 +26,8 @@ void matchPlugIns(Transaction& t, DRDatabase& database, PlugInHolds& holds, DRDU
   DRDIpcClient& client = *t.client();
   const pid_t pid = client.pid();
   if (flags & kDiscoverAll) {
-    const bool sandboxed = !sandbox || sandbox->isSandboxed(pid);
-    if (!client.hasEntitlement(kManagerEntitlement) || sandboxed) {
-      t.failMessage(kErrorNotPermitted, "unauthorized discovery flag (DRDiscoverAll)");
+    if (!MayDiscoverAll(client, !sandbox || sandbox->isSandboxed(pid))) {
+      t.failMessage(kErrorNotPermitted, kDiscoverAllRefused);
       return;
     }
   }
