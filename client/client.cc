@@ -64,9 +64,9 @@ Election PlugIn::election() const {
   return e == Value(kElectionUse) ? Election::kElected : Election::kIgnored;
 }
 
-std::optional<Error> ReplyError(const Value& reply) {
+Status ReplyStatus(const Value& reply) {
   const Value& code = reply[kErrorCodeKey];
-  if (code.isAbsent()) return std::nullopt;
+  if (code.isAbsent()) return Status::OK();
   std::optional<std::string_view> text = reply[kErrorKey].string();
   std::string message =
       text && !text->empty() ? std::string(*text) : "drd error " + std::to_string(code.intValue());
@@ -97,51 +97,53 @@ Result<Value> Client::exchange(std::string_view name, Dictionary fields) {
 Result<Value> Client::call(std::string_view name, Dictionary fields) {
   Result<Value> reply = exchange(name, std::move(fields));
   if (!reply) return reply;
-  if (std::optional<Error> error = ReplyError(*reply)) return *error;
+  if (Status status = ReplyStatus(*reply); !status.ok()) return status.error();
   return reply;
 }
 
 Status Client::addPlugIns(const std::vector<std::string>& paths) {
-  return call("add", {{kPathsKey, Strings(paths)}}).status();
+  return call(kRequestAdd, {{kPathsKey, Strings(paths)}}).status();
 }
 
 Status Client::removePlugIns(const std::vector<std::string>& paths) {
-  return call("remove", {{kPathsKey, Strings(paths)}}).status();
+  return call(kRequestRemove, {{kPathsKey, Strings(paths)}}).status();
 }
 
-Status Client::bulk(uint64_t flags) { return call("bulk", {{kFlagsKey, Value(flags)}}).status(); }
+Status Client::bulk(uint64_t flags) {
+  return call(kRequestBulk, {{kFlagsKey, Value(flags)}}).status();
+}
 
 Result<std::vector<PlugIn>> Client::match(const Value& rules, uint64_t flags) {
   Dictionary fields{{kFlagsKey, Value(flags)}};
   if (rules.isPresent()) fields[kRulesKey] = rules;
-  Result<Value> reply = call("match", std::move(fields));
+  Result<Value> reply = call(kRequestMatch, std::move(fields));
   if (!reply) return reply.error();
   const Value& matches = (*reply)[kMatchesKey];
-  if (!matches.isArray()) return UnexpectedReply("match", *reply);
+  if (!matches.isArray()) return UnexpectedReply(kRequestMatch, *reply);
   std::vector<PlugIn> plugIns;
   plugIns.reserve(matches.size());
   for (const Value& form : matches.array()) {
     std::optional<PlugIn> p = PlugIn::FromForm(form);
-    if (!p) return UnexpectedReply("match", form);
+    if (!p) return UnexpectedReply(kRequestMatch, form);
     plugIns.push_back(std::move(*p));
   }
   return plugIns;
 }
 
 Status Client::ready(const std::vector<Uuid>& plugIns) {
-  return call("ready", {{kUuidsKey, Uuids(plugIns)}}).status();
+  return call(kRequestReady, {{kUuidsKey, Uuids(plugIns)}}).status();
 }
 
 Result<std::vector<std::string>> Client::access(const std::vector<Uuid>& plugIns) {
-  Result<Value> reply = call("access", {{kUuidsKey, Uuids(plugIns)}});
+  Result<Value> reply = call(kRequestAccess, {{kUuidsKey, Uuids(plugIns)}});
   if (!reply) return reply.error();
   const Value& tokens = (*reply)[kExtensionsKey];
   if (!tokens.isArray() || tokens.size() != plugIns.size()) {
-    return UnexpectedReply("access", *reply);
+    return UnexpectedReply(kRequestAccess, *reply);
   }
   std::vector<std::string> out;
   for (const Value& token : tokens.array()) {
-    if (!token.isString()) return UnexpectedReply("access", *reply);
+    if (!token.isString()) return UnexpectedReply(kRequestAccess, *reply);
     out.push_back(token.stringValue());
   }
   return out;
@@ -151,30 +153,30 @@ Status Client::annotate(const std::vector<Uuid>& plugIns, const AnnotationChange
   Dictionary annotations;
   if (change.election) annotations[kElectionKey] = Value(*change.election);
   if (change.settings.isPresent()) annotations[kSettingsKey] = change.settings;
-  return call("annotate",
+  return call(kRequestAnnotate,
               {{kAnnotationsKey, Value(std::move(annotations))}, {kUuidsKey, Uuids(plugIns)}})
       .status();
 }
 
 Result<Uuid> Client::hold(HoldTarget target, const std::vector<std::string>& paths,
                           std::vector<Value>* conflicts) {
-  Result<Value> reply = exchange(
-      "lock", {{kFlagsKey, Value(static_cast<uint64_t>(target))}, {kPathsKey, Strings(paths)}});
+  Result<Value> reply = exchange(kRequestLock, {{kFlagsKey, Value(static_cast<uint64_t>(target))},
+                                                {kPathsKey, Strings(paths)}});
   if (!reply) return reply.error();
-  if (std::optional<Error> error = ReplyError(*reply)) {
+  if (Status status = ReplyStatus(*reply); !status.ok()) {
     if (conflicts) {
       const Array& busy = (*reply)[kConflictsKey].array();
       conflicts->assign(busy.begin(), busy.end());
     }
-    return *error;
+    return status.error();
   }
   std::optional<Uuid> token = (*reply)[kUuidsKey].uuid();
-  if (!token) return UnexpectedReply("lock", *reply);
+  if (!token) return UnexpectedReply(kRequestLock, *reply);
   return *token;
 }
 
 Status Client::release(const std::vector<Uuid>& tokens) {
-  return call("lock", {{kUuidsKey, Uuids(tokens)}}).status();
+  return call(kRequestLock, {{kUuidsKey, Uuids(tokens)}}).status();
 }
 
 const char* ErrorCodeName(int64_t code) {

@@ -42,7 +42,7 @@ struct Connection::State {
   // first: a batch arrives with the first byte of its frame, so no later
   // than the frame, and frames are decoded in order. Guarded by mu.
   std::deque<std::vector<int>> received;
-  std::optional<Error> deadError;                 // guarded by mu: why the connection died
+  Status dead;                                    // guarded by mu: why the connection died
   uint64_t nextSerial = 1;                        // guarded by mu
   drm1::FrameDecoder decoder{drm1::kFromDaemon};  // guarded by mu
 };
@@ -136,13 +136,13 @@ Status Connection::State::fail(int64_t code, std::string description) {
   dropDescriptors();
   if (fd >= 0) ::close(fd);
   fd = -1;
-  deadError = ClientError(code, std::move(description));
-  return *deadError;
+  dead = ClientError(code, std::move(description));
+  return dead;
 }
 
 Result<uint64_t> Connection::State::write(const Value& message, uint32_t flags,
                                           Clock::time_point deadline) {
-  if (fd < 0) return *deadError;
+  if (fd < 0) return dead;
   const uint64_t serial = nextSerial;
   Result<std::string> frame = drm1::EncodeFrame(serial, 0, flags, message);
   if (!frame) return frame.error();

@@ -120,7 +120,7 @@ Result<OpenedExtension> openExtension(Connection& connection, std::string_view t
                                       std::chrono::milliseconds timeout) {
   std::vector<int> descriptors;
   Result<Value> reply =
-      connection.request(Value{{message::kRequestKey, "open"},
+      connection.request(Value{{message::kRequestKey, message::kRequestOpen},
                                {message::kVersionKey, Value(message::kProtocolVersion)},
                                {message::kTokenKey, Value(token)}},
                          timeout, &descriptors);
@@ -128,7 +128,7 @@ Result<OpenedExtension> openExtension(Connection& connection, std::string_view t
   std::vector<UniqueFd> owned;
   for (int d : descriptors) owned.emplace_back(d);
   if (!reply) return reply.error();
-  if (std::optional<Error> error = ReplyError(*reply)) return *error;
+  if (Status status = ReplyStatus(*reply); !status.ok()) return status.error();
   std::optional<std::string_view> path = (*reply)[message::kPathKey].string();
   if (!path || owned.size() != 1) {
     return Error(kClientErrorDomain, kUnexpectedReply,

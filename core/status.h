@@ -18,7 +18,8 @@
 
 namespace dr {
 
-// The daemon's own error domain.
+// The daemon's own error domain. Its codes are the error codes of drd's
+// replies (wire/protocol.h), so a reply carries such an error as it is.
 inline constexpr const char* DRErrorDomain = "Dromon";
 // Errors made from an errno value (the code is the errno).
 inline constexpr const char* kPosixErrorDomain = "posix";
@@ -32,12 +33,6 @@ inline constexpr const char* kPdocErrorDomain = "pdoc";
 inline constexpr int64_t kFileReadNoSuchFileError = 260;
 inline constexpr int64_t kFileReadError = 256;
 inline constexpr int64_t kFileWriteError = 512;
-
-// Codes of the daemon's own errors (DRErrorDomain).
-inline constexpr int64_t kDRErrorRegistrar = 2;
-inline constexpr int64_t kDRErrorEnable = 4;
-inline constexpr int64_t kDRErrorVersion = 7;
-inline constexpr int64_t kDRErrorInvalidPlugIn = 12;
 
 class Error {
  public:

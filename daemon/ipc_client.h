@@ -60,8 +60,6 @@ class DRDIpcClient : public PlugInClient, public std::enable_shared_from_this<DR
   const std::shared_ptr<DRBundle>& bundle() const { return bundle_; }
   bool acceptWork() const { return acceptWork_.load(); }
   void setAcceptWork(bool accept) { acceptWork_.store(accept); }
-  // REQUIRES: on the service queue.
-  uint32_t requestCount() const { return requestCount_; }
   // Whether a hold of this client was ever put in force (set by the server
   // before it adds one), so that the end of a client that never placed one
   // need not wait for the server's hold list.

@@ -1,7 +1,5 @@
 #include "daemon/plugin_hold.h"
 
-#include <chrono>
-
 #include "platform/message_service.h"
 
 namespace dr {
@@ -16,8 +14,6 @@ std::shared_ptr<DRDPlugInHold> DRDPlugInHold::initWithPlugInsForClient(
   }
   hold->client_ = client;
   hold->clientIdentity_ = client.get();
-  hold->created_.seconds =
-      std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
   KeepAliveBegin();
   return hold;
 }

@@ -35,7 +35,6 @@ class DRDPlugInHold {
   // Whether `client` is the very client that placed the hold.
   bool placedBy(const DRDIpcClient* client) const;
   std::shared_ptr<DRDIpcClient> client() const { return client_.lock(); }
-  Date created() const { return created_; }
 
   // Holds are equal when their tokens are.
   bool operator==(const DRDPlugInHold& other) const { return uuid_ == other.uuid_; }
@@ -48,7 +47,21 @@ class DRDPlugInHold {
   std::set<Uuid> blockedUuids_;
   std::weak_ptr<DRDIpcClient> client_;
   const DRDIpcClient* clientIdentity_ = nullptr;
-  Date created_;
+};
+
+// The hold list as request handlers use it; DRDServer keeps the one list.
+// REQUIRES (all three): not on the server's "serverSync" queue.
+class PlugInHolds {
+ public:
+  // Whether some hold in force blocks `plugIn`.
+  virtual bool holdOnPlugIn(const DRDPlugIn& plugIn) = 0;
+  // Puts `hold` in force.
+  virtual void addHold(std::shared_ptr<DRDPlugInHold> hold) = 0;
+  // Releases the hold with `token`, if any.
+  virtual void unholdToken(const Uuid& token) = 0;
+
+ protected:
+  ~PlugInHolds() = default;
 };
 
 }  // namespace dr

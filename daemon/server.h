@@ -59,7 +59,7 @@ struct ServerOptions {
   Policy* policy = nullptr;
 };
 
-class DRDServer : public DRDatabase, public DRDatabaseDelegate {
+class DRDServer : public DRDatabase, public DRDatabaseDelegate, public PlugInHolds {
  public:
   static constexpr const char* kDefaultServiceName = "com.corvel.dromon.drd";
 
@@ -121,14 +121,14 @@ class DRDServer : public DRDatabase, public DRDatabaseDelegate {
   // REQUIRES (all four): not on "serverSync".
 
   // Whether some hold in force blocks `plugIn`.
-  bool holdOnPlugIn(const DRDPlugIn& plugIn);
+  bool holdOnPlugIn(const DRDPlugIn& plugIn) override;
   // Puts `hold` in force and posts the annotation change. A hold whose
   // client's connection has ended meanwhile is released again at once, as
   // the client's other holds were.
-  void addHold(std::shared_ptr<DRDPlugInHold> hold);
+  void addHold(std::shared_ptr<DRDPlugInHold> hold) override;
   // Releases the hold with `token`, if any (logged, change posted); any
   // client may release any hold.
-  void unholdToken(const Uuid& token);
+  void unholdToken(const Uuid& token) override;
   // Releases every hold `client` placed, one log line and one change each.
   void unholdClient(const DRDIpcClient& client);
   // The holds in force, in the order they were added.
@@ -138,9 +138,7 @@ class DRDServer : public DRDatabase, public DRDatabaseDelegate {
   // REQUIRES: before run.
   void setVerbose(uint32_t verbose) { verbose_.store(verbose); }
 
-  SerialQueue& ipcQueue() { return ipcQueue_; }
   SerialQueue& mainQueue() { return mainQueue_; }
-  SerialQueue& syncQueue() { return syncQueue_; }
   Listener* service() const { return service_.get(); }
   DRDUserPrefs& userPrefs() { return *userPrefs_; }
   const ServerOptions& options() const { return options_; }

@@ -2,11 +2,12 @@
 //
 // Made when the message arrives and run on the server's service queue by
 // dispatch, which checks the envelope and runs the request's handler from the
-// request table. Every request ends in exactly one reply (done, or a failure
-// operation), except that a request of a client that is gone, or a message
-// that asked for no reply, gets none. Failures are replies: "errorcode" and
-// "error" are added to the reply, next to whatever the handler already put
-// there. Holds its client strongly. REQUIRES: used on the service queue only.
+// request table (daemon/requests/). Every request ends in exactly one reply
+// (done, or a failure operation), except that a request of a client that is
+// gone, or a message that asked for no reply, gets none. Failures are
+// replies: "errorcode" and "error" are added to the reply, next to whatever
+// the handler already put there. Holds its client strongly. REQUIRES: used on
+// the service queue only.
 #pragma once
 
 #include <cstdint>
@@ -16,6 +17,8 @@
 #include <string_view>
 #include <vector>
 
+#include "core/format.h"
+#include "core/log.h"
 #include "core/status.h"
 #include "core/unique_fd.h"
 #include "core/value.h"
@@ -24,16 +27,8 @@
 
 namespace dr {
 
+class DRDatabase;
 class DRDIpcClient;
-class DRDServer;
-
-// The codes of "errorcode".
-inline constexpr uint64_t kErrorRegistration = 2;  // the registry refused the plug-in
-inline constexpr uint64_t kErrorMalformed = 4;     // bad request, unknown name or UUID, ...
-inline constexpr uint64_t kErrorVersion = 7;       // unsupported protocol version
-inline constexpr uint64_t kErrorBadPath = 9;       // relative, unresolvable or empty path
-inline constexpr uint64_t kErrorNotPermitted = 11;
-inline constexpr uint64_t kErrorBusy = 14;
 
 class Transaction {
  public:
@@ -54,50 +49,46 @@ class Transaction {
   bool marshalPaths(const PathOperation& operation);
   // marshalPaths, then the success reply when it ran to the end.
   bool processPaths(const PathOperation& operation);
-  // Walks "uuids" as installed plug-ins; true when every one was handled.
-  // Sends no success reply.
-  bool processUuidList(const PlugInOperation& operation);
+  // Walks "uuids" as plug-ins of `database`; true when every one was
+  // handled. Sends no success reply.
+  bool processUuidList(DRDatabase& database, const PlugInOperation& operation);
 
   // Sends the reply.
   void done();
   // Adds "errorcode" and "error" to the reply, then sends it.
-  void failMessage(uint64_t code, std::string_view message);
+  void failMessage(int64_t code, std::string_view message);
   // An error of drd's own domain keeps its code and description; any other
   // is sent with `code` and its localized description.
-  void failError(uint64_t code, const Error& error);
+  void failError(int64_t code, const Error& error);
 
   const std::shared_ptr<DRDIpcClient>& client() const { return client_; }
   const Value& request() const { return request_.body; }
-  const Value& reply() const { return reply_; }
   // Adds `key` to the reply.
   void setReplyValue(std::string_view key, const Value& value);
-  DRDServer& server() const;
-  std::shared_ptr<PeerConnection> connection() const;
+  // Sends `fd` with the reply.
+  void attachDescriptor(UniqueFd fd) { descriptors_.push_back(std::move(fd)); }
+
+  // One line of the system log, as the server writes it: always (log), or
+  // only when the server is verbose (debug).
+  template <typename... Args>
+  void log(std::string_view format, const Args&... args) const {
+    SystemLogLine(Format(format, args...));
+  }
+  template <typename... Args>
+  void debug(std::string_view format, const Args&... args) const {
+    if (verbose_ != 0) SystemLogLine(Format(format, args...));
+  }
 
   // The value under `key` when it is an array (a dictionary), else absent.
   static Value ArrayValue(const Value& message, std::string_view key);
   static Value DictionaryValue(const Value& message, std::string_view key);
-
-  // Request handlers, one per entry of the request table.
-  void addPlugIns();
-  void removePlugIns();
-  void bulkPlugIns();
-  void matchPlugIns();
-  void readyPlugIns();
-  void accessPlugIns();
-  void annotatePlugIns();
-  void lockDownPlugIns();
-  void openExtension();
-
-  // Puts the stored annotation of `plugIn` into `form` under "annotations"
-  // (an empty dictionary when there is none).
-  void addAnnotationForPlugInIn(const DRDPlugIn& plugIn, Dictionary& form);
 
  private:
   Transaction(PeerMessage request, std::shared_ptr<DRDIpcClient> client);
 
   const std::shared_ptr<DRDIpcClient> client_;
   const PeerMessage request_;
+  const uint32_t verbose_;             // the server's, when the request came
   Value reply_;                        // a dictionary
   std::vector<UniqueFd> descriptors_;  // sent with the reply
   bool replied_ = false;

@@ -11,6 +11,7 @@
 #include "plugin/bundle.h"
 #include "plugin/plugin.h"
 #include "plugin/plugin_keys.h"
+#include "wire/protocol.h"
 
 namespace dr {
 
@@ -58,16 +59,18 @@ std::optional<Error> DRDPlugIn::enableForPid(pid_t pid) const {
     if (auto bundle = DRBundle::initWithURL(*path, reader)) executable = bundle->executablePath();
   }
   if (!executable) {
-    return DRMakeErrorWithFormat(kDRErrorEnable, "cannot obtain executable path for plug-in %@(%@)",
-                                 identifier(), id);
+    return DRMakeErrorWithFormat(message::kErrorMalformed,
+                                 "cannot obtain executable path for plug-in %@(%@)", identifier(),
+                                 id);
   }
   // The platform service manager answers 0 or an error number.
   int result = serviceManager()->addExternalService(pid, *executable, overlay);
   if (result != 0) {
     SystemLog("ipc error %d allowing pid %d to use plug-in %@(%@) %@ at %@", result, pid,
               identifier(), version(), id, path);
-    return DRMakeErrorWithFormat(kDRErrorEnable, "unable to enable plug-in %@(%@) for pid %d",
-                                 identifier(), id, pid);
+    return DRMakeErrorWithFormat(message::kErrorMalformed,
+                                 "unable to enable plug-in %@(%@) for pid %d", identifier(), id,
+                                 pid);
   }
   return std::nullopt;
 }

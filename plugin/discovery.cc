@@ -69,8 +69,8 @@ std::optional<std::vector<uint32_t>> CandidatesToExamine(const PlugInSet& candid
                                                          const Value& rules, uint64_t flags,
                                                          bool needs17732150Workaround) {
   std::optional<std::vector<uint32_t>> chosen = candidates.mayMatch(rules);
-  // DRDiscoverAll skips the visibility checks, and with them the workaround.
-  if (!chosen || !needs17732150Workaround || (flags & DRDiscoverAll)) return chosen;
+  // kDiscoverAll skips the visibility checks, and with them the workaround.
+  if (!chosen || !needs17732150Workaround || (flags & message::kDiscoverAll)) return chosen;
   const std::vector<uint32_t>& filters = candidates.internalFilters();
   std::vector<uint32_t> merged;
   merged.reserve(chosen->size() + filters.size());
@@ -110,15 +110,16 @@ bool Discovery::plugInMatches17732150Workaround(const DRDPlugIn& plugIn) const {
 }
 
 std::optional<DiscoveryOutcome> Discovery::visibility(const DRDPlugIn& candidate) {
-  if (candidate.isHybrid() && !(flags_ & DRDiscoverHybrid)) return DiscoveryOutcome::kHybrid;
+  if (candidate.isHybrid() && !(flags_ & message::kDiscoverHybrid))
+    return DiscoveryOutcome::kHybrid;
   if (!candidate.onSystemVolume()) {
     if (!candidate.containingUrl()) {
       if (!host_.needs17732150Workaround || !plugInMatches17732150Workaround(candidate)) {
         return DiscoveryOutcome::kNotInApplication;
       }
-      flags_ |= DRDiscoverDuplicates;
+      flags_ |= message::kDiscoverDuplicates;
     }
-    if (flags_ & DRDiscoverSystemOnly) return DiscoveryOutcome::kSystemOnly;
+    if (flags_ & message::kDiscoverSystemOnly) return DiscoveryOutcome::kSystemOnly;
   }
   if (candidate.isDedicated()) {
     // A plain prefix test: the host's own plug-ins folder holds its
@@ -138,7 +139,7 @@ void Discovery::examine(const DRDPlugInPtr& candidate) {
   verdicts_.push_back({candidate, DiscoveryOutcome::kReturned, {}, nullptr});
   const DRDPlugIn& p = *candidate;
   const pid_t pid = host_.client->pid();
-  const bool all = flags_ & DRDiscoverAll;
+  const bool all = flags_ & message::kDiscoverAll;
 
   if (!all) {
     if (std::optional<DiscoveryOutcome> hidden = visibility(p)) {
@@ -211,8 +212,8 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
     const bool fresher = (p.onSystemVolume() && !systemResident) ||
                          p.lastModified() > e[kFormLastModifiedKey].intValue();
     bool replaceExisting;
-    if (flags_ & DRDiscoverAllVersions) {
-      if ((flags_ & DRDiscoverDuplicates) || order != 0) continue;  // both stay
+    if (flags_ & message::kDiscoverAllVersions) {
+      if ((flags_ & message::kDiscoverDuplicates) || order != 0) continue;  // both stay
       replaceExisting = fresher;
     } else if (order == 0) {
       replaceExisting = fresher;

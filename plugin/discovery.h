@@ -30,6 +30,7 @@
 #include "plugin/plugin.h"
 #include "plugin/plugin_client.h"
 #include "plugin/plugin_set.h"
+#include "wire/protocol.h"
 
 namespace dr {
 
@@ -38,14 +39,7 @@ namespace dr {
 // workaround.
 bool Needs17732150Workaround(std::string_view identifier, std::string_view version);
 
-// The bits of the "flags" of a discovery request; other bits are ignored.
-inline constexpr uint64_t DRDiscoverAllVersions = 0x1;
-inline constexpr uint64_t DRDiscoverDuplicates = 0x4;
-inline constexpr uint64_t DRDiscoverSystemOnly = 0x8;
-inline constexpr uint64_t DRDiscoverHybrid = 0x100;
-inline constexpr uint64_t DRDiscoverAll = 0x200;
-
-// The entitlement a host needs to use DRDiscoverAll (and must not be
+// The entitlement a host needs to use message::kDiscoverAll (and must not be
 // sandboxed).
 inline constexpr const char* kManagerEntitlement = "com.corvel.private.dromon.manager";
 
@@ -99,7 +93,7 @@ struct DiscoveryServices {
 // matching workaround; none when every candidate must be. The others would
 // each be skipped without a trace (no log line, no flag set, nothing
 // returned): rules they fail, and for the workaround host no internal
-// filter whose visibility check sets DRDiscoverDuplicates. Only the
+// filter whose visibility check sets kDiscoverDuplicates. Only the
 // verdicts of the candidates left out are lost.
 std::optional<std::vector<uint32_t>> CandidatesToExamine(const PlugInSet& candidates,
                                                          const Value& rules, uint64_t flags,

@@ -19,6 +19,7 @@
 #include "platform/sandbox.h"
 #include "plugin/plugin_keys.h"
 #include "registry/service_manager_linux.h"
+#include "wire/protocol.h"
 
 namespace dr {
 namespace {
@@ -150,7 +151,7 @@ std::optional<Error> DRDPlugIn::diagnose() {
   if (attributes()[kUXExtensionPointNameKey] == Value(kUnsandboxedExtensionPointName))
     return std::nullopt;
   if (!hasEntitlement(kAppSandboxEntitlement))
-    return DRMakeError(kDRErrorInvalidPlugIn, "plug-ins must be sandboxed");
+    return DRMakeError(message::kErrorInvalidPlugIn, "plug-ins must be sandboxed");
   return std::nullopt;
 }
 

@@ -10,6 +10,7 @@
 #include "plugin/plugin_core.h"
 #include "plugin/plugin_keys.h"
 #include "registry/registry.h"
+#include "wire/protocol.h"
 
 namespace dr {
 void DRPlugInCore::resolveSDK(ServiceManager* serviceManager) {
@@ -82,7 +83,7 @@ void DRPlugInCore::canonicalize() {
 std::optional<Error> DRPlugInCore::diagnose() {
   if (!identifier()) {
     return DRMakeErrorWithFormat(
-        kDRErrorInvalidPlugIn,
+        message::kErrorInvalidPlugIn,
         "missing identifier (no UXExtensionIdentifier, nor even BNBundleIdentifier)");
   }
   const char* missing = nullptr;
@@ -93,8 +94,8 @@ std::optional<Error> DRPlugInCore::diagnose() {
     missing = kUXExtensionAttributesKey;
   }
   if (missing) {
-    return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn, "missing \"%@\" key in Info.pdoc or SDK",
-                                 missing);
+    return DRMakeErrorWithFormat(message::kErrorInvalidPlugIn,
+                                 "missing \"%@\" key in Info.pdoc or SDK", missing);
   }
   // The form's "bundleInfo" is one level below the form (and "info", the
   // plug-in dictionary, is within it). A dictionary nested deeper than a
@@ -103,13 +104,13 @@ std::optional<Error> DRPlugInCore::diagnose() {
   // for every host.
   static_assert(kMaxTravellingDepth == kMaxFormDepth - 1);
   if (std::optional<std::string> why = WhyCannotTravel(bundleInfoDictionary())) {
-    return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn,
+    return DRMakeErrorWithFormat(message::kErrorInvalidPlugIn,
                                  "Info.pdoc and SDK cannot be carried in a reply: %@", *why);
   }
   for (const std::optional<std::string>& text :
        {url(), containingUrl(), localizedName(), localizedShortName(), localizedContainingName()}) {
     if (text && !TextCanTravel(*text)) {
-      return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn,
+      return DRMakeErrorWithFormat(message::kErrorInvalidPlugIn,
                                    "its path or a name is not UTF-8 or holds NUL: \"%@\"",
                                    EscapeInvalidUtf8(*text));
     }

@@ -13,6 +13,7 @@
 #include "plugin/plugin.h"
 #include "plugin/plugin_keys.h"
 #include "store/usage_report.h"
+#include "wire/protocol.h"
 
 namespace dr {
 namespace {
@@ -138,14 +139,15 @@ Status DRDAnnotationStore::loadDb() {
   if (!doc) return fail(doc.error());
   int64_t version = (*doc)[kVersionKey].intValue();
   if (version != kDatabaseVersion) {
-    return fail(DRMakeErrorWithFormat(
-        kDRErrorVersion, "found database version %d needed version %d", version, kDatabaseVersion));
+    return fail(DRMakeErrorWithFormat(message::kErrorVersion,
+                                      "found database version %d needed version %d", version,
+                                      kDatabaseVersion));
   }
   // A version-16 file without a "data" dictionary is damaged like an unreadable one.
   const Value& data = (*doc)[kDataKey];
   if (!data.isDictionary()) {
     return fail(DRMakeErrorWithFormat(
-        kDRErrorVersion, "found database version %d without a data dictionary", version));
+        message::kErrorVersion, "found database version %d without a data dictionary", version));
   }
   setAnnotations(data.dictionary());
   return Status::OK();

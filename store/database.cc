@@ -4,6 +4,7 @@
 #include "core/log.h"
 #include "plugin/plugin_keys.h"
 #include "store/usage_report.h"
+#include "wire/protocol.h"
 
 namespace dr {
 namespace {
@@ -82,9 +83,7 @@ void DRDatabase::autoElect(const DRDPlugIn& record) {
   }
 }
 
-std::optional<std::vector<DRDPlugInPtr>> DRDatabase::findPlugIns(const Value& /*rules*/) {
-  return installedPlugIns()->records();
-}
+std::vector<DRDPlugInPtr> DRDatabase::findPlugIns() { return installedPlugIns()->records(); }
 
 std::shared_ptr<const PlugInSet> DRDatabase::installedPlugIns() {
   // Read before the entries: a change committed after this read leaves the
@@ -168,39 +167,37 @@ std::optional<std::vector<DRDPlugInPtr>> DRDatabase::plugInsWithinApplication(
 
 void DRDatabase::registryChanged() { registryChanges_.fetch_add(1, std::memory_order_release); }
 
-std::optional<Error> DRDatabase::addPlugIn(const std::string& url) {
+Status DRDatabase::addPlugIn(const std::string& url) {
   // Whatever the outcome, the registry may have changed by now; its events
   // come later, while the caller may discover at once.
   const Status status = options_.registry->registerBundle(url);
   registryChanged();
-  if (status.ok()) return std::nullopt;
+  if (status.ok()) return status;
   // The reply names only the path; the registry's reason (a broken bundle,
   // a database held by another process, a full disk) goes to the log.
   SystemLog("%@", status);
-  return DRMakeError(kDRErrorRegistrar, "Registrar failed to register the plug-in");
+  return DRMakeError(message::kErrorRegistration, "Registrar failed to register the plug-in");
 }
 
-std::optional<Error> DRDatabase::removePlugIn(const std::string& url) {
+Status DRDatabase::removePlugIn(const std::string& url) {
   const Status status = options_.registry->unregisterBundle(url);
   registryChanged();
-  if (status.ok()) return std::nullopt;
+  if (status.ok()) return status;
   SystemLog("%@", status);
-  return DRMakeError(kDRErrorRegistrar, "Registrar failed to deregister the plug-in");
+  return DRMakeError(message::kErrorRegistration, "Registrar failed to deregister the plug-in");
 }
 
 Value DRDatabase::annotationForPlugIn(const DRDPlugIn& record) {
   return sync_.syncResult([&] { return annotations_->annotationForPlugIn(record); });
 }
 
-std::optional<Error> DRDatabase::setAnnotationForPlugIn(const Value& annotation,
-                                                        const DRDPlugIn& record) {
+void DRDatabase::setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& record) {
   sync_.sync([&] { annotations_->setAnnotationForPlugIn(annotation, record); });
   if (options_.notifications) {
     if (Status s = options_.notifications->post(kAnnotationChangeNotification); !s.ok()) {
       SystemLog("unable to post %@: %@", kAnnotationChangeNotification, s);
     }
   }
-  return std::nullopt;
 }
 
 DRDPlugInPtr DRDatabase::cachedPlugIn(const Uuid& uuid) {

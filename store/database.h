@@ -9,7 +9,7 @@
 // at a time, and registry calls that may be slow are made off it.
 //
 // Held by std::shared_ptr (the registry holds its observer weakly); the
-// delegate is held weakly. Failures are answered (none, or an error record),
+// delegate is held weakly. Failures are answered (none, or a failed Status),
 // with the system-log lines the daemon defines; nothing throws.
 #pragma once
 
@@ -75,9 +75,9 @@ class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<
   // Elects the plug-in unless the user already chose. REQUIRES: on the queue.
   void autoElect(const DRDPlugIn& record);
 
-  // Every installed plug-in that makes a record; none when the registry gives
-  // no list. `rules` is not used: the caller filters.
-  std::optional<std::vector<DRDPlugInPtr>> findPlugIns(const Value& rules);
+  // Every installed plug-in that makes a record: the records of
+  // installedPlugIns, unfiltered (discovery applies the host's rules).
+  std::vector<DRDPlugInPtr> findPlugIns();
   // The same records, in the same order, as a set with rule indexes. While
   // neither the registry nor the cache changes, every call answers the one
   // set, so its indexes are built once and the registry's entries are not
@@ -94,23 +94,22 @@ class DRDatabase : public RegistryObserver, public std::enable_shared_from_this<
   // The plug-ins of the application at `url`; none when it has none.
   std::optional<std::vector<DRDPlugInPtr>> plugInsWithinApplication(const std::string& url);
 
-  // Registers / unregisters the bundle at `url`; an error record (code 2)
-  // when the registry refuses. The registry's events then update the cache.
-  std::optional<Error> addPlugIn(const std::string& url);
-  std::optional<Error> removePlugIn(const std::string& url);
+  // Registers / unregisters the bundle at `url`; an error of code
+  // message::kErrorRegistration when the registry refuses (its reason is
+  // logged). The registry's events then update the cache.
+  Status addPlugIn(const std::string& url);
+  Status removePlugIn(const std::string& url);
 
   Value annotationForPlugIn(const DRDPlugIn& record);
   // Stores (merges) or erases (absent) the annotation, then posts the change
-  // notification, every time. Always answers none.
-  std::optional<Error> setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& record);
+  // notification, every time.
+  void setAnnotationForPlugIn(const Value& annotation, const DRDPlugIn& record);
 
   // Registry events.
   void pluginsDidInstall(const RegistryEntries& entries) override;
   void pluginsDidUninstall(const RegistryEntries& entries) override;
 
   void setDelegate(std::weak_ptr<DRDatabaseDelegate> delegate);
-  Registry* workspace() const { return options_.registry; }
-  SerialQueue& sync() { return sync_; }
   // The cached record of `uuid`, without building one. Enters the queue.
   DRDPlugInPtr cachedPlugIn(const Uuid& uuid);
 

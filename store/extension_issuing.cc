@@ -6,19 +6,17 @@
 
 namespace dr {
 
-std::optional<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path,
-                                                    const std::string& bundle) {
+Result<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path,
+                                             const std::string& bundle) {
   Result<std::string> resolved = CanonicalPathWithin(path, bundle);
   Result<std::string> token =
       resolved.ok() ? sandbox->issueFileExtension(kReadOnlyFileExtensionClass, *resolved,
                                                   /*flags=*/0)
                     : Result<std::string>(resolved.error());
-  if (!token.ok()) {
-    const Error& e = token.error();
-    errno = e.domain() == kPosixErrorDomain ? static_cast<int>(e.code()) : EINVAL;
-    return std::nullopt;
+  if (!token.ok() && token.error().domain() != kPosixErrorDomain) {
+    return PosixError(EINVAL, token.error().description());
   }
-  return std::move(token).value();
+  return token;
 }
 
 }  // namespace dr

@@ -28,6 +28,7 @@
 #include "registry/service_manager_linux.h"
 #include "registry/types_linux.h"
 #include "store/annotation_store.h"
+#include "store/discovery_services.h"
 #include "store/user_prefs.h"
 
 namespace dr::drkit {
@@ -149,11 +150,10 @@ int RunExplain(const Invocation& inv, Io& io) {
   ExplainHost client(entitlements);
   host.client = &client;
   if (inv.flags & client::kDiscoverAll) {
-    const bool sandboxed = client.hasEntitlement(kAppSandboxEntitlement);
-    if (!client.hasEntitlement(kManagerEntitlement) || sandboxed) {
-      return Fail(io,
-                  "drd would refuse this host's request: unauthorized discovery flag "
-                  "(DRDiscoverAll) (not permitted, code 11)");
+    if (!MayDiscoverAll(client, client.hasEntitlement(kAppSandboxEntitlement))) {
+      return Fail(io, std::string("drd would refuse this host's request: ") + kDiscoverAllRefused +
+                          " (" + client::ErrorCodeName(client::kErrorNotPermitted) + ", code " +
+                          std::to_string(client::kErrorNotPermitted) + ")");
     }
   }
 
@@ -172,16 +172,16 @@ int RunExplain(const Invocation& inv, Io& io) {
   std::unique_ptr<DRDAnnotationStore> annotations =
       DRDAnnotationStore::initWithDatabase(std::nullopt);
 
-  DiscoveryServices hooks;
-  hooks.addAnnotation = [&](const DRDPlugIn& p, Dictionary& form) {
-    Value a = annotations->annotationForPlugIn(p);
-    form["annotations"] = a.isDictionary() ? a : Value::EmptyDictionary();
-  };
-  hooks.mayUse = [&](const Value& form) {
-    return policy->mayHostUsePlugIn(host.bundleIdentifier, form["identifier"].stringValue());
-  };
-  hooks.log = [&](const std::string& line) { log.add(line); };
-  hooks.debug = [&](const std::string& line) { log.add(line); };
+  const std::string hostIdentifier = host.bundleIdentifier;
+  DiscoveryServices hooks =
+      MakeDiscoveryServices([&](const DRDPlugIn& p) { return annotations->annotationForPlugIn(p); },
+                            [&]() -> Policy::PlugInJudge {
+                              return [&](std::string_view plugIn) {
+                                return policy->mayHostUsePlugIn(hostIdentifier, plugIn);
+                              };
+                            },
+                            [&](const std::string& line) { log.add(line); },
+                            [&](const std::string& line) { log.add(line); });
   Discovery discovery(std::move(host), inv.rules, inv.flags,
                       DRDUserPrefs(preferences.get()).exclusions(), std::move(hooks));
 

@@ -257,7 +257,7 @@ int RunRaw(const Invocation& inv, Io& io) {
   Result<Value> reply = (*c)->send(*message);
   if (!reply) return Fail(io, reply.error());
   io.out << Json(io, *reply) << "\n";
-  if (std::optional<Error> error = client::ReplyError(*reply)) return Fail(io, *error);
+  if (Status status = client::ReplyStatus(*reply); !status.ok()) return Fail(io, status.error());
   return 0;
 }
 

@@ -83,7 +83,7 @@ class ServerTest : public ::testing::Test {
   DRDPlugInPtr Add(const std::string& id) {
     std::string path = MakeBundle(folder_ / (id + ".appex"), Info(id),
                                   Value{{"com.corvel.security.app-sandbox", true}});
-    EXPECT_FALSE(server_->addPlugIn(path).has_value());
+    EXPECT_TRUE(server_->addPlugIn(path).ok());
     return server_->findPlugInAtPath(path);
   }
 
@@ -106,7 +106,7 @@ TEST_F(ServerTest, UninstallStopsInstancesAndLogsOnlyRealFailures) {
     paths.push_back(folder_ / (std::string(id) + ".appex"));
   }
   ScopedLogCapture log;
-  for (const std::string& path : paths) ASSERT_FALSE(server_->removePlugIn(path).has_value());
+  for (const std::string& path : paths) ASSERT_TRUE(server_->removePlugIn(path).ok());
   bool logged = false;
   for (int i = 0; i < 300 && !logged; ++i) {
     server_->mainQueue().sync([] {});
@@ -133,7 +133,7 @@ TEST_F(ServerTest, HoldOfAClientThatEndedWhileItsRequestRanIsReleased) {
   const std::string path =
       MakeBundle(app + "/Contents/PlugIns/held.appex", Info("com.example.held"),
                  Value{{"com.corvel.security.app-sandbox", true}});
-  ASSERT_FALSE(server_->addPlugIn(path).has_value());
+  ASSERT_TRUE(server_->addPlugIn(path).ok());
   DRDPlugInPtr held = server_->findPlugInAtPath(path);
   ASSERT_TRUE(held);
   server_->setVerbose(1);

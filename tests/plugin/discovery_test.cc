@@ -189,7 +189,7 @@ TEST_F(DiscoveryTest, ExaminingTheChosenCandidatesAnswersAsExaminingAll) {
       {"old host keeps equal copies", Value{{"UXExtensionPointName", "viewer"}}, 0x1, true},
       {"old host, newest copy", Value{{"UXExtensionPointName", "viewer"}}, 0, true},
       {"old host, system only", Value{{"UXExtensionPointName", "=viewer"}}, 0x9, true},
-      {"everything", Value{{"UXExtensionPointName", "editor"}}, DRDiscoverAll, true},
+      {"everything", Value{{"UXExtensionPointName", "editor"}}, message::kDiscoverAll, true},
       {"rules not indexed", Value{{"UXExtensionPointName", ">=a"}}, 0x1, true},
   };
   for (const Row& row : rows) {

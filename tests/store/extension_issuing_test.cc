@@ -29,8 +29,8 @@ TEST(ExtensionIssuingTest, IssuesReadTokensWithinTheRegisteredBundleOnly) {
   const std::string root = CanonicalPath(folder / ".").value_or("");
   const std::string bundle = root + "/Ünïcode Plug-in.appex";
   ASSERT_TRUE(WriteTestFile(bundle + "/Contents/Info.pdoc", "{}"));
-  std::optional<std::string> token = issueReadExtensionForURL(sandbox.get(), bundle + "/", bundle);
-  ASSERT_TRUE(token.has_value());
+  Result<std::string> token = issueReadExtensionForURL(sandbox.get(), bundle + "/", bundle);
+  ASSERT_TRUE(token.ok());
   EXPECT_EQ(token->find('\0'), std::string::npos);
   EXPECT_EQ(consumeExtension(*token, options).value_or(""), bundle);
 
@@ -47,9 +47,9 @@ TEST(ExtensionIssuingTest, IssuesReadTokensWithinTheRegisteredBundleOnly) {
       {bundle + "/..", bundle, EACCES},
   };
   for (const auto& row : refused) {
-    errno = 0;
-    EXPECT_FALSE(issueReadExtensionForURL(sandbox.get(), row.path, row.registered)) << row.path;
-    EXPECT_EQ(errno, row.errnum) << row.path;
+    Result<std::string> refusal = issueReadExtensionForURL(sandbox.get(), row.path, row.registered);
+    ASSERT_FALSE(refusal.ok()) << row.path;
+    EXPECT_EQ(refusal.error().code(), row.errnum) << row.path;
   }
 }
 

@@ -15,7 +15,8 @@
 //
 // Public types come from drd's core headers, installed beside this one:
 // dr::Value (messages, rules, forms, settings), dr::Uuid, dr::Error,
-// dr::Status and dr::Result<T>. The headers need C++20.
+// dr::Status and dr::Result<T>; the protocol's names and numbers come from
+// drd/wire/protocol.h. The headers need C++20.
 #pragma once
 
 #include <chrono>
@@ -30,17 +31,18 @@
 #include "core/status.h"
 #include "core/value.h"
 #include "export.h"
+#include "wire/protocol.h"
 
 namespace dr::client {
 
-// Errors that drd answered; the code is drd's "errorcode".
+// Errors that drd answered; the code is drd's "errorcode" (wire/protocol.h).
 inline constexpr const char* kDaemonErrorDomain = "drd";
-inline constexpr int64_t kErrorRegistration = 2;   // the registry refused a bundle
-inline constexpr int64_t kErrorMalformed = 4;      // bad request, unknown UUID, failed operation
-inline constexpr int64_t kErrorVersion = 7;        // protocol version not served
-inline constexpr int64_t kErrorBadPath = 9;        // relative, unresolvable, or no plug-in there
-inline constexpr int64_t kErrorNotPermitted = 11;  // not permitted for this process
-inline constexpr int64_t kErrorBusy = 14;          // plug-ins are busy (hold refused)
+using message::kErrorBadPath;
+using message::kErrorBusy;
+using message::kErrorMalformed;
+using message::kErrorNotPermitted;
+using message::kErrorRegistration;
+using message::kErrorVersion;
 
 // A short name for one of drd's error codes ("bad path" for kErrorBadPath),
 // for messages beside drd's own text; nullptr for a code drd does not use.
@@ -50,11 +52,11 @@ DRD_EXPORT const char* ErrorCodeName(int64_t code);
 inline constexpr int64_t kUnexpectedReply = 4;
 
 // Discovery flags of match(); other bits are ignored by drd.
-inline constexpr uint64_t kDiscoverAllVersions = 0x1;  // every version of an identifier
-inline constexpr uint64_t kDiscoverDuplicates = 0x4;   // with kDiscoverAllVersions: equal ones too
-inline constexpr uint64_t kDiscoverSystemOnly = 0x8;   // only plug-ins on the system volume
-inline constexpr uint64_t kDiscoverHybrid = 0x100;     // include plug-ins with embedded code
-inline constexpr uint64_t kDiscoverAll = 0x200;        // privileged: skip visibility and holds
+using message::kDiscoverAll;
+using message::kDiscoverAllVersions;
+using message::kDiscoverDuplicates;
+using message::kDiscoverHybrid;
+using message::kDiscoverSystemOnly;
 
 // Rule keys of match() that every plug-in answers.
 inline constexpr const char* kRuleIdentifier = "UXExtensionIdentifier";
@@ -104,8 +106,8 @@ struct AnnotationChange {
 
 // What hold() designates with each path.
 enum class HoldTarget : uint64_t {
-  kApplication = 1,  // every plug-in inside the application at the path
-  kPlugIn = 2,       // the one plug-in bundle at the path (held even while it runs)
+  kApplication = message::kHoldApplication,  // every plug-in inside the application at the path
+  kPlugIn = message::kHoldPlugIn,  // the one plug-in bundle at the path (held even while it runs)
 };
 
 class DRD_EXPORT Client {
@@ -169,7 +171,7 @@ class DRD_EXPORT Client {
   std::chrono::milliseconds timeout_ = kDefaultTimeout;
 };
 
-// The Error a reply carries, if it carries "errorcode".
-DRD_EXPORT std::optional<Error> ReplyError(const Value& reply);
+// The Error a reply carries when it carries "errorcode", else OK.
+DRD_EXPORT Status ReplyStatus(const Value& reply);
 
 }  // namespace dr::client
