@@ -426,12 +426,10 @@ std::string ApplyOption(const OptionSpec& o, const std::string& value, Invocatio
 // getopt_long over the verb's options, then its operands and checks.
 // argv[0] of `args` is the verb.
 Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Invocation& inv) {
-  std::vector<const OptionSpec*> allowed;
   std::string shortOptions = ":";  // ':' first: a missing value is reported as ':'
   std::vector<struct option> longOptions;
   for (const OptionSpec& o : kOptions) {
     if (!spec.takes(o.id)) continue;
-    allowed.push_back(&o);
     const bool hasValue = o.takes != Takes::kNothing;
     if (o.shortName != 0) {
       shortOptions += o.shortName;
@@ -468,8 +466,10 @@ Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Inv
           verb + ": " +
           (c == '?' ? "unknown option '" + what + "'" : "option '" + what + "' needs a value"));
     }
-    const OptionSpec& o = **std::find_if(allowed.begin(), allowed.end(),
-                                         [c](const OptionSpec* a) { return GetoptCode(*a) == c; });
+    // The verb's option with this code (getopt answers only those).
+    const OptionSpec& o = *std::find_if(std::begin(kOptions), std::end(kOptions), [&](auto& a) {
+      return spec.takes(a.id) && GetoptCode(a) == c;
+    });
     seen.set(static_cast<size_t>(o.id));
     std::string problem = ApplyOption(o, optarg ? optarg : "", inv, rules);
     if (!problem.empty()) return UsageError(verb + ": " + problem);
@@ -492,13 +492,6 @@ Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Inv
   return Status();
 }
 
-// The value glued to an option ("-Sname", "--service=name"), if `arg` is
-// that option with a glued value.
-std::optional<std::string_view> GluedValue(std::string_view arg, std::string_view prefix) {
-  if (!arg.starts_with(prefix)) return std::nullopt;
-  return arg.substr(prefix.size());
-}
-
 }  // namespace
 
 Result<Invocation> ParseCommandLine(const std::vector<std::string>& argv) {
@@ -508,7 +501,6 @@ Result<Invocation> ParseCommandLine(const std::vector<std::string>& argv) {
   // the verb's own options are never taken for global ones.
   for (; i < argv.size(); ++i) {
     const std::string& a = argv[i];
-    std::optional<std::string_view> glued;
     if (a == "-h" || a == "--help") {
       inv.help = true;
     } else if (a == "--version") {
@@ -516,9 +508,10 @@ Result<Invocation> ParseCommandLine(const std::vector<std::string>& argv) {
     } else if (a == kServiceShort || a == kServiceLong) {
       if (++i == argv.size()) return UsageError("option '" + a + "' needs a value");
       inv.service = argv[i];
-    } else if ((glued = GluedValue(a, kServiceLongGlued)) ||
-               ((glued = GluedValue(a, kServiceShort)) && !glued->empty())) {
-      inv.service = *glued;
+    } else if (a.starts_with(kServiceLongGlued)) {
+      inv.service = a.substr(kServiceLongGlued.size());
+    } else if (a.starts_with(kServiceShort) && a.size() > kServiceShort.size()) {
+      inv.service = a.substr(kServiceShort.size());
     } else if (a == "--") {
       ++i;
       break;
