@@ -220,12 +220,12 @@ const std::vector<VerbSpec>& Verbs() {
            "  --rule 'AcceptedTypes:={\"image/png\": 1}'    offers one PNG: a dictionary of\n"
            "                                               type to number of items\n"
            "  --rule Count:=3  --rule Enabled:=true        a number, a boolean\n"},
-      {{"add", {}, 1, kUnlimited, nullptr, RunAddRemove},
+      {{"add", {}, 1, kUnlimited, nullptr, RunAdd},
        "add PATH...",
        "register plug-in bundles",
        "Registers the plug-in bundle at each PATH, in order; stops at the first\n"
        "failure (the bundles before it stay registered).\n"},
-      {{"remove", {}, 1, kUnlimited, nullptr, RunAddRemove},
+      {{"remove", {}, 1, kUnlimited, nullptr, RunRemove},
        "remove PATH...",
        "unregister plug-in bundles",
        "Unregisters the plug-in bundle at each PATH, in order; the bundle need\n"
@@ -264,12 +264,12 @@ const std::vector<VerbSpec>& Verbs() {
        "release TOKEN...",
        "release holds",
        "Releases the holds with these tokens; unknown tokens are passed over.\n"},
-      {{"ready", {}, 1, kUnlimited, CheckUuids, RunReadyAccess},
+      {{"ready", {}, 1, kUnlimited, CheckUuids, RunReady},
        "ready UUID...",
        "ready plug-ins for this process",
        "Asks drd to make the plug-ins' services reachable from drkit's process;\n"
        "shows whether a host could use them.\n"},
-      {{"access", {Opt::kJson}, 1, kUnlimited, CheckUuids, RunReadyAccess},
+      {{"access", {Opt::kJson}, 1, kUnlimited, CheckUuids, RunAccess},
        "access UUID...",
        "get read tokens for plug-in bundles",
        "Prints one read token per plug-in, in order (see 'extension consume');\n"

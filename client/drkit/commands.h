@@ -27,12 +27,14 @@ int Run(const Invocation& invocation, Io& io);
 
 // The verbs' handlers, as the verb table names them.
 int RunMatch(const Invocation& inv, Io& io);
-int RunAddRemove(const Invocation& inv, Io& io);
+int RunAdd(const Invocation& inv, Io& io);
+int RunRemove(const Invocation& inv, Io& io);
 int RunElect(const Invocation& inv, Io& io);
 int RunAnnotate(const Invocation& inv, Io& io);
 int RunHold(const Invocation& inv, Io& io);
 int RunRelease(const Invocation& inv, Io& io);
-int RunReadyAccess(const Invocation& inv, Io& io);
+int RunReady(const Invocation& inv, Io& io);
+int RunAccess(const Invocation& inv, Io& io);
 int RunRaw(const Invocation& inv, Io& io);
 int RunStatus(const Invocation& inv, Io& io);
 int RunExtension(const Invocation& inv, Io& io);
