@@ -3,70 +3,119 @@
 #include <getopt.h>
 
 #include <algorithm>
+#include <bitset>
 #include <charconv>
 #include <string_view>
 
+#include "client/drkit/commands.h"
 #include "client/drkit/output.h"
 
 namespace dr::drkit {
 namespace {
 
-// Options after the verb. Each verb accepts a subset (VerbSpec::options).
-enum Option : int {
-  kOptHelp = 'h',
-  kOptPoint = 'p',
-  kOptIdentifier = 'i',
-  kOptVerbose = 'v',
-  kOptRule = 256,
-  kOptAllVersions,
-  kOptDuplicates,
-  kOptAll,
-  kOptHybrid,
-  kOptSystemOnly,
-  kOptJson,
-  kOptApp,
-  kOptPlugIn,
-  kOptUnset,
-  kOptCount,
-  kOptHost,
+// drkit's own option before the verb, and its spellings with a glued value.
+constexpr std::string_view kServiceShort = "-S";
+constexpr std::string_view kServiceLong = "--service";
+constexpr std::string_view kServiceLongGlued = "--service=";
+
+// The options after the verb. Each verb's row lists those it takes.
+enum class Opt {
+  kHelp,
+  kPoint,
+  kIdentifierRule,  // -i as a rule (discovery, exclusions)
+  kIdentifier,      // -i naming the one plug-in a verb changes
+  kVerbose,
+  kRule,
+  kAllVersions,
+  kDuplicates,
+  kAll,
+  kHybrid,
+  kSystemOnly,
+  kJson,
+  kApp,
+  kPlugIn,
+  kUnset,
+  kCount,
+  kHost,
+};
+constexpr size_t kOptCount = static_cast<size_t>(Opt::kHost) + 1;
+using Seen = std::bitset<kOptCount>;
+
+// What follows an option.
+enum class Takes {
+  kNothing,
+  kText,
+  kNumber,  // a non-negative decimal integer
+  kRule,    // KEY=PATTERN or KEY:=JSON
 };
 
 struct OptionSpec {
-  Option id;
-  const char* longName;  // nullptr: short only
-  bool hasArgument;
+  Opt id;
+  char shortName;  // 0: long only
+  const char* longName;
+  Takes takes;
+  // What the option sets besides its own handling in ApplyOption.
+  bool Invocation::*sets = nullptr;
+  uint64_t flags = 0;             // discovery flags
+  const char* ruleKey = nullptr;  // the rule whose pattern is the value
 };
 
 constexpr OptionSpec kOptions[] = {
-    {kOptHelp, "help", false},
-    {kOptPoint, "extension-point", true},
-    {kOptIdentifier, "identifier", true},
-    {kOptVerbose, "verbose", false},
-    {kOptRule, "rule", true},
-    {kOptAllVersions, "all-versions", false},
-    {kOptDuplicates, "duplicates", false},
-    {kOptAll, "all", false},
-    {kOptHybrid, "hybrid", false},
-    {kOptSystemOnly, "system-only", false},
-    {kOptJson, "json", false},
-    {kOptApp, "app", true},
-    {kOptPlugIn, "plug-in", true},
-    {kOptPlugIn, "plugin", true},  // the spelling of earlier versions
-    {kOptUnset, "unset", true},
-    {kOptCount, "count", true},
-    {kOptHost, "host", true},
+    {Opt::kHelp, 'h', "help", Takes::kNothing, &Invocation::help},
+    {Opt::kPoint, 'p', "extension-point", Takes::kText, nullptr, 0, client::kRuleExtensionPoint},
+    {Opt::kIdentifierRule, 'i', "identifier", Takes::kText, nullptr, 0, client::kRuleIdentifier},
+    {Opt::kIdentifier, 'i', "identifier", Takes::kText},
+    {Opt::kVerbose, 'v', "verbose", Takes::kNothing, &Invocation::verbose},
+    {Opt::kRule, 0, "rule", Takes::kRule},
+    {Opt::kAllVersions, 0, "all-versions", Takes::kNothing, nullptr, client::kDiscoverAllVersions},
+    {Opt::kDuplicates, 0, "duplicates", Takes::kNothing, nullptr,
+     client::kDiscoverDuplicates | client::kDiscoverAllVersions},
+    {Opt::kAll, 0, "all", Takes::kNothing, nullptr, client::kDiscoverAll},
+    {Opt::kHybrid, 0, "hybrid", Takes::kNothing, nullptr, client::kDiscoverHybrid},
+    {Opt::kSystemOnly, 0, "system-only", Takes::kNothing, nullptr, client::kDiscoverSystemOnly},
+    {Opt::kJson, 0, "json", Takes::kNothing, &Invocation::json},
+    {Opt::kApp, 0, "app", Takes::kText},
+    {Opt::kPlugIn, 0, "plug-in", Takes::kText},
+    {Opt::kPlugIn, 0, "plugin", Takes::kText},  // the spelling of earlier versions
+    {Opt::kUnset, 0, "unset", Takes::kText},
+    {Opt::kCount, 0, "count", Takes::kNumber},
+    {Opt::kHost, 0, "host", Takes::kText},
 };
+
+// getopt_long's answer for an option: its short name when it has one (so
+// that a long spelling's errors name the short one), else a number past
+// every character.
+constexpr int kLongOnly = 256;
+int GetoptCode(const OptionSpec& o) {
+  return o.shortName != 0 ? o.shortName : kLongOnly + static_cast<int>(o.id);
+}
 
 constexpr int kUnlimited = -1;
 
-struct VerbSpec {
+// A verb's checks of what getopt cannot check (operand forms, option
+// combinations): the problem, or empty.
+using Check = std::string (*)(const Invocation&, const Seen&);
+
+// How a verb is parsed and run.
+struct VerbGrammar {
   const char* name;
-  std::vector<Option> options;  // besides --help, which every verb takes
+  std::vector<Opt> options;  // besides --help, which every verb takes
   int minOperands;
   int maxOperands;  // kUnlimited: no limit
+  Check check;      // nullptr: nothing more to check
+  VerbHandler run;
+
+  bool takes(Opt o) const {
+    return o == Opt::kHelp || std::find(options.begin(), options.end(), o) != options.end();
+  }
+};
+
+// One verb: everything the parser, the dispatcher, the help, the manual
+// page and the shell completion know of it.
+struct VerbSpec : VerbGrammar {
   const char* synopsis;
   const char* summary;
-  const char* details;
+  std::string details;
 };
 
 constexpr const char* kDiscoveryOptionsHelp =
@@ -83,48 +132,105 @@ constexpr const char* kDiscoveryOptionsHelp =
     "      --all                    skip visibility and hold checks (needs the\n"
     "                               manager entitlement)\n";
 
+std::optional<uint64_t> ParseCount(std::string_view text) {
+  uint64_t n = 0;
+  auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), n);
+  if (ec != std::errc() || end != text.data() + text.size() || text.empty()) return std::nullopt;
+  return n;
+}
+
+const VerbSpec* FindVerb(std::string_view name);
+
+std::string CheckElect(const Invocation& inv, const Seen&) {
+  const std::string& choice = inv.operands[0];
+  if (inv.identifier.empty()) return "-i ID is required";
+  if (choice == "use" || choice == "ignore" || choice == "default") return "";
+  return "expected use, ignore or default, not '" + choice + "'";
+}
+
+std::string CheckAnnotate(const Invocation& inv, const Seen&) {
+  if (inv.identifier.empty()) return "-i ID is required";
+  for (const std::string& pair : inv.operands) {
+    size_t eq = pair.find('=');
+    if (eq == std::string::npos || eq == 0) return "expected KEY=VALUE, not '" + pair + "'";
+  }
+  return "";
+}
+
+std::string CheckHold(const Invocation& inv, const Seen& seen) {
+  if (seen[static_cast<size_t>(Opt::kApp)] && seen[static_cast<size_t>(Opt::kPlugIn)]) {
+    return "--app and --plug-in do not mix";
+  }
+  return inv.holdTarget ? "" : "--app PATH or --plug-in PATH is required";
+}
+
+std::string CheckUuids(const Invocation& inv, const Seen&) {
+  for (const std::string& text : inv.operands) {
+    if (!Uuid::parse(text)) return "not a UUID: '" + text + "'";
+  }
+  return "";
+}
+
+std::string CheckExtension(const Invocation& inv, const Seen&) {
+  const std::string& action = inv.operands[0];
+  if (action == "consume") return inv.operands.size() == 2 ? "" : "consume takes one TOKEN";
+  if (action == "open") return "";
+  return "unknown action '" + action + "' (expected consume or open)";
+}
+
+std::string CheckExclude(const Invocation& inv, const Seen&) {
+  const std::vector<std::string>& ops = inv.operands;
+  const bool rules = inv.rules.isPresent();
+  if (ops[0] == "add") return rules && ops.size() == 1 ? "" : "add takes rules: -p, -i or --rule";
+  if (ops[0] == "remove") {
+    std::optional<uint64_t> n = ops.size() == 2 ? ParseCount(ops[1]) : std::nullopt;
+    const bool ok = ops.size() == 2 ? !rules && n && *n > 0 : rules;
+    return ok ? "" : "remove takes rules or one number from 'list'";
+  }
+  if (ops[0] == "list") return !rules && ops.size() == 1 ? "" : "list takes nothing more";
+  return "unknown action '" + ops[0] + "' (expected add, remove or list)";
+}
+
+std::string CheckHelp(const Invocation& inv, const Seen&) {
+  if (inv.operands.empty() || FindVerb(inv.operands[0])) return "";
+  return "no such verb '" + inv.operands[0] + "'";
+}
+
 const std::vector<VerbSpec>& Verbs() {
   static const std::vector<VerbSpec> verbs = {
-      {"match",
-       {kOptPoint, kOptIdentifier, kOptRule, kOptAllVersions, kOptDuplicates, kOptAll, kOptHybrid,
-        kOptSystemOnly, kOptVerbose, kOptJson},
-       0,
-       0,
+      {{"match",
+        {Opt::kPoint, Opt::kIdentifierRule, Opt::kRule, Opt::kAllVersions, Opt::kDuplicates,
+         Opt::kAll, Opt::kHybrid, Opt::kSystemOnly, Opt::kVerbose, Opt::kJson},
+        0,
+        0,
+        nullptr,
+        RunMatch},
        "match [OPTIONS]",
        "list the plug-ins drd offers to a host",
-       "Prints one line per plug-in, by identifier: its election mark ('+' elected,\n"
-       "'-' ignored, ' ' not chosen), identifier and version.\n\n"
-       "Options:\n"
-       "$DISCOVERY"
-       "  -v, --verbose                also print UUID, path and registration time\n"
-       "      --json                   print the plug-ins' forms as JSON\n\n"
-       "Rules: each names a key of the plug-ins' attributes (then of their\n"
-       "information dictionary) and a pattern. After '=' the pattern is a string,\n"
-       "so \"1.0\" stays a version text; after ':=' it is JSON:\n"
-       "  --rule BNBundleVersion='>=2'                 a version range (a string)\n"
-       "  --rule 'AcceptedTypes:={\"image/png\": 1}'    offers one PNG: a dictionary of\n"
-       "                                               type to number of items\n"
-       "  --rule Count:=3  --rule Enabled:=true        a number, a boolean\n"},
-      {"add",
-       {},
-       1,
-       kUnlimited,
+       std::string("Prints one line per plug-in, by identifier: its election mark ('+' elected,\n"
+                   "'-' ignored, ' ' not chosen), identifier and version.\n\n"
+                   "Options:\n") +
+           kDiscoveryOptionsHelp +
+           "  -v, --verbose                also print UUID, path and registration time\n"
+           "      --json                   print the plug-ins' forms as JSON\n\n"
+           "Rules: each names a key of the plug-ins' attributes (then of their\n"
+           "information dictionary) and a pattern. After '=' the pattern is a string,\n"
+           "so \"1.0\" stays a version text; after ':=' it is JSON:\n"
+           "  --rule BNBundleVersion='>=2'                 a version range (a string)\n"
+           "  --rule 'AcceptedTypes:={\"image/png\": 1}'    offers one PNG: a dictionary of\n"
+           "                                               type to number of items\n"
+           "  --rule Count:=3  --rule Enabled:=true        a number, a boolean\n"},
+      {{"add", {}, 1, kUnlimited, nullptr, RunAdd},
        "add PATH...",
        "register plug-in bundles",
        "Registers the plug-in bundle at each PATH, in order; stops at the first\n"
        "failure (the bundles before it stay registered).\n"},
-      {"remove",
-       {},
-       1,
-       kUnlimited,
+      {{"remove", {}, 1, kUnlimited, nullptr, RunRemove},
        "remove PATH...",
        "unregister plug-in bundles",
        "Unregisters the plug-in bundle at each PATH, in order; the bundle need\n"
        "not exist on disk any more.\n"},
-      {"elect",
-       {kOptIdentifier},
-       1,
-       1,
+      {{"elect", {Opt::kIdentifier}, 1, 1, CheckElect, RunElect},
        "elect -i ID use|ignore|default",
        "turn a plug-in on or off for the user",
        "Records the user's election for every installed copy of plug-in ID:\n"
@@ -132,10 +238,12 @@ const std::vector<VerbSpec>& Verbs() {
        "  ignore   turn it off (election -1); automatic election leaves it off\n"
        "  default  no choice (election 0); a plug-in entitled to automatic\n"
        "           election is turned on again when drd next loads it\n"},
-      {"annotate",
-       {kOptIdentifier, kOptUnset, kOptJson},
-       0,
-       kUnlimited,
+      {{"annotate",
+        {Opt::kIdentifier, Opt::kUnset, Opt::kJson},
+        0,
+        kUnlimited,
+        CheckAnnotate,
+        RunAnnotate},
        "annotate -i ID [KEY=VALUE...] [--unset KEY...]",
        "change a plug-in's settings",
        "Sets each KEY to the string VALUE and removes each --unset KEY in the\n"
@@ -143,10 +251,7 @@ const std::vector<VerbSpec>& Verbs() {
        "Without changes, prints the settings as JSON.\n\n"
        "Options:\n"
        "      --json                   print the settings on one line when piped\n"},
-      {"hold",
-       {kOptApp, kOptPlugIn, kOptJson},
-       0,
-       0,
+      {{"hold", {Opt::kApp, Opt::kPlugIn, Opt::kJson}, 0, 0, CheckHold, RunHold},
        "hold --app PATH... | --plug-in PATH...",
        "keep plug-ins out of use while they are replaced",
        "Holds every plug-in of the application at each --app PATH, or the plug-in\n"
@@ -155,33 +260,21 @@ const std::vector<VerbSpec>& Verbs() {
        "until standard input ends. Ends with status 1 if drd goes away (the hold\n"
        "goes with it). Refused while a plug-in of an application is running.\n"
        "With --json the token is printed as {\"token\": TOKEN}.\n"},
-      {"release",
-       {},
-       1,
-       kUnlimited,
+      {{"release", {}, 1, kUnlimited, CheckUuids, RunRelease},
        "release TOKEN...",
        "release holds",
        "Releases the holds with these tokens; unknown tokens are passed over.\n"},
-      {"ready",
-       {},
-       1,
-       kUnlimited,
+      {{"ready", {}, 1, kUnlimited, CheckUuids, RunReady},
        "ready UUID...",
        "ready plug-ins for this process",
        "Asks drd to make the plug-ins' services reachable from drkit's process;\n"
        "shows whether a host could use them.\n"},
-      {"access",
-       {kOptJson},
-       1,
-       kUnlimited,
+      {{"access", {Opt::kJson}, 1, kUnlimited, CheckUuids, RunAccess},
        "access UUID...",
        "get read tokens for plug-in bundles",
        "Prints one read token per plug-in, in order (see 'extension consume');\n"
        "with --json, a list of {\"uuid\": UUID, \"token\": TOKEN}.\n"},
-      {"extension",
-       {kOptJson},
-       2,
-       3,
+      {{"extension", {Opt::kJson}, 2, 3, CheckExtension, RunExtension},
        "extension consume TOKEN | extension open TOKEN [FILE]",
        "check or open a read token",
        "consume: checks TOKEN against the user's key and prints the path it grants\n"
@@ -190,10 +283,12 @@ const std::vector<VerbSpec>& Verbs() {
        "inside the granted folder) read through that, or lists the folder (with\n"
        "--json, {\"path\": PATH, \"names\": [...]}). Works inside a sandbox that\n"
        "can reach drd's socket but not the plug-in.\n"},
-      {"exclude",
-       {kOptPoint, kOptIdentifier, kOptRule, kOptJson},
-       1,
-       2,
+      {{"exclude",
+        {Opt::kPoint, Opt::kIdentifierRule, Opt::kRule, Opt::kJson},
+        1,
+        2,
+        CheckExclude,
+        RunExclude},
        "exclude add RULES | exclude remove RULES|N | exclude list",
        "edit the user's plug-in exclusions",
        "The user's exclusions hide every plug-in that satisfies one of them from\n"
@@ -206,19 +301,13 @@ const std::vector<VerbSpec>& Verbs() {
        "RULES:\n"
        "  -p, --extension-point POINT, -i, --identifier ID, --rule KEY=PATTERN,\n"
        "  --rule KEY:=JSON (see 'drkit help match')\n"},
-      {"watch",
-       {kOptCount, kOptJson},
-       0,
-       0,
+      {{"watch", {Opt::kCount, Opt::kJson}, 0, 0, nullptr, RunWatch},
        "watch [--count N]",
        "print drd's change notifications",
        "Prints one line per posted change notification: its name and count.\n"
        "Runs until SIGINT or SIGTERM, or until N notifications were printed.\n"
        "With --json each line is {\"name\": NAME, \"count\": COUNT}.\n"},
-      {"raw",
-       {kOptJson},
-       0,
-       1,
+      {{"raw", {Opt::kJson}, 0, 1, nullptr, RunRaw},
        "raw [JSON]",
        "send any request",
        "Sends the request given as a JSON object (read from standard input when\n"
@@ -226,31 +315,33 @@ const std::vector<VerbSpec>& Verbs() {
        "unsigned. Values JSON lacks are written as objects with one key:\n"
        "{\"$uuid\": \"TEXT\"}, {\"$data\": \"BASE64\"}, {\"$date\": SECONDS}.\n"
        "Example: {\"request\": \"match\", \"version\": 2, \"flags\": 1}\n"},
-      {"status",
-       {kOptJson},
-       0,
-       0,
+      {{"status", {Opt::kJson}, 0, 0, nullptr, RunStatus},
        "status",
        "tell whether drd is answering",
        "Prints drd's socket and whether drd answers a request there; with --json,\n"
        "{\"service\": NAME, \"socket\": PATH, \"answering\": true|false}.\n"},
-      {"explain",
-       {kOptHost, kOptPoint, kOptRule, kOptAllVersions, kOptDuplicates, kOptAll, kOptHybrid,
-        kOptSystemOnly, kOptVerbose, kOptJson},
-       1,
-       1,
+      {{"explain",
+        {Opt::kHost, Opt::kPoint, Opt::kRule, Opt::kAllVersions, Opt::kDuplicates, Opt::kAll,
+         Opt::kHybrid, Opt::kSystemOnly, Opt::kVerbose, Opt::kJson},
+        1,
+        1,
+        nullptr,
+        RunExplain},
        "explain PATH|IDENTIFIER [--host APP] [OPTIONS]",
        "tell why plug-ins are or are not offered to a host",
-       "Reads the registry and runs discovery as drd would for a host, then prints\n"
-       "for each plug-in of the bundle at PATH (or with IDENTIFIER) whether it is\n"
-       "registered and what discovery made of it. drd need not be running.\n\n"
-       "Options:\n"
-       "      --host APP               the host application's bundle (default: a\n"
-       "                               host outside any bundle)\n"
-       "$DISCOVERY"
-       "  -v, --verbose                also print what drd would log\n"
-       "      --json                   print the same as one JSON object\n"},
-      {"help", {}, 0, 1, "help [VERB]", "print help", "Prints the help of VERB, or of drkit.\n"},
+       std::string("Reads the registry and runs discovery as drd would for a host, then prints\n"
+                   "for each plug-in of the bundle at PATH (or with IDENTIFIER) whether it is\n"
+                   "registered and what discovery made of it. drd need not be running.\n\n"
+                   "Options:\n"
+                   "      --host APP               the host application's bundle (default: a\n"
+                   "                               host outside any bundle)\n") +
+           kDiscoveryOptionsHelp +
+           "  -v, --verbose                also print what drd would log\n"
+           "      --json                   print the same as one JSON object\n"},
+      {{"help", {}, 0, 1, CheckHelp, RunHelp},
+       "help [VERB]",
+       "print help",
+       "Prints the help of VERB, or of drkit.\n"},
   };
   return verbs;
 }
@@ -262,99 +353,90 @@ const VerbSpec* FindVerb(std::string_view name) {
   return nullptr;
 }
 
-Error UsageError(std::string message) { return Error(kUsageErrorDomain, 2, std::move(message)); }
+Error UsageError(std::string message) {
+  return Error(kUsageErrorDomain, kExitUsage, std::move(message));
+}
 
 // Adds KEY=PATTERN to a rules dictionary; a second pattern for one key turns
-// the entry into an array of alternatives.
-Status AddRule(Dictionary& rules, std::string_view key, Value pattern) {
-  if (key.empty()) return UsageError("a rule needs a key: KEY=PATTERN");
+// the entry into an array of alternatives. Answers the problem, or empty.
+std::string AddRule(Dictionary& rules, std::string_view key, Value pattern) {
+  if (key.empty()) return "a rule needs a key: KEY=PATTERN";
   auto [it, inserted] = rules.try_emplace(std::string(key), pattern);
-  if (inserted) return Status();
+  if (inserted) return "";
   Array alternatives = it->second.isArray() ? it->second.array() : Array{it->second};
   alternatives.push_back(std::move(pattern));
   it->second = Value(std::move(alternatives));
-  return Status();
+  return "";
 }
 
-std::optional<uint64_t> ParseCount(std::string_view text) {
-  uint64_t n = 0;
-  auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), n);
-  if (ec != std::errc() || end != text.data() + text.size() || text.empty()) return std::nullopt;
-  return n;
+// --rule's value: KEY=PATTERN takes the text as it is; KEY:=JSON reads a
+// typed pattern (a number, boolean, list or dictionary).
+std::string AddRuleText(Dictionary& rules, std::string_view value) {
+  size_t eq = value.find('=');
+  if (eq == std::string::npos) return "expected --rule KEY=PATTERN or --rule KEY:=JSON";
+  std::string_view key = value.substr(0, eq);
+  const std::string_view text = value.substr(eq + 1);
+  if (key.empty() || key.back() != ':') return AddRule(rules, key, Value(text));
+  key.remove_suffix(1);
+  Result<Value> typed = FromJson(text);
+  if (!typed) {
+    return "--rule " + std::string(key) + ":=" + std::string(text) + ": " +
+           typed.error().localizedDescription();
+  }
+  return AddRule(rules, key, *typed);
 }
 
-// The checks getopt cannot make: operand forms and option combinations.
-Status Validate(Invocation& inv, const std::vector<bool>& seen) {
-  const std::vector<std::string>& ops = inv.operands;
-  auto need = [&](bool ok, const std::string& message) {
-    return ok ? Status() : Status(UsageError(inv.verb + ": " + message));
-  };
-  if (inv.verb == "elect" || inv.verb == "annotate") {
-    if (inv.identifier.empty()) return need(false, "-i ID is required");
+// Applies one option and its value: the problem, or empty.
+std::string ApplyOption(const OptionSpec& o, const std::string& value, Invocation& inv,
+                        Dictionary& rules) {
+  if (o.sets) inv.*o.sets = true;
+  inv.flags |= o.flags;
+  if (o.ruleKey) return AddRule(rules, o.ruleKey, Value(value));
+  if (o.takes == Takes::kRule) return AddRuleText(rules, value);
+  const std::optional<uint64_t> number = ParseCount(value);
+  if (o.takes == Takes::kNumber && !number) {
+    return "--" + std::string(o.longName) + " needs a number, not '" + value + "'";
   }
-  if (inv.verb == "elect") {
-    return need(ops[0] == "use" || ops[0] == "ignore" || ops[0] == "default",
-                "expected use, ignore or default, not '" + ops[0] + "'");
+  switch (o.id) {
+    case Opt::kIdentifier:
+      if (!inv.identifier.empty()) return "-i may be given once";
+      inv.identifier = value;
+      return "";
+    case Opt::kApp:
+    case Opt::kPlugIn:
+      inv.holdTarget =
+          o.id == Opt::kApp ? client::HoldTarget::kApplication : client::HoldTarget::kPlugIn;
+      inv.operands.push_back(value);
+      return "";
+    case Opt::kUnset:
+      if (value.empty()) return "--unset needs a key";
+      inv.unset.push_back(value);
+      return "";
+    case Opt::kCount:
+      inv.count = *number;
+      return "";
+    case Opt::kHost:
+      inv.host = value;
+      return "";
+    default:
+      return "";
   }
-  if (inv.verb == "annotate") {
-    for (const std::string& pair : ops) {
-      size_t eq = pair.find('=');
-      if (eq == std::string::npos || eq == 0) {
-        return need(false, "expected KEY=VALUE, not '" + pair + "'");
-      }
-    }
-    return Status();
-  }
-  if (inv.verb == "hold") {
-    if (seen[kOptApp] && seen[kOptPlugIn]) return need(false, "--app and --plug-in do not mix");
-    return need(inv.holdTarget.has_value(), "--app PATH or --plug-in PATH is required");
-  }
-  if (inv.verb == "release" || inv.verb == "ready" || inv.verb == "access") {
-    for (const std::string& text : ops) {
-      if (!Uuid::parse(text)) return need(false, "not a UUID: '" + text + "'");
-    }
-    return Status();
-  }
-  if (inv.verb == "extension") {
-    if (ops[0] == "consume") return need(ops.size() == 2, "consume takes one TOKEN");
-    return need(ops[0] == "open", "unknown action '" + ops[0] + "' (expected consume or open)");
-  }
-  if (inv.verb == "exclude") {
-    const std::string& action = ops[0];
-    const bool rules = inv.rules.isPresent();
-    if (action == "add") {
-      return need(rules && ops.size() == 1, "add takes rules: -p, -i or --rule");
-    }
-    if (action == "remove") {
-      if (ops.size() == 2) {
-        std::optional<uint64_t> n = ParseCount(ops[1]);
-        return need(!rules && n && *n > 0, "remove takes rules or one number from 'list'");
-      }
-      return need(rules, "remove takes rules or one number from 'list'");
-    }
-    if (action == "list") return need(!rules && ops.size() == 1, "list takes nothing more");
-    return need(false, "unknown action '" + action + "' (expected add, remove or list)");
-  }
-  if (inv.verb == "help" && !ops.empty()) {
-    return need(FindVerb(ops[0]) != nullptr, "no such verb '" + ops[0] + "'");
-  }
-  return Status();
 }
 
-// getopt_long over the verb's options. argv[0] of `args` is the verb.
+// getopt_long over the verb's options, then its operands and checks.
+// argv[0] of `args` is the verb.
 Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Invocation& inv) {
-  std::vector<Option> allowed = spec.options;
-  allowed.push_back(kOptHelp);
   std::string shortOptions = ":";  // ':' first: a missing value is reported as ':'
   std::vector<struct option> longOptions;
   for (const OptionSpec& o : kOptions) {
-    if (std::find(allowed.begin(), allowed.end(), o.id) == allowed.end()) continue;
-    if (o.id < 256) {
-      shortOptions += static_cast<char>(o.id);
-      if (o.hasArgument) shortOptions += ':';
+    if (!spec.takes(o.id)) continue;
+    const bool hasValue = o.takes != Takes::kNothing;
+    if (o.shortName != 0) {
+      shortOptions += o.shortName;
+      if (hasValue) shortOptions += ':';
     }
     longOptions.push_back(
-        {o.longName, o.hasArgument ? required_argument : no_argument, nullptr, o.id});
+        {o.longName, hasValue ? required_argument : no_argument, nullptr, GetoptCode(o)});
   }
   longOptions.push_back({nullptr, 0, nullptr, 0});
 
@@ -364,7 +446,7 @@ Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Inv
   const int argc = static_cast<int>(args.size());
 
   Dictionary rules;
-  std::vector<bool> seen(kOptHost + 1, false);
+  Seen seen;
   const std::string verb = spec.name;
   optind = 0;  // 0 makes GNU getopt start afresh
   opterr = 0;
@@ -374,97 +456,23 @@ Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Inv
     if (c == -1) break;
     if (c == '?' || c == ':') {
       // optind has moved past the element at fault (or its missing value).
-      std::string what = optopt != 0 && optopt < 256 ? std::string("-") + static_cast<char>(optopt)
-                                                     : std::string(argv[optind - 1]);
-      if (size_t eq = what.find('='); what.rfind("--", 0) == 0 && eq != std::string::npos) {
+      std::string what = optopt != 0 && optopt < kLongOnly
+                             ? std::string("-") + static_cast<char>(optopt)
+                             : std::string(argv[optind - 1]);
+      if (size_t eq = what.find('='); what.starts_with("--") && eq != std::string::npos) {
         what.resize(eq);
       }
       return UsageError(
           verb + ": " +
           (c == '?' ? "unknown option '" + what + "'" : "option '" + what + "' needs a value"));
     }
-    seen[c] = true;
-    const std::string value = optarg ? optarg : "";
-    Status s;
-    switch (static_cast<Option>(c)) {
-      case kOptHelp:
-        inv.help = true;
-        break;
-      case kOptPoint:
-        s = AddRule(rules, client::kRuleExtensionPoint, Value(value));
-        break;
-      case kOptIdentifier:
-        if (verb == "elect" || verb == "annotate") {
-          if (!inv.identifier.empty()) return UsageError(verb + ": -i may be given once");
-          inv.identifier = value;
-        } else {
-          s = AddRule(rules, client::kRuleIdentifier, Value(value));
-        }
-        break;
-      case kOptRule: {
-        // KEY=PATTERN takes the text as it is; KEY:=JSON reads a typed
-        // pattern (a number, boolean, list or dictionary).
-        size_t eq = value.find('=');
-        if (eq == std::string::npos) {
-          return UsageError(verb + ": expected --rule KEY=PATTERN or --rule KEY:=JSON");
-        }
-        std::string_view key = std::string_view(value).substr(0, eq);
-        const std::string_view text = std::string_view(value).substr(eq + 1);
-        Value pattern(text);
-        if (!key.empty() && key.back() == ':') {
-          key.remove_suffix(1);
-          Result<Value> typed = FromJson(text);
-          if (!typed) {
-            return UsageError(verb + ": --rule " + std::string(key) + ":=" + std::string(text) +
-                              ": " + typed.error().localizedDescription());
-          }
-          pattern = *typed;
-        }
-        s = AddRule(rules, key, std::move(pattern));
-        break;
-      }
-      case kOptAllVersions:
-        inv.flags |= client::kDiscoverAllVersions;
-        break;
-      case kOptDuplicates:
-        inv.flags |= client::kDiscoverDuplicates | client::kDiscoverAllVersions;
-        break;
-      case kOptAll:
-        inv.flags |= client::kDiscoverAll;
-        break;
-      case kOptHybrid:
-        inv.flags |= client::kDiscoverHybrid;
-        break;
-      case kOptSystemOnly:
-        inv.flags |= client::kDiscoverSystemOnly;
-        break;
-      case kOptVerbose:
-        inv.verbose = true;
-        break;
-      case kOptJson:
-        inv.json = true;
-        break;
-      case kOptApp:
-      case kOptPlugIn:
-        inv.holdTarget =
-            c == kOptApp ? client::HoldTarget::kApplication : client::HoldTarget::kPlugIn;
-        inv.operands.push_back(value);
-        break;
-      case kOptUnset:
-        if (value.empty()) return UsageError(verb + ": --unset needs a key");
-        inv.unset.push_back(value);
-        break;
-      case kOptCount: {
-        std::optional<uint64_t> n = ParseCount(value);
-        if (!n) return UsageError(verb + ": --count needs a number, not '" + value + "'");
-        inv.count = *n;
-        break;
-      }
-      case kOptHost:
-        inv.host = value;
-        break;
-    }
-    if (!s.ok()) return UsageError(verb + ": " + s.error().localizedDescription());
+    // The verb's option with this code (getopt answers only those).
+    const OptionSpec& o = *std::find_if(std::begin(kOptions), std::end(kOptions), [&](auto& a) {
+      return spec.takes(a.id) && GetoptCode(a) == c;
+    });
+    seen.set(static_cast<size_t>(o.id));
+    std::string problem = ApplyOption(o, optarg ? optarg : "", inv, rules);
+    if (!problem.empty()) return UsageError(verb + ": " + problem);
   }
   if (!rules.empty()) inv.rules = Value(std::move(rules));
   if (inv.help) return Status();
@@ -476,7 +484,12 @@ Status ParseVerbOptions(const VerbSpec& spec, std::vector<std::string> args, Inv
     return UsageError(verb + ": unexpected operand '" +
                       std::string(argv[optind + spec.maxOperands]) + "'");
   }
-  return Validate(inv, seen);
+  if (spec.check) {
+    if (std::string problem = spec.check(inv, seen); !problem.empty()) {
+      return UsageError(verb + ": " + problem);
+    }
+  }
+  return Status();
 }
 
 }  // namespace
@@ -492,17 +505,17 @@ Result<Invocation> ParseCommandLine(const std::vector<std::string>& argv) {
       inv.help = true;
     } else if (a == "--version") {
       inv.version = true;
-    } else if (a == "-S" || a == "--service") {
+    } else if (a == kServiceShort || a == kServiceLong) {
       if (++i == argv.size()) return UsageError("option '" + a + "' needs a value");
       inv.service = argv[i];
-    } else if (a.rfind("-S", 0) == 0 && a.size() > 2) {
-      inv.service = a.substr(2);
-    } else if (a.rfind("--service=", 0) == 0) {
-      inv.service = a.substr(10);
+    } else if (a.starts_with(kServiceLongGlued)) {
+      inv.service = a.substr(kServiceLongGlued.size());
+    } else if (a.starts_with(kServiceShort) && a.size() > kServiceShort.size()) {
+      inv.service = a.substr(kServiceShort.size());
     } else if (a == "--") {
       ++i;
       break;
-    } else if (!a.empty() && a[0] == '-') {
+    } else if (a.starts_with("-")) {
       return UsageError("unknown option '" + a + "'");
     } else {
       break;
@@ -522,7 +535,13 @@ Result<Invocation> ParseCommandLine(const std::vector<std::string>& argv) {
   return inv;
 }
 
+VerbHandler HandlerFor(const std::string& verb) {
+  const VerbSpec* spec = FindVerb(verb);
+  return spec ? spec->run : nullptr;
+}
+
 std::string GeneralHelp() {
+  constexpr size_t kSummaryColumn = 11;  // of the verb list, after its indent
   std::string out =
       "Usage: drkit [-S SERVICE] VERB [OPTIONS] [OPERANDS]\n"
       "Talks to drd, the plug-in registry daemon of this user.\n\n"
@@ -536,7 +555,7 @@ std::string GeneralHelp() {
       "Verbs:\n";
   for (const VerbSpec& v : Verbs()) {
     std::string name = v.name;
-    name.resize(std::max<size_t>(name.size() + 1, 11), ' ');
+    name.resize(std::max(name.size() + 1, kSummaryColumn), ' ');
     out += "  " + name + v.summary + "\n";
   }
   out +=
@@ -548,9 +567,9 @@ std::string GeneralHelp() {
 std::string HelpCommandFor(const std::vector<std::string>& argv) {
   for (size_t i = 1; i < argv.size(); ++i) {
     const std::string& a = argv[i];
-    if (a == "-S" || a == "--service") {
+    if (a == kServiceShort || a == kServiceLong) {
       ++i;
-    } else if (a.empty() || a[0] != '-') {
+    } else if (!a.starts_with("-")) {
       return FindVerb(a) ? "drkit help " + a : "drkit help";
     }
   }
@@ -561,11 +580,9 @@ std::vector<VerbDoc> VerbDocs() {
   std::vector<VerbDoc> docs;
   for (const VerbSpec& v : Verbs()) {
     VerbDoc doc{v.name, v.synopsis, v.summary, VerbHelp(v.name), {}};
-    std::vector<Option> allowed = v.options;
-    allowed.push_back(kOptHelp);
     for (const OptionSpec& o : kOptions) {
-      if (std::find(allowed.begin(), allowed.end(), o.id) == allowed.end()) continue;
-      if (o.id < 256) doc.options.push_back(std::string("-") + static_cast<char>(o.id));
+      if (!v.takes(o.id)) continue;
+      if (o.shortName != 0) doc.options.push_back(std::string("-") + o.shortName);
       doc.options.push_back(std::string("--") + o.longName);
     }
     docs.push_back(std::move(doc));
@@ -576,11 +593,8 @@ std::vector<VerbDoc> VerbDocs() {
 std::string VerbHelp(const std::string& verb) {
   const VerbSpec* spec = FindVerb(verb);
   if (!spec) return std::string();
-  std::string details = spec->details;
-  if (size_t at = details.find("$DISCOVERY"); at != std::string::npos) {
-    details.replace(at, 10, kDiscoveryOptionsHelp);
-  }
-  return std::string("Usage: drkit ") + spec->synopsis + "\n" + spec->summary + ".\n\n" + details;
+  return std::string("Usage: drkit ") + spec->synopsis + "\n" + spec->summary + ".\n\n" +
+         spec->details;
 }
 
 }  // namespace dr::drkit

@@ -1,5 +1,6 @@
-// drkit's command line: the table of verbs with their options and help, and
-// the parser that turns argv into one Invocation.
+// drkit's command line: the table of verbs, one row each with its options
+// (and what their values are), operands, help and handler, and the parser
+// that turns argv into one Invocation.
 //
 //   drkit [-S SERVICE] VERB [OPTIONS] [OPERANDS]
 //
@@ -19,6 +20,8 @@
 #include "core/value.h"
 
 namespace dr::drkit {
+
+struct Io;
 
 // Usage errors (kUsageErrorDomain) end drkit with this status.
 inline constexpr const char* kUsageErrorDomain = "drkit.usage";
@@ -52,6 +55,11 @@ struct Invocation {
 // Parses argv (argv[0] is the program's name). Fails with kUsageErrorDomain
 // and a message such as "match: option '-p' needs a value".
 Result<Invocation> ParseCommandLine(const std::vector<std::string>& argv);
+
+// Runs one verb; answers drkit's exit status.
+using VerbHandler = int (*)(const Invocation&, Io&);
+// The handler of a verb; nullptr for an unknown verb.
+VerbHandler HandlerFor(const std::string& verb);
 
 // The general help: synopsis, global options, one line per verb.
 std::string GeneralHelp();

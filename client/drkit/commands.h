@@ -22,23 +22,26 @@ struct Io {
 // `value` as JSON for io.out: indented on a terminal, one line otherwise.
 std::string Json(const Io& io, const Value& value);
 
-// Runs any verb (and help and --version).
+// Runs any verb (and --help and --version) through the verb table.
 int Run(const Invocation& invocation, Io& io);
 
-// The verbs, by group.
+// The verbs' handlers, as the verb table names them.
 int RunMatch(const Invocation& inv, Io& io);
-int RunAddRemove(const Invocation& inv, Io& io);
+int RunAdd(const Invocation& inv, Io& io);
+int RunRemove(const Invocation& inv, Io& io);
 int RunElect(const Invocation& inv, Io& io);
 int RunAnnotate(const Invocation& inv, Io& io);
 int RunHold(const Invocation& inv, Io& io);
 int RunRelease(const Invocation& inv, Io& io);
-int RunReadyAccess(const Invocation& inv, Io& io);
+int RunReady(const Invocation& inv, Io& io);
+int RunAccess(const Invocation& inv, Io& io);
 int RunRaw(const Invocation& inv, Io& io);
 int RunStatus(const Invocation& inv, Io& io);
 int RunExtension(const Invocation& inv, Io& io);
 int RunExclude(const Invocation& inv, Io& io);
 int RunWatch(const Invocation& inv, Io& io);
 int RunExplain(const Invocation& inv, Io& io);
+int RunHelp(const Invocation& inv, Io& io);
 
 // Prints "drkit: <error>" on io.err, and a hint to start drd when its socket
 // is missing or nobody listens on it; answers 1.

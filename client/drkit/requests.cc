@@ -45,6 +45,16 @@ Result<std::vector<PlugIn>> CopiesOf(Client& c, const std::string& identifier) {
   return found;
 }
 
+// add and remove: `change` of the bundles at the operands' paths.
+int ChangeBundles(const Invocation& inv, Io& io,
+                  Status (Client::*change)(const std::vector<std::string>&)) {
+  std::vector<std::string> paths;
+  for (const std::string& p : inv.operands) paths.push_back(AbsolutePath(p));
+  auto c = Connect(inv);
+  Status s = c ? ((**c).*change)(paths) : c.status();
+  return s.ok() ? 0 : Fail(io, s.error());
+}
+
 }  // namespace
 
 std::string AbsolutePath(const std::string& path) {
@@ -94,13 +104,10 @@ int RunMatch(const Invocation& inv, Io& io) {
   return 0;
 }
 
-int RunAddRemove(const Invocation& inv, Io& io) {
-  std::vector<std::string> paths;
-  for (const std::string& p : inv.operands) paths.push_back(AbsolutePath(p));
-  auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
-  Status s = inv.verb == "add" ? (*c)->addPlugIns(paths) : (*c)->removePlugIns(paths);
-  return s.ok() ? 0 : Fail(io, s.error());
+int RunAdd(const Invocation& inv, Io& io) { return ChangeBundles(inv, io, &Client::addPlugIns); }
+
+int RunRemove(const Invocation& inv, Io& io) {
+  return ChangeBundles(inv, io, &Client::removePlugIns);
 }
 
 int RunElect(const Invocation& inv, Io& io) {
@@ -209,19 +216,20 @@ int RunHold(const Invocation& inv, Io& io) {
 
 int RunRelease(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
-  Status s = (*c)->release(ParseUuids(inv.operands));
+  Status s = c ? (*c)->release(ParseUuids(inv.operands)) : c.status();
   return s.ok() ? 0 : Fail(io, s.error());
 }
 
-int RunReadyAccess(const Invocation& inv, Io& io) {
+int RunReady(const Invocation& inv, Io& io) {
+  auto c = Connect(inv);
+  Status s = c ? (*c)->ready(ParseUuids(inv.operands)) : c.status();
+  return s.ok() ? 0 : Fail(io, s.error());
+}
+
+int RunAccess(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
   if (!c) return Fail(io, c.error());
   const std::vector<Uuid> uuids = ParseUuids(inv.operands);
-  if (inv.verb == "ready") {
-    Status s = (*c)->ready(uuids);
-    return s.ok() ? 0 : Fail(io, s.error());
-  }
   Result<std::vector<std::string>> tokens = (*c)->access(uuids);
   if (!tokens) return Fail(io, tokens.error());
   if (inv.json) {
