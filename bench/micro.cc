@@ -13,6 +13,7 @@
 #include <cstring>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -235,6 +236,57 @@ void BM_Drm1Decode(benchmark::State& state, Value body) {
 BENCHMARK_CAPTURE(BM_Drm1Decode, lock_release, LockRelease());
 BENCHMARK_CAPTURE(BM_Drm1Decode, match_100, MatchReply(100))->Unit(benchmark::kMicrosecond);
 BENCHMARK_CAPTURE(BM_Drm1Decode, match_1000, MatchReply(1000))->Unit(benchmark::kMicrosecond);
+
+// What the client library does with W3's reply in bench/load (a "match"
+// without rules listing 1,000 plug-ins of 10 extension points, each
+// form with its signed "extensions" token): a FrameDecoder with the limits of
+// frames from drd, fed in 64 KiB pieces as the socket delivers them.
+std::string W3ReplyFrame() {
+  char pattern[] = "/tmp/drd-micro.XXXXXX";
+  const std::string root = std::filesystem::canonical(::mkdtemp(pattern)).string();
+  std::unique_ptr<dr::CodeSigning> signing =
+      dr::MakeLinuxCodeSigning(dr::ProcessInfo::Default(), dr::FileSystem::Default());
+  std::unique_ptr<dr::Sandbox> sandbox =
+      dr::MakeLinuxSandbox(dr::SandboxOptions{.keyPath = root + "/sandbox.key"}, signing.get());
+  dr::PlugInServices services;
+  services.sandbox = sandbox.get();
+  Array matches;
+  for (int p = 0; p < 10; ++p) {
+    for (int i = 0; i < 100; ++i) {
+      auto record = MakeRecord(p, i, root, services);
+      std::filesystem::create_directories(*record->url());
+      Dictionary form = record->exportForm().dictionary();
+      record->augmentForm(form);
+      matches.push_back(Value(std::move(form)));
+    }
+  }
+  std::filesystem::remove_all(root);
+  return *dr::drm1::EncodeFrame(1, 1, dr::drm1::kFlagIsReply,
+                                Value{{"matches", Value(std::move(matches))}});
+}
+
+void BM_ClientDecodeW3(benchmark::State& state) {
+  static const std::string* recorded = new std::string(W3ReplyFrame());
+  std::string frame = *recorded;
+  dr::drm1::FrameDecoder decoder(dr::drm1::kFromDaemon);
+  uint64_t serial = 0;
+  for (auto _ : state) {
+    ++serial;
+    std::memcpy(frame.data() + 8, &serial, sizeof serial);
+    std::optional<dr::drm1::Frame> got;
+    for (size_t at = 0; at < frame.size() && !got; at += 65536) {
+      decoder.feed(std::string_view(frame).substr(at, 65536));
+      auto next = decoder.next();
+      if (!next) state.SkipWithError("decode failed");
+      if (next && next->has_value()) got = std::move(**next);
+    }
+    if (!got || got->body["matches"].size() != 1000) state.SkipWithError("not 1,000 forms");
+    benchmark::DoNotOptimize(got);
+  }
+  state.SetBytesProcessed(state.iterations() * static_cast<int64_t>(frame.size()));
+  state.counters["frame_bytes"] = static_cast<double>(frame.size());
+}
+BENCHMARK(BM_ClientDecodeW3)->Unit(benchmark::kMicrosecond);
 
 // A body of one dictionary of `count` keys written in ascending or descending
 // order: drd's encoders write the first, a peer may send the second.
