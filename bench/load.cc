@@ -1133,7 +1133,10 @@ int Main(int argc, char** argv) {
     rows.push_back(
         {"W8 " + n8 + " registered (" + std::to_string(z.w8Points) + " points × " +
              std::to_string(z.w8PerPoint) + " in " + std::to_string(z.w8Apps) + " apps)",
-         "\"match\" without rules (reply " + Mib(static_cast<long>(listBytes / 1024)) + ")",
+         "\"match\" without rules (reply " +
+             (listBytes < (1u << 20) ? Fixed(static_cast<double>(listBytes) / 1024, 0) + " KiB"
+                                     : Mib(static_cast<long>(listBytes / 1024))) +
+             ")",
          answered.empty() ? Latency(listMicros) : answered, "", "", "answered in full",
          Verdict(judged, answered.empty())});
     rows.push_back({"", "W2 p50 at this scale", Latency(warm50), "", "", "≤ 1 ms",
