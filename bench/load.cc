@@ -1235,6 +1235,7 @@ int Main(int argc, char** argv) {
   std::printf("drd load figures — %s\n%s\n%s%s\n\n", Today().c_str(), machine.c_str(),
               sizes.c_str(), o.smoke ? " (smoke run: figures not judged)" : "");
   PrintTable(rows);
+  std::fflush(stdout);  // before the temporary folder, which may take a while to remove, goes
   if (!o.results.empty()) WriteResults(o.results, rows, o, machine, sizes);
   return 0;
 }
