@@ -675,12 +675,14 @@ void WriteResults(const std::string& path, const std::vector<Row>& rows, const O
   if (!out.good()) Die("cannot write " + path);
 }
 
-std::string DefaultDrd() {
+// The folder this program is in.
+std::filesystem::path SelfFolder() {
   char self[4096] = {};
   ssize_t n = ::readlink("/proc/self/exe", self, sizeof self - 1);
-  std::filesystem::path p(std::string(self, n > 0 ? static_cast<size_t>(n) : 0));
-  return (p.parent_path().parent_path() / "daemon" / "drd").string();
+  return std::filesystem::path(std::string(self, n > 0 ? static_cast<size_t>(n) : 0)).parent_path();
 }
+
+std::string DefaultDrd() { return (SelfFolder().parent_path() / "daemon" / "drd").string(); }
 
 Options Parse(int argc, char** argv) {
   Options o;
@@ -808,6 +810,12 @@ int Main(int argc, char** argv) {
             *small, canned, dbus, {listAll}, listAll, first,
             [&](std::string_view body) { check(DecodeReply(body, "W3")); }, 1, z.w3Requests,
             z.rounds);
+        if (!o.smoke) {
+          // drd's reply body as it came off the socket, for bench/micro's
+          // BM_ClientDecodeW3 (which reads it beside itself when present).
+          RawClient raw(small->socketFolder(), kServiceName);
+          WriteFile((SelfFolder() / "w3-reply.body").string(), raw.exchange(RequestFrame(listAll)));
+        }
         const double ratio = w3.drd.quantile(0.5) / w3.floor.quantile(0.5);
         const std::string label = "W3 list " + std::to_string(expected) + " (reply " +
                                   Fixed(static_cast<double>(FrameSize(first)) / 1024, 0) + " KiB)";
