@@ -11,6 +11,7 @@
 #include <atomic>
 #include <chrono>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -137,6 +138,53 @@ class EchoServer {
   dr::Value reply_;  // guarded by mu_
   std::atomic<bool> stop_{false};
   std::thread thread_;
+};
+
+// The canned floor: a DRM1 server on a Unix socket at <folder>/<name>, one
+// thread polling every connection, that answers each request with body bytes
+// recorded from drd's own reply to the same request, under the request's
+// serial. It reads only frame headers and looks the request body up as
+// bytes, so it costs what moving drd's reply bytes costs and nothing else.
+class CannedServer {
+ public:
+  CannedServer(std::string folder, std::string name);
+  ~CannedServer();
+  // From now on a request whose body is `request` is answered with `reply`.
+  void record(std::string request, std::string reply);
+  const std::string& folder() const { return folder_; }
+  const std::string& name() const { return name_; }
+
+ private:
+  void run();
+
+  std::string folder_;
+  std::string name_;
+  int listenFd_ = -1;
+  int wakeFd_ = -1;
+  std::mutex mu_;
+  std::map<std::string, std::string, std::less<>> replies_;  // guarded by mu_
+  std::atomic<bool> stop_{false};
+  std::thread thread_;
+};
+
+// A client on the bare DRM1 framing, with no values in its path: it writes
+// a request frame encoded beforehand (under its own next serial) and reads
+// the reply's header and body bytes without decoding the body. Dies when the
+// peer fails, closes or takes over 120 s to answer.
+class RawClient {
+ public:
+  RawClient(const std::string& folder, const std::string& name);
+  ~RawClient();
+  // Sends `frame` (a whole request frame; its serial is replaced) and
+  // answers the reply's body bytes, valid until the next exchange.
+  const std::string& exchange(const std::string& frame);
+
+ private:
+  void readExactly(char* to, size_t size);
+
+  int fd_ = -1;
+  uint64_t serial_ = 0;
+  std::string body_;
 };
 
 // The peer: a private dbus-daemon and an sd-bus echo service on it. A call

@@ -7,11 +7,14 @@
 #include <signal.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
+#include <sys/time.h>
+#include <sys/uio.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <systemd/sd-bus.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstring>
 #include <filesystem>
 #include <map>
@@ -102,6 +105,178 @@ void EchoServer::run() {
     }
   }
   for (const auto& [fd, peer] : peers) ::close(fd);
+}
+
+// ---- Canned floor --------------------------------------------------------------
+
+namespace {
+
+// A listening Unix socket at <folder>/<name>; dies when it cannot be made.
+int Listen(const std::string& folder, const std::string& name) {
+  std::filesystem::create_directories(folder);
+  const std::string path = folder + "/" + name;
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+  if (fd < 0 || ::bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0 ||
+      ::listen(fd, 64) != 0) {
+    Die("cannot listen at " + path);
+  }
+  return fd;
+}
+
+void PutU32(char* at, uint32_t v) {
+  for (int i = 0; i < 4; ++i) at[i] = static_cast<char>(v >> (8 * i));
+}
+
+void PutU64(char* at, uint64_t v) {
+  for (int i = 0; i < 8; ++i) at[i] = static_cast<char>(v >> (8 * i));
+}
+
+// Writes all of `head` and then `body`; false when the peer is gone.
+bool SendBoth(int fd, std::string_view head, std::string_view body) {
+  while (!head.empty() || !body.empty()) {
+    struct iovec io[2] = {{const_cast<char*>(head.data()), head.size()},
+                          {const_cast<char*>(body.data()), body.size()}};
+    struct msghdr m = {};
+    m.msg_iov = head.empty() ? io + 1 : io;
+    m.msg_iovlen = head.empty() ? 1 : 2;
+    ssize_t n = ::sendmsg(fd, &m, MSG_NOSIGNAL);
+    if (n <= 0) return false;
+    size_t sent = static_cast<size_t>(n);
+    const size_t fromHead = std::min(sent, head.size());
+    head.remove_prefix(fromHead);
+    body.remove_prefix(sent - fromHead);
+  }
+  return true;
+}
+
+}  // namespace
+
+CannedServer::CannedServer(std::string folder, std::string name)
+    : folder_(std::move(folder)), name_(std::move(name)) {
+  listenFd_ = Listen(folder_, name_);
+  wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  thread_ = std::thread([this] { run(); });
+}
+
+CannedServer::~CannedServer() {
+  stop_ = true;
+  uint64_t one = 1;
+  (void)!::write(wakeFd_, &one, sizeof one);
+  thread_.join();
+  ::close(listenFd_);
+  ::close(wakeFd_);
+}
+
+void CannedServer::record(std::string request, std::string reply) {
+  std::lock_guard<std::mutex> lock(mu_);
+  replies_[std::move(request)] = std::move(reply);
+}
+
+void CannedServer::run() {
+  struct Peer {
+    std::string in;  // bytes received and not yet answered
+    uint64_t serial = 0;
+  };
+  std::map<int, Peer> peers;
+  std::vector<struct pollfd> fds;
+  char buffer[65536];
+  while (!stop_) {
+    fds.clear();
+    fds.push_back({listenFd_, POLLIN, 0});
+    fds.push_back({wakeFd_, POLLIN, 0});
+    for (const auto& [fd, peer] : peers) fds.push_back({fd, POLLIN, 0});
+    if (::poll(fds.data(), fds.size(), -1) < 0 && errno != EINTR) Die("canned floor poll");
+    if (fds[0].revents & POLLIN) {
+      int fd;
+      while ((fd = ::accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC)) >= 0) peers[fd];
+    }
+    for (size_t i = 2; i < fds.size(); ++i) {
+      if (fds[i].revents == 0) continue;
+      const int fd = fds[i].fd;
+      Peer& peer = peers[fd];
+      ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
+      if (n <= 0) {
+        ::close(fd);
+        peers.erase(fd);
+        continue;
+      }
+      peer.in.append(buffer, static_cast<size_t>(n));
+      size_t at = 0;
+      while (peer.in.size() - at >= dr::drm1::kHeaderSize) {
+        const std::string_view rest = std::string_view(peer.in).substr(at);
+        auto header = dr::drm1::DecodeHeader(rest);
+        if (!header) Die("canned floor: " + header.error().description());
+        if (rest.size() < dr::drm1::kHeaderSize + header->bodyLength) break;
+        const std::string_view body = rest.substr(dr::drm1::kHeaderSize, header->bodyLength);
+        std::lock_guard<std::mutex> lock(mu_);
+        auto reply = replies_.find(body);
+        if (reply == replies_.end()) Die("canned floor: a request with no recorded reply");
+        char head[dr::drm1::kHeaderSize] = {};
+        std::memcpy(head, dr::drm1::kMagic, 4);
+        PutU32(head + 4, static_cast<uint32_t>(reply->second.size()));
+        PutU64(head + 8, ++peer.serial);
+        PutU64(head + 16, header->serial);
+        PutU32(head + 24, dr::drm1::kFlagIsReply);
+        if (!SendBoth(fd, std::string_view(head, sizeof head), reply->second)) break;
+        at += dr::drm1::kHeaderSize + header->bodyLength;
+      }
+      peer.in.erase(0, at);
+    }
+  }
+  for (const auto& [fd, peer] : peers) ::close(fd);
+}
+
+// ---- Raw client ------------------------------------------------------------------
+
+RawClient::RawClient(const std::string& folder, const std::string& name) {
+  const std::string path = folder + "/" + name;
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+  fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd_ < 0 || ::connect(fd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) {
+    Die("cannot connect to " + path);
+  }
+  struct timeval limit = {120, 0};
+  ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+  ::setsockopt(fd_, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
+}
+
+RawClient::~RawClient() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+void RawClient::readExactly(char* to, size_t size) {
+  for (size_t at = 0; at < size;) {
+    ssize_t n = ::recv(fd_, to + at, size - at, 0);
+    if (n <= 0) Die(n == 0 ? "the peer closed a raw connection" : "a raw connection failed");
+    at += static_cast<size_t>(n);
+  }
+}
+
+const std::string& RawClient::exchange(const std::string& frame) {
+  if (frame.size() < dr::drm1::kHeaderSize) Die("a raw request without a header");
+  const uint64_t serial = ++serial_;
+  char head[dr::drm1::kHeaderSize];
+  std::memcpy(head, frame.data(), sizeof head);
+  PutU64(head + 8, serial);
+  if (!SendBoth(fd_, std::string_view(head, sizeof head),
+                std::string_view(frame).substr(dr::drm1::kHeaderSize))) {
+    Die("a raw connection failed to send");
+  }
+  for (;;) {
+    readExactly(head, sizeof head);
+    auto header =
+        dr::drm1::DecodeHeader(std::string_view(head, sizeof head), dr::drm1::kFromDaemon);
+    if (!header) Die("a raw reply: " + header.error().description());
+    body_.resize(header->bodyLength);
+    readExactly(body_.data(), body_.size());
+    // Anything but the reply to this request (a notification) is passed over.
+    if (header->isReply() && header->replyTo == serial) return body_;
+  }
 }
 
 // ---- D-Bus peer ------------------------------------------------------------------

@@ -12,7 +12,9 @@
 
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -235,6 +237,82 @@ void BM_Drm1Decode(benchmark::State& state, Value body) {
 BENCHMARK_CAPTURE(BM_Drm1Decode, lock_release, LockRelease());
 BENCHMARK_CAPTURE(BM_Drm1Decode, match_100, MatchReply(100))->Unit(benchmark::kMicrosecond);
 BENCHMARK_CAPTURE(BM_Drm1Decode, match_1000, MatchReply(1000))->Unit(benchmark::kMicrosecond);
+
+// What the client library does with W3's reply in bench/load (a "match"
+// without rules listing 1,000 plug-ins of 10 extension points, each
+// form with its signed "extensions" token): a FrameDecoder with the limits of
+// frames from drd, fed in 64 KiB pieces as the socket delivers them. The
+// reply is drd's own when bench/load has recorded one beside this program
+// (w3-reply.body, written by a full load run), else one built the same way
+// here.
+std::string BuiltW3Reply() {
+  char pattern[] = "/tmp/drd-micro.XXXXXX";
+  const std::string root = std::filesystem::canonical(::mkdtemp(pattern)).string();
+  std::unique_ptr<dr::CodeSigning> signing =
+      dr::MakeLinuxCodeSigning(dr::ProcessInfo::Default(), dr::FileSystem::Default());
+  std::unique_ptr<dr::Sandbox> sandbox =
+      dr::MakeLinuxSandbox(dr::SandboxOptions{.keyPath = root + "/sandbox.key"}, signing.get());
+  dr::PlugInServices services;
+  services.sandbox = sandbox.get();
+  Array matches;
+  for (int p = 0; p < 10; ++p) {
+    for (int i = 0; i < 100; ++i) {
+      auto record = MakeRecord(p, i, root, services);
+      std::filesystem::create_directories(*record->url());
+      Dictionary form = record->exportForm().dictionary();
+      record->augmentForm(form);
+      matches.push_back(Value(std::move(form)));
+    }
+  }
+  std::filesystem::remove_all(root);
+  return *dr::drm1::EncodeFrame(1, 1, dr::drm1::kFlagIsReply,
+                                Value{{"matches", Value(std::move(matches))}});
+}
+
+// The recorded reply framed as drd sends it, or nothing.
+std::optional<std::string> RecordedW3Reply() {
+  char self[4096] = {};
+  ssize_t n = ::readlink("/proc/self/exe", self, sizeof self - 1);
+  if (n <= 0) return std::nullopt;
+  std::ifstream in(std::filesystem::path(std::string(self, static_cast<size_t>(n))).parent_path() /
+                       "w3-reply.body",
+                   std::ios::binary);
+  std::string body{std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+  if (body.empty()) return std::nullopt;
+  std::string frame(dr::drm1::kHeaderSize, '\0');
+  std::memcpy(frame.data(), dr::drm1::kMagic, 4);
+  const uint32_t length = static_cast<uint32_t>(body.size());
+  const uint64_t replyTo = 1;
+  const uint32_t flags = dr::drm1::kFlagIsReply;
+  std::memcpy(frame.data() + 4, &length, 4);  // little-endian, as on every drd host
+  std::memcpy(frame.data() + 16, &replyTo, 8);
+  std::memcpy(frame.data() + 24, &flags, 4);
+  return frame + body;
+}
+
+void BM_ClientDecodeW3(benchmark::State& state) {
+  static const std::optional<std::string> recorded = RecordedW3Reply();
+  std::string frame = recorded ? *recorded : BuiltW3Reply();
+  dr::drm1::FrameDecoder decoder(dr::drm1::kFromDaemon);
+  uint64_t serial = 0;
+  for (auto _ : state) {
+    ++serial;
+    std::memcpy(frame.data() + 8, &serial, sizeof serial);
+    std::optional<dr::drm1::Frame> got;
+    for (size_t at = 0; at < frame.size() && !got; at += 65536) {
+      decoder.feed(std::string_view(frame).substr(at, 65536));
+      auto next = decoder.next();
+      if (!next) state.SkipWithError("decode failed");
+      if (next && next->has_value()) got = std::move(**next);
+    }
+    if (!got || got->body["matches"].size() != 1000) state.SkipWithError("not 1,000 forms");
+    benchmark::DoNotOptimize(got);
+  }
+  state.SetBytesProcessed(state.iterations() * static_cast<int64_t>(frame.size()));
+  state.counters["frame_bytes"] = static_cast<double>(frame.size());
+  state.counters["drd_recorded"] = recorded ? 1 : 0;
+}
+BENCHMARK(BM_ClientDecodeW3)->Unit(benchmark::kMicrosecond);
 
 // A body of one dictionary of `count` keys written in ascending or descending
 // order: drd's encoders write the first, a peer may send the second.
