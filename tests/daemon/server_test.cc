@@ -1,8 +1,6 @@
 // The server's own decisions, over fake platform services: which uninstalled
-// plug-ins' removals are logged, how holds block and release plug-ins, and
-// which hosts need the discovery workaround.
+// plug-ins' removals are logged, and how holds block and release plug-ins.
 #include "daemon/server.h"
-#include "plugin/discovery.h"
 
 #include <gtest/gtest.h>
 
@@ -37,27 +35,6 @@ Value Info(const std::string& id) {
       {"UXExtension", Value{{"UXExtensionPointIdentifier", "com.example.point"},
                             {"UXExtensionAttributes", Value{{"UXExtensionIdentifier", id},
                                                             {"UXExtensionPointName", "Point"}}}}}};
-}
-
-TEST(WorkaroundTest, OlderListedHostsNeedIt) {
-  struct Row {
-    const char* identifier;
-    const char* version;
-    bool needs;
-  };
-  const Row rows[] = {
-      {"com.corvel.Brivane", "10.1.4", true},     {"com.corvel.Brivane", "9.9", true},
-      {"com.corvel.Brivane", "10.2", false},      {"com.corvel.Brivane", "10.10", false},
-      {"com.corvel.Brivane", "10.2.1", false},    {"com.corvel.BrivaneTrial", "10.1", true},
-      {"com.corvel.Quellor", "4.1.9", true},      {"com.corvel.Quellor", "4.2", false},
-      {"com.corvel.vorelapp", "5.1", true},       {"com.corvel.OdelloApp", "10", true},
-      {"com.corvel.brivane", "1.0", false},       {"com.example.other", "1.0", false},
-      {"com.corvel.BrivaneTrialX", "1.0", false},
-  };
-  for (const Row& row : rows) {
-    EXPECT_EQ(Needs17732150Workaround(row.identifier, row.version), row.needs)
-        << row.identifier << " " << row.version;
-  }
 }
 
 class ServerTest : public ::testing::Test {
@@ -172,55 +149,46 @@ TEST_F(ServerTest, HoldOfAClientThatEndedWhileItsRequestRanIsReleased) {
   EXPECT_TRUE(log.contains("for dead client pid"));
 }
 
+// A second record of the same plug-in counts as the same plug-in; a hold
+// lasts until its own token is released, once.
 TEST_F(ServerTest, HoldsBlockUntilEachIsReleased) {
-  DRDPlugInPtr held = Add("com.example.held");
-  DRDPlugInPtr free = Add("com.example.free");
+  DRDPlugInPtr held = Add("com.example.held"), free = Add("com.example.free");
   ASSERT_TRUE(held && free);
-  // A second record of the same plug-in counts as the same plug-in.
   DRDPlugInPtr twin = DRDPlugIn::initWithRGData(registry_->entryForUuid(*held->uuid()));
-  ASSERT_TRUE(twin);
-  ASSERT_NE(twin.get(), held.get());
-
+  ASSERT_TRUE(twin && twin.get() != held.get());
   const int keepAlive = KeepAliveCount();
   auto first = DRDPlugInHold::initWithPlugInsForClient({held, held}, nullptr);
   auto second = DRDPlugInHold::initWithPlugInsForClient({twin}, nullptr);
   auto empty = DRDPlugInHold::initWithPlugInsForClient({}, nullptr);
   EXPECT_EQ(first->blocked().size(), 1u);
-  const Uuid firstToken = first->uuid(), secondToken = second->uuid(), emptyToken = empty->uuid();
-  server_->addHold(std::move(first));
-  server_->addHold(std::move(second));
-  server_->addHold(std::move(empty));
+  const Uuid tokens[] = {first->uuid(), second->uuid(), empty->uuid()};
+  for (auto* hold : {&first, &second, &empty}) server_->addHold(std::move(*hold));
   EXPECT_EQ(KeepAliveCount(), keepAlive + 3);
-  EXPECT_EQ(notifications_.posted().size(), 3u);
-
-  struct Step {
-    std::optional<Uuid> release;
-    bool heldAfter;
-    size_t logLines;
-  };
-  const Step steps[] = {
-      {std::nullopt, true, 0}, {firstToken, true, 1},   {firstToken, true, 0},
-      {emptyToken, true, 1},   {secondToken, false, 1}, {Uuid::random(), false, 0},
-  };
-  size_t posted = 3;
-  for (const Step& step : steps) {
+  const std::pair<Uuid, bool> steps[] = {// released token, and whether a release is logged
+                                         {tokens[0], true},
+                                         {tokens[0], false},
+                                         {tokens[2], true},
+                                         {tokens[1], true},
+                                         {Uuid::random(), false}};
+  size_t posted = 3, step = 0;
+  EXPECT_TRUE(server_->holdOnPlugIn(*held) && server_->holdOnPlugIn(*twin));
+  for (const auto& [token, logged] : steps) {
+    SCOPED_TRACE(step++);
     ScopedLogCapture log;
-    if (step.release) server_->unholdToken(*step.release);
-    EXPECT_EQ(server_->holdOnPlugIn(*held), step.heldAfter);
-    EXPECT_EQ(server_->holdOnPlugIn(*twin), step.heldAfter);
+    server_->unholdToken(token);
+    const bool heldAfter = step < 4;
+    EXPECT_EQ(server_->holdOnPlugIn(*held), heldAfter);
+    EXPECT_EQ(server_->holdOnPlugIn(*twin), heldAfter);
     EXPECT_FALSE(server_->holdOnPlugIn(*free));
     // Install lines of the registry's event thread may still arrive here.
     std::vector<std::string> releases;
     for (const std::string& line : log.lines()) {
       if (line.starts_with("releasing plug-in hold")) releases.push_back(line);
     }
-    EXPECT_EQ(releases.size(), step.logLines);
-    if (step.logLines && !releases.empty()) {
-      EXPECT_EQ(releases[0],
-                Format("releasing plug-in hold %@ at client's request", *step.release));
-    }
-    posted += step.logLines;
-    EXPECT_EQ(notifications_.posted().size(), posted);
+    EXPECT_EQ(releases, logged ? std::vector<std::string>{Format(
+                                     "releasing plug-in hold %@ at client's request", token)}
+                               : std::vector<std::string>{});
+    EXPECT_EQ(notifications_.posted().size(), posted += logged);
   }
   EXPECT_TRUE(server_->holds().empty());
   EXPECT_EQ(KeepAliveCount(), keepAlive);
