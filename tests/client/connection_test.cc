@@ -58,23 +58,6 @@ class ConnectionTest : public ::testing::Test {
   std::vector<std::pair<uint64_t, bool>> seen_;  // guarded by mu_
 };
 
-// Messages without reply between requests must not shift replies.
-TEST_F(ConnectionTest, EachRequestGetsItsOwnReplyAndSerialsIncrease) {
-  auto connection = Open();
-  ASSERT_TRUE(connection) << connection.error().description();
-  Connection& c = **connection;
-  for (int n = 1; n <= 4; ++n) {
-    ASSERT_TRUE(c.send(Value{{"n", 0}}).ok());
-    EXPECT_EQ(c.request(Value{{"n", n}}, 5s).value_or(Value())["n"], Value(n));
-  }
-  std::lock_guard<std::mutex> lock(mu_);
-  ASSERT_EQ(seen_.size(), 8u);
-  for (size_t i = 0; i < seen_.size(); ++i) {
-    EXPECT_GT(seen_[i].first, i ? seen_[i - 1].first : 0) << i;
-    EXPECT_EQ(seen_[i].second, i % 2 == 1) << i;
-  }
-}
-
 // The late reply to a request that timed out arrives before the next
 // request's reply; it must be skipped, not handed to the wrong caller. A
 // connection the daemon closes fails every call after, and never hangs.

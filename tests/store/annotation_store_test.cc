@@ -244,21 +244,9 @@ TEST_F(AnnotationStoreTest, SavesWriteTheWholeTableOrKeepTheOldFile) {
   EXPECT_EQ(reopened->annotations().size(), 2u);
 }
 
-TEST_F(AnnotationStoreTest, FailedSavesKeepMemoryAndAreRetried) {
-  ASSERT_TRUE(WriteTestFile(folder_ / "plain", "not a folder"));
-  for (const std::string& path : {folder_ / "plain/Annotations", folder_ / "missing/Annotations"}) {
-    auto store = Open(path);
-    ScopedLogCapture log;
-    store->setAnnotationForPlugIn(Value{{"election", 1}}, *Record("com.example.a"));
-    ASSERT_EQ(log.lines().size(), 1u) << path;
-    EXPECT_TRUE(
-        log.lines()[0].starts_with("unable to save annotations:" + path + " error:file error 512"))
-        << log.lines()[0];
-    EXPECT_EQ(store->annotations().size(), 1u);
-  }
-  EXPECT_EQ(ModeOf(folder_ / "missing"), 0u);  // -d never makes folders
-
-  // Without a next change, the retry saves what memory holds.
+// A failed save is retried without a next change, and saves what memory
+// holds. (The reliability tests break the real folder under drd.)
+TEST_F(AnnotationStoreTest, FailedSavesAreRetried) {
   FailingWrites failing;
   retryInterval_ = std::chrono::milliseconds(1);
   auto store = Open(file_, &failing);

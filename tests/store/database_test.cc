@@ -196,19 +196,6 @@ TEST_F(DatabaseTest, InstallAndUninstallEventsLogReportAndEvict) {
   EXPECT_EQ(reports_.reports().back().keys[4].second, "Point");
 }
 
-TEST_F(DatabaseTest, ApplicationsAnswerTheirPlugInsOrNone) {
-  const std::string app = folder_ / "Host.app";
-  MakeBundle(app, Value{{"BNBundleIdentifier", "com.example.host"}});
-  for (const char* name : {"one", "two"}) {
-    ASSERT_FALSE(db_->addPlugIn(MakeBundle(app + "/Contents/PlugIns/" + name + ".appex",
-                                           Info(std::string("com.example.") + name), kSandboxed)));
-  }
-  auto within = db_->plugInsWithinApplication(app);
-  ASSERT_EQ(within.value_or(std::vector<DRDPlugInPtr>{}).size(), 2u);
-  EXPECT_EQ((*within)[0]->containingPath(), app);
-  EXPECT_FALSE(db_->plugInsWithinApplication(folder_ / "Other.app").has_value());
-}
-
 TEST_F(DatabaseTest, InstalledSetIsKeptUntilTheRegistryOrTheCacheChanges) {
   RegistryEntryPtr a = Add("a", Info("com.example.a"));
   Add("open", Info("com.example.open"), Value());  // makes no record
