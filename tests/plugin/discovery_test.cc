@@ -42,15 +42,9 @@ class DiscoveryTest : public PlugInFixture {
   // An internal filter: outside any application and the system volume.
   DRDPlugInPtr filter(int n) {
     RegistryEntry::Fields f;
-    f.uuid = Uuid::random();
-    f.url = registry_test::MakeBundle(
-        folder / ("Effecta/InternalFilters.app/f" + std::to_string(n) + ".appex"), PlugInInfo("f"),
-        Sandboxed());
-    f.plugInIdentifier = "com.example.f.ext";
     f.registrationDate = Date{static_cast<double>(n)};
-    auto files = std::make_shared<RegistryBundleFiles>(pdoc::WriteXml(PlugInInfo("f")).value(),
-                                                       pdoc::WriteXml(Sandboxed()).value());
-    return DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services());
+    std::string path = folder / ("Effecta/InternalFilters.app/f" + std::to_string(n) + ".appex");
+    return DRDPlugIn::initWithRGData(entry(PlugInInfo("f"), Sandboxed(), f, path), services());
   }
   Discovery discovery(uint64_t flags, DiscoveryServices services = {}, bool old = false) {
     DiscoveryHost h;

@@ -36,7 +36,8 @@ TEST_F(PlugInTest, AdmitsOnlySandboxedPlugInsUnlessDataOrEffecta) {
       {PlugInInfo("a", Value{{"UXExtensionProtocol", "#Data"}}), Value(), nullptr},
       {PlugInInfo("a", Value(), kEffecta), Value(), nullptr},
       {PlugInInfo("a", kEffecta), Value(), kUnsandboxed},  // Effecta outside the attributes
-      {noProtocol, Sandboxed(), "missing \"UXExtensionProtocol\" key in Info.pdoc or SDK"},
+      {noProtocol, Sandboxed(),
+       "Dromon error 12: missing \"UXExtensionProtocol\" key in Info.pdoc or SDK"},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.info.description() + " " + row.entitlements.description());
