@@ -16,6 +16,7 @@
 #include "core/log.h"
 #include "daemon/ipc_client.h"
 #include "platform/message_service.h"
+#include "tests/support/drm1_peer.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_services.h"
 #include "tests/support/registry_bundles.h"
@@ -192,6 +193,71 @@ TEST_F(ServerTest, HoldsBlockUntilEachIsReleased) {
   }
   EXPECT_TRUE(server_->holds().empty());
   EXPECT_EQ(KeepAliveCount(), keepAlive);
+}
+
+// The requests' handlers, answered in process over a real socket: each
+// reply's error code and text, in order on one connection (drd's end-to-end
+// tests send the same requests to the real binary).
+TEST_F(ServerTest, RequestsGetTheirReplies) {
+  const std::string a = MakeBundle(folder_ / "a.appex", Info("com.example.a"),
+                                   Value{{"com.corvel.security.app-sandbox", true}});
+  const std::string missing = folder_ / "missing.appex";
+  server_->resume();
+  testing::Drm1Peer peer(folder_ / "sockets/com.example.drd");
+  ASSERT_TRUE(peer.connected());
+  auto request = [](const char* name, Dictionary fields = {}) {
+    fields.insert_or_assign("request", name);
+    fields.insert_or_assign("version", uint64_t{2});
+    return Value(std::move(fields));
+  };
+  auto list = [](std::initializer_list<Value> v) { return Value(Array(v)); };
+  const Value unknown = list({Uuid::random()});
+  ASSERT_FALSE(server_->addPlugIn(a).has_value());
+  const Value mine = list({*server_->findPlugInAtPath(a)->uuid()});
+  struct Row {
+    Value request;
+    uint64_t code;
+    std::string error;
+  } rows[] = {
+      {Value{{"request", "match"}}, 7, "unsupported protocol version 0 (need 2)"},
+      {Value{{"version", uint64_t{2}}}, 4, "invalid request format (missing type)"},
+      {request("Match"), 4, "unrecognized request"},
+      {request("add"), 4, "invalid request format"},
+      {request("add", {{"paths", list({a, "rel/b.appex"})}}), 9,
+       "absolute path required: rel/b.appex"},
+      {request("add", {{"paths", list({missing})}}), 9, "invalid plugin path: " + missing},
+      {request("ready"), 4, "invalid request format (uuid)"},
+      {request("ready", {{"uuids", list({"x"})}}), 4, "invalid request (bad uuid array)"},
+      {request("ready", {{"uuids", unknown}}), 4, "no such plugin (uuid not found)"},
+      {request("access", {{"uuids", unknown}}), 4, "no such plugin (uuid not found)"},
+      {request("match", {{"rules", "x"}}), 4, "invalid request format (bad rules dictionary)"},
+      {request("match",
+               {{"rules", Value{{"UXExtensionPointName", "Point"}}}, {"flags", uint64_t{1}}}),
+       0, ""},
+      {request("annotate"), 4, "invalid request format (bad annotations dictionary)"},
+      {request("annotate", {{"annotations", Value{{"election", "yes"}}}, {"uuids", unknown}}), 4,
+       "invalid request format (annotation election)"},
+      {request("annotate", {{"annotations", Value{{"election", 1}}}, {"uuids", unknown}}), 4,
+       "no such plugin (uuid not found)"},
+      {request("bulk", {{"flags", uint64_t{0x1f}}}), 0, ""},
+      {request("lock", {{"flags", uint64_t{1}}, {"paths", list({missing})}}), 9,
+       "invalid path: " + missing},
+      {request("ready", {{"uuids", mine}}), 0, ""},
+      {request("annotate", {{"annotations", Value{{"election", 1}}}, {"uuids", mine}}), 0, ""},
+      {request("lock", {{"uuids", unknown}}), 0, ""},
+      {request("remove", {{"paths", list({a})}}), 0, ""},
+      {request("remove", {{"paths", list({a})}}), 9, "no plugin at " + a},
+  };
+  uint64_t serial = 0;
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.request.description());
+    ASSERT_TRUE(peer.send(++serial, row.request));
+    std::optional<drm1::Frame> reply = peer.receive();
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(reply->header.replyTo, serial);
+    EXPECT_EQ(reply->body["errorcode"].uintValue(), row.code);
+    EXPECT_EQ(reply->body["error"].stringValue(), row.error);
+  }
 }
 
 }  // namespace

@@ -396,6 +396,8 @@ TEST(DiagnoseTest, NamesWhatIsMissing) {
   };
   const Value point{{"UXExtensionPointIdentifier", "com.example.sdk"}};
   const Value own{{"UXExtensionProtocol", "P"}};
+  Value deep = Empty();  // 62 levels inside the information dictionary
+  for (int i = 1; i < 60; ++i) deep = Value{{"d", deep}};
   // An invalid SDK key skips the defaults; SDK files of odd shapes never
   // crash, and what they break is refused; a protocol of the wrong kind
   // still counts.
@@ -409,6 +411,11 @@ TEST(DiagnoseTest, NamesWhatIsMissing) {
       {"/p/A.appex", point, Ux({{"Multiple", {{"other", Empty()}}}}), protocolMissing},
       {"/p/A.bundle", point, Ux(own.changing("UXExtensionAttributes", "s")), attributesMissing},
       {"/p/A.bundle", point, Ux({{"UXExtensionProtocol", List({"a"})}}), ""},
+      {"/p/A.appex", point, Ux({{"Deep", deep}}),
+       "Info.pdoc and SDK cannot be carried in a reply: it nests deeper than the 61 levels a "
+       "reply can carry"},
+      {"/p/A\xff.appex", point, Value(),
+       "its path or a name is not UTF-8 or holds NUL: \"/p/A\\xFF.appex\""},
   };
   for (const Row& r : rows) {
     SCOPED_TRACE(r.path + (" " + r.pd.description() + " " + r.sdk.description()));

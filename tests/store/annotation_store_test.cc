@@ -248,7 +248,7 @@ TEST_F(AnnotationStoreTest, SavesWriteTheWholeTableOrKeepTheOldFile) {
 // holds. (The reliability tests break the real folder under drd.)
 TEST_F(AnnotationStoreTest, FailedSavesAreRetried) {
   FailingWrites failing;
-  retryInterval_ = std::chrono::milliseconds(1);
+  retryInterval_ = std::chrono::milliseconds(50);
   auto store = Open(file_, &failing);
   ScopedLogCapture log;
   store->setAnnotationForPlugIn(Value{{"election", 1}}, *Record("com.example.c"));

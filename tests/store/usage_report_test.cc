@@ -5,7 +5,9 @@
 
 #include <vector>
 
+#include "platform/file_system.h"
 #include "tests/support/fake_services.h"
+#include "tests/support/process_fixtures.h"
 
 namespace dr {
 namespace {
@@ -48,6 +50,15 @@ TEST(UsageReportTest, ReportsCarryTheFiveKeysInOrder) {
     EXPECT_EQ(keys, kKeys);
     EXPECT_EQ(values, c.expected);
   }
+}
+
+// A report reaches the report file as one line.
+TEST(UsageReportTest, ReportsAreAppendedToTheFile) {
+  testing::TempFolder folder;
+  auto sink = MakeUsageReports({folder / "usage.log"});
+  sendUsageReport(sink.get(), "com.example.x", "2", "p", kUsageEnabled);
+  const std::string line = FileSystem::Default()->readFile(folder / "usage.log").value_or("");
+  EXPECT_TRUE(line.ends_with("\n") && line.find("com.example.x-2") != std::string::npos) << line;
 }
 
 TEST(UsageReportTest, DevelopmentBuildFoldersAreRecognised) {
