@@ -4,24 +4,16 @@
 
 #include <gtest/gtest.h>
 
-#include <sys/socket.h>
-#include <sys/un.h>
-#include <unistd.h>
-
 #include <chrono>
-#include <cstring>
 #include <future>
 #include <thread>
 
 #include "core/log.h"
-#include "daemon/ipc_client.h"
-#include "platform/message_service.h"
 #include "tests/support/drm1_peer.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_services.h"
 #include "tests/support/registry_bundles.h"
 #include "tests/support/test_registry.h"
-#include "wire/drm1.h"
 
 namespace dr {
 namespace {
@@ -124,21 +116,13 @@ TEST_F(ServerTest, HoldOfAClientThatEndedWhileItsRequestRanIsReleased) {
     f.wait();
   };
 
-  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  ASSERT_GE(fd, 0);
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  const std::string socketPath = folder_ / "sockets/com.example.drd";
-  std::strncpy(addr.sun_path, socketPath.c_str(), sizeof addr.sun_path - 1);
-  ASSERT_EQ(::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr), 0);
-  const Value lock{{"request", "lock"},
-                   {"version", uint64_t{2}},
-                   {"flags", uint64_t{1}},
-                   {"paths", Value(Array{Value(app)})}};
-  const std::string frame = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, lock);
-  ASSERT_EQ(::write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  testing::Drm1Peer peer(folder_ / "sockets/com.example.drd");
+  ASSERT_TRUE(peer.send(1, Value{{"request", "lock"},
+                                 {"version", uint64_t{2}},
+                                 {"flags", uint64_t{1}},
+                                 {"paths", Value(Array{Value(app)})}}));
   ASSERT_EQ(reached.get_future().wait_for(5s), std::future_status::ready);
-  ::close(fd);
+  peer.close();
   for (int i = 0; i < 500 && !log.contains("is dead"); ++i) std::this_thread::sleep_for(10ms);
   ASSERT_TRUE(log.contains("is dead"));
 
