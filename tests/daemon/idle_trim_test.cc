@@ -15,60 +15,50 @@ namespace {
 using namespace std::chrono_literals;
 using Clock = std::chrono::steady_clock;
 
-class Counter {
- public:
+struct Counter {
   std::function<void()> trim() {
-    return [this] { count_.fetch_add(1); };
+    return [this] { count.fetch_add(1); };
   }
-  int count() const { return count_.load(); }
-  // Waits (a generous bound, so a slow machine only makes the test slower)
+  // Waits (a generous bound: a slow machine only makes the test slower)
   // until at least `n` trims ran.
   bool waitFor(int n) const {
-    for (auto end = Clock::now() + 10s; Clock::now() < end;) {
-      if (count_.load() >= n) return true;
-      std::this_thread::sleep_for(2ms);
+    for (auto end = Clock::now() + 10s; Clock::now() < end; std::this_thread::sleep_for(2ms)) {
+      if (count.load() >= n) return true;
     }
     return false;
   }
-
- private:
-  std::atomic<int> count_{0};
+  std::atomic<int> count{0};
 };
 
-TEST(IdleTrimmerTest, IdleNeverTrims) {
-  Counter c;
-  IdleTrimmer trimmer(10ms, 50ms, c.trim());
-  std::this_thread::sleep_for(150ms);
-  EXPECT_EQ(c.count(), 0);
-}
-
-TEST(IdleTrimmerTest, OneTrimPerQuietSpellAfterActivity) {
-  Counter c;
+TEST(IdleTrimmerTest, OneTrimPerQuietSpellAfterActivityAndNoneWhileIdle) {
+  Counter idle, c;
+  {
+    IdleTrimmer untouched(10ms, 50ms, idle.trim());
+    std::this_thread::sleep_for(150ms);  // beyond the busy bound too
+  }
+  EXPECT_EQ(idle.count, 0);
   IdleTrimmer trimmer(10ms, 1000ms, c.trim());
   for (int spell = 1; spell <= 3; ++spell) {
-    SCOPED_TRACE(spell);
     for (int i = 0; i < 5; ++i) trimmer.activity();  // a burst trims once
-    ASSERT_TRUE(c.waitFor(spell));
+    ASSERT_TRUE(c.waitFor(spell)) << spell;
     std::this_thread::sleep_for(100ms);  // quiet: no further trim
-    EXPECT_EQ(c.count(), spell);
+    EXPECT_EQ(c.count, spell);
   }
 }
 
 // Activity that never pauses for a whole quiet spell still gets trims, at
-// most about one per busy bound.
+// most about one per busy bound: each needs a quiet spell (50 ms) since it
+// woke, so about 120 activities give a handful, never one per activity.
 TEST(IdleTrimmerTest, ContinuedActivityTrimsWithinTheBusyBound) {
   Counter c;
   IdleTrimmer trimmer(50ms, 100ms, c.trim());
-  const auto end = Clock::now() + 600ms;
   int seenWhileBusy = 0;
-  while (Clock::now() < end) {
+  for (const auto end = Clock::now() + 600ms; Clock::now() < end;) {
     trimmer.activity();
-    seenWhileBusy = c.count();
+    seenWhileBusy = c.count;
     std::this_thread::sleep_for(5ms);
   }
   EXPECT_GE(seenWhileBusy, 1) << "no trim while activity went on";
-  // Each trim needs at least a quiet spell (50 ms) since it woke, so about
-  // 120 activities give a handful of trims, never one per activity.
   EXPECT_LE(seenWhileBusy, 12);
 }
 
@@ -79,7 +69,7 @@ TEST(IdleTrimmerTest, DestroyedWhileAwakeStopsWithoutTrimming) {
     trimmer.activity();
     std::this_thread::sleep_for(20ms);
   }
-  EXPECT_EQ(c.count(), 0);
+  EXPECT_EQ(c.count, 0);
 }
 
 }  // namespace

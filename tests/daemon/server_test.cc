@@ -1,28 +1,19 @@
 // The server's own decisions, over fake platform services: which uninstalled
-// plug-ins' removals are logged, how holds block and release plug-ins, and
-// which hosts need the discovery workaround.
+// plug-ins' removals are logged, and how holds block and release plug-ins.
 #include "daemon/server.h"
-#include "plugin/discovery.h"
 
 #include <gtest/gtest.h>
 
-#include <sys/socket.h>
-#include <sys/un.h>
-#include <unistd.h>
-
 #include <chrono>
-#include <cstring>
 #include <future>
 #include <thread>
 
 #include "core/log.h"
-#include "daemon/ipc_client.h"
-#include "platform/message_service.h"
+#include "tests/support/drm1_peer.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_services.h"
 #include "tests/support/registry_bundles.h"
 #include "tests/support/test_registry.h"
-#include "wire/drm1.h"
 
 namespace dr {
 namespace {
@@ -37,27 +28,6 @@ Value Info(const std::string& id) {
       {"UXExtension", Value{{"UXExtensionPointIdentifier", "com.example.point"},
                             {"UXExtensionAttributes", Value{{"UXExtensionIdentifier", id},
                                                             {"UXExtensionPointName", "Point"}}}}}};
-}
-
-TEST(WorkaroundTest, OlderListedHostsNeedIt) {
-  struct Row {
-    const char* identifier;
-    const char* version;
-    bool needs;
-  };
-  const Row rows[] = {
-      {"com.corvel.Brivane", "10.1.4", true},     {"com.corvel.Brivane", "9.9", true},
-      {"com.corvel.Brivane", "10.2", false},      {"com.corvel.Brivane", "10.10", false},
-      {"com.corvel.Brivane", "10.2.1", false},    {"com.corvel.BrivaneTrial", "10.1", true},
-      {"com.corvel.Quellor", "4.1.9", true},      {"com.corvel.Quellor", "4.2", false},
-      {"com.corvel.vorelapp", "5.1", true},       {"com.corvel.OdelloApp", "10", true},
-      {"com.corvel.brivane", "1.0", false},       {"com.example.other", "1.0", false},
-      {"com.corvel.BrivaneTrialX", "1.0", false},
-  };
-  for (const Row& row : rows) {
-    EXPECT_EQ(Needs17732150Workaround(row.identifier, row.version), row.needs)
-        << row.identifier << " " << row.version;
-  }
 }
 
 class ServerTest : public ::testing::Test {
@@ -146,21 +116,13 @@ TEST_F(ServerTest, HoldOfAClientThatEndedWhileItsRequestRanIsReleased) {
     f.wait();
   };
 
-  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  ASSERT_GE(fd, 0);
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  const std::string socketPath = folder_ / "sockets/com.example.drd";
-  std::strncpy(addr.sun_path, socketPath.c_str(), sizeof addr.sun_path - 1);
-  ASSERT_EQ(::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr), 0);
-  const Value lock{{"request", "lock"},
-                   {"version", uint64_t{2}},
-                   {"flags", uint64_t{1}},
-                   {"paths", Value(Array{Value(app)})}};
-  const std::string frame = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, lock);
-  ASSERT_EQ(::write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  testing::Drm1Peer peer(folder_ / "sockets/com.example.drd");
+  ASSERT_TRUE(peer.send(1, Value{{"request", "lock"},
+                                 {"version", uint64_t{2}},
+                                 {"flags", uint64_t{1}},
+                                 {"paths", Value(Array{Value(app)})}}));
   ASSERT_EQ(reached.get_future().wait_for(5s), std::future_status::ready);
-  ::close(fd);
+  peer.close();
   for (int i = 0; i < 500 && !log.contains("is dead"); ++i) std::this_thread::sleep_for(10ms);
   ASSERT_TRUE(log.contains("is dead"));
 
@@ -172,58 +134,114 @@ TEST_F(ServerTest, HoldOfAClientThatEndedWhileItsRequestRanIsReleased) {
   EXPECT_TRUE(log.contains("for dead client pid"));
 }
 
+// A second record of the same plug-in counts as the same plug-in; a hold
+// lasts until its own token is released, once.
 TEST_F(ServerTest, HoldsBlockUntilEachIsReleased) {
-  DRDPlugInPtr held = Add("com.example.held");
-  DRDPlugInPtr free = Add("com.example.free");
+  DRDPlugInPtr held = Add("com.example.held"), free = Add("com.example.free");
   ASSERT_TRUE(held && free);
-  // A second record of the same plug-in counts as the same plug-in.
   DRDPlugInPtr twin = DRDPlugIn::initWithRGData(registry_->entryForUuid(*held->uuid()));
-  ASSERT_TRUE(twin);
-  ASSERT_NE(twin.get(), held.get());
-
+  ASSERT_TRUE(twin && twin.get() != held.get());
   const int keepAlive = KeepAliveCount();
   auto first = DRDPlugInHold::initWithPlugInsForClient({held, held}, nullptr);
   auto second = DRDPlugInHold::initWithPlugInsForClient({twin}, nullptr);
   auto empty = DRDPlugInHold::initWithPlugInsForClient({}, nullptr);
   EXPECT_EQ(first->blocked().size(), 1u);
-  const Uuid firstToken = first->uuid(), secondToken = second->uuid(), emptyToken = empty->uuid();
-  server_->addHold(std::move(first));
-  server_->addHold(std::move(second));
-  server_->addHold(std::move(empty));
+  const Uuid tokens[] = {first->uuid(), second->uuid(), empty->uuid()};
+  for (auto* hold : {&first, &second, &empty}) server_->addHold(std::move(*hold));
   EXPECT_EQ(KeepAliveCount(), keepAlive + 3);
-  EXPECT_EQ(notifications_.posted().size(), 3u);
-
-  struct Step {
-    std::optional<Uuid> release;
-    bool heldAfter;
-    size_t logLines;
-  };
-  const Step steps[] = {
-      {std::nullopt, true, 0}, {firstToken, true, 1},   {firstToken, true, 0},
-      {emptyToken, true, 1},   {secondToken, false, 1}, {Uuid::random(), false, 0},
-  };
-  size_t posted = 3;
-  for (const Step& step : steps) {
+  const std::pair<Uuid, bool> steps[] = {// released token, and whether a release is logged
+                                         {tokens[0], true},
+                                         {tokens[0], false},
+                                         {tokens[2], true},
+                                         {tokens[1], true},
+                                         {Uuid::random(), false}};
+  size_t posted = 3, step = 0;
+  EXPECT_TRUE(server_->holdOnPlugIn(*held) && server_->holdOnPlugIn(*twin));
+  for (const auto& [token, logged] : steps) {
+    SCOPED_TRACE(step++);
     ScopedLogCapture log;
-    if (step.release) server_->unholdToken(*step.release);
-    EXPECT_EQ(server_->holdOnPlugIn(*held), step.heldAfter);
-    EXPECT_EQ(server_->holdOnPlugIn(*twin), step.heldAfter);
+    server_->unholdToken(token);
+    const bool heldAfter = step < 4;
+    EXPECT_EQ(server_->holdOnPlugIn(*held), heldAfter);
+    EXPECT_EQ(server_->holdOnPlugIn(*twin), heldAfter);
     EXPECT_FALSE(server_->holdOnPlugIn(*free));
     // Install lines of the registry's event thread may still arrive here.
     std::vector<std::string> releases;
     for (const std::string& line : log.lines()) {
       if (line.starts_with("releasing plug-in hold")) releases.push_back(line);
     }
-    EXPECT_EQ(releases.size(), step.logLines);
-    if (step.logLines && !releases.empty()) {
-      EXPECT_EQ(releases[0],
-                Format("releasing plug-in hold %@ at client's request", *step.release));
-    }
-    posted += step.logLines;
-    EXPECT_EQ(notifications_.posted().size(), posted);
+    EXPECT_EQ(releases, logged ? std::vector<std::string>{Format(
+                                     "releasing plug-in hold %@ at client's request", token)}
+                               : std::vector<std::string>{});
+    EXPECT_EQ(notifications_.posted().size(), posted += logged);
   }
   EXPECT_TRUE(server_->holds().empty());
   EXPECT_EQ(KeepAliveCount(), keepAlive);
+}
+
+// The requests' handlers, answered in process over a real socket: each
+// reply's error code and text, in order on one connection (drd's end-to-end
+// tests send the same requests to the real binary).
+TEST_F(ServerTest, RequestsGetTheirReplies) {
+  const std::string a = MakeBundle(folder_ / "a.appex", Info("com.example.a"),
+                                   Value{{"com.corvel.security.app-sandbox", true}});
+  const std::string missing = folder_ / "missing.appex";
+  server_->resume();
+  testing::Drm1Peer peer(folder_ / "sockets/com.example.drd");
+  ASSERT_TRUE(peer.connected());
+  auto request = [](const char* name, Dictionary fields = {}) {
+    fields.insert_or_assign("request", name);
+    fields.insert_or_assign("version", uint64_t{2});
+    return Value(std::move(fields));
+  };
+  auto list = [](std::initializer_list<Value> v) { return Value(Array(v)); };
+  const Value unknown = list({Uuid::random()});
+  ASSERT_TRUE(server_->addPlugIn(a).ok());
+  const Value mine = list({*server_->findPlugInAtPath(a)->uuid()});
+  struct Row {
+    Value request;
+    uint64_t code;
+    std::string error;
+  } rows[] = {
+      {Value{{"request", "match"}}, 7, "unsupported protocol version 0 (need 2)"},
+      {Value{{"version", uint64_t{2}}}, 4, "invalid request format (missing type)"},
+      {request("Match"), 4, "unrecognized request"},
+      {request("add"), 4, "invalid request format"},
+      {request("add", {{"paths", list({a, "rel/b.appex"})}}), 9,
+       "absolute path required: rel/b.appex"},
+      {request("add", {{"paths", list({missing})}}), 9, "invalid plugin path: " + missing},
+      {request("ready"), 4, "invalid request format (uuid)"},
+      {request("ready", {{"uuids", list({"x"})}}), 4, "invalid request (bad uuid array)"},
+      {request("ready", {{"uuids", unknown}}), 4, "no such plugin (uuid not found)"},
+      {request("access", {{"uuids", unknown}}), 4, "no such plugin (uuid not found)"},
+      {request("match", {{"rules", "x"}}), 4, "invalid request format (bad rules dictionary)"},
+      {request("match",
+               {{"rules", Value{{"UXExtensionPointName", "Point"}}}, {"flags", uint64_t{1}}}),
+       0, ""},
+      {request("annotate"), 4, "invalid request format (bad annotations dictionary)"},
+      {request("annotate", {{"annotations", Value{{"election", "yes"}}}, {"uuids", unknown}}), 4,
+       "invalid request format (annotation election)"},
+      {request("annotate", {{"annotations", Value{{"election", 1}}}, {"uuids", unknown}}), 4,
+       "no such plugin (uuid not found)"},
+      {request("bulk", {{"flags", uint64_t{0x1f}}}), 0, ""},
+      {request("lock", {{"flags", uint64_t{1}}, {"paths", list({missing})}}), 9,
+       "invalid path: " + missing},
+      {request("ready", {{"uuids", mine}}), 0, ""},
+      {request("annotate", {{"annotations", Value{{"election", 1}}}, {"uuids", mine}}), 0, ""},
+      {request("lock", {{"uuids", unknown}}), 0, ""},
+      {request("remove", {{"paths", list({a})}}), 0, ""},
+      {request("remove", {{"paths", list({a})}}), 9, "no plugin at " + a},
+  };
+  uint64_t serial = 0;
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.request.description());
+    ASSERT_TRUE(peer.send(++serial, row.request));
+    std::optional<drm1::Frame> reply = peer.receive();
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(reply->header.replyTo, serial);
+    EXPECT_EQ(reply->body["errorcode"].uintValue(), row.code);
+    EXPECT_EQ(reply->body["error"].stringValue(), row.error);
+  }
 }
 
 }  // namespace

@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "core/format.h"
 #include "core/log.h"
 #include "platform/code_signing.h"
 #include "plugin/plugin.h"
@@ -33,47 +34,38 @@ class FakeClient : public PlugInClient {
 
 using AuthorizationTest = PlugInFixture;
 
+// The host's restriction is checked before the plug-in's demand; a demand
+// that is no string demands nothing; any value but false holds it.
 TEST_F(AuthorizationTest, HostRestrictionAndDemandedEntitlement) {
   const char* kAllowed = "com.corvel.developer.dromon.allowedplugins";
-  const char* kDemand = "UXExtensionHostEntitlement";
   const std::string kInvalid = "invalid host restriction entitlement";
   const std::string kOutside = "the host's plug-in entitlement does not allow this plug-in";
+  const std::string kLacks = "the host does not have the \"x\" entitlement";
+  const Value onlyA{{kAllowed, Value{{"UXExtensionIdentifier", "com.example.a.ext"}}}};
+  const Value onlyB{{kAllowed, Value{{"UXExtensionIdentifier", "com.example.b.ext"}}}};
   struct Row {
-    const char* what;
-    Value host;    // the host's entitlements
-    Value demand;  // the plug-in's host entitlement; absent: none
+    Value host, demand;  // the host's entitlements; the plug-in's demand (absent: none)
     std::optional<std::string> refusal;
   };
   const Row rows[] = {
-      {"unrestricted host, open plug-in", Value::EmptyDictionary(), Value(), std::nullopt},
-      {"restriction is an array", Value{{kAllowed, Value::EmptyArray()}}, Value(), kInvalid},
-      {"restriction is a string", Value{{kAllowed, "com.example.a.ext"}}, Value(), kInvalid},
-      {"restriction is false", Value{{kAllowed, false}}, Value(), kInvalid},
-      {"restriction is empty", Value{{kAllowed, Value::EmptyDictionary()}}, Value(), std::nullopt},
-      {"restriction names the plug-in",
-       Value{{kAllowed, Value{{"UXExtensionIdentifier", "com.example.a.ext"}}}}, Value(),
-       std::nullopt},
-      {"restriction names another",
-       Value{{kAllowed, Value{{"UXExtensionIdentifier", "com.example.b.ext"}}}}, Value(), kOutside},
-      {"restriction checked before the demand",
-       Value{{kAllowed, Value{{"UXExtensionIdentifier", "com.example.b.ext"}}}},
-       "host-entitlement-x", kOutside},
-      {"demand not held", Value::EmptyDictionary(), "host-entitlement-x",
-       "the host does not have the \"host-entitlement-x\" entitlement"},
-      {"demand held as false", Value{{"host-entitlement-x", false}}, "host-entitlement-x",
-       "the host does not have the \"host-entitlement-x\" entitlement"},
-      {"demand held", Value{{"host-entitlement-x", true}}, "host-entitlement-x", std::nullopt},
-      {"demand held as a string", Value{{"host-entitlement-x", "NO"}}, "host-entitlement-x",
-       std::nullopt},
-      {"demand that is no string", Value::EmptyDictionary(),
-       Value(Array{Value("host-entitlement-x")}), std::nullopt},
+      {Value::EmptyDictionary(), Value(), std::nullopt},
+      {Value{{kAllowed, Value::EmptyArray()}}, Value(), kInvalid},
+      {Value{{kAllowed, false}}, Value(), kInvalid},
+      {Value{{kAllowed, Value::EmptyDictionary()}}, Value(), std::nullopt},
+      {onlyA, Value(), std::nullopt},
+      {onlyB, Value(), kOutside},
+      {onlyB, "x", kOutside},
+      {Value{{"x", false}}, "x", kLacks},
+      {Value{{"x", true}}, "x", std::nullopt},
+      {Value{{"x", "NO"}}, "x", std::nullopt},
+      {Value::EmptyDictionary(), Value(Array{Value("x")}), std::nullopt},
   };
   for (const Row& row : rows) {
-    SCOPED_TRACE(row.what);
-    Value pd = row.demand.isPresent() ? Value{{kDemand, row.demand}} : Value();
+    Value pd = row.demand.isPresent() ? Value{{"UXExtensionHostEntitlement", row.demand}} : Value();
     auto plugIn = make(PlugInInfo("a", pd));
     ASSERT_TRUE(plugIn);
-    EXPECT_EQ(plugIn->allowForClient(FakeClient(row.host)), row.refusal);
+    EXPECT_EQ(plugIn->allowForClient(FakeClient(row.host)), row.refusal)
+        << row.host.description() << " " << row.demand.description();
   }
 }
 
@@ -98,45 +90,41 @@ class EnableTest : public PlugInFixture {
   std::optional<std::string> testSdk;
 };
 
+// The overlay's variables: the daemon's test SDK folder, then the plug-in's
+// own string variables over it.
 TEST_F(EnableTest, SendsTheServiceOverlayWithTheEnvironment) {
   struct Row {
-    const char* what;
     std::optional<std::string> testSdk;  // the daemon's DRTEST_SDK
     Value ipcService;                    // the bundle's "IPCService"; absent: none
     Value expected;                      // the overlay's "IPCService"
   };
-  const Value kNone = Value::EmptyDictionary();
+  auto env = [](const Value& variables) { return Value{{"EnvironmentVariables", variables}}; };
+  const Value kSdk = env(Value{{"DRTEST_SDK", "/sdk"}});
   const Row rows[] = {
-      {"nothing to pass", std::nullopt, Value(), Value{{"EnvironmentVariables", kNone}}},
-      {"daemon's SDK folder", "/sdk", Value(),
-       Value{{"EnvironmentVariables", Value{{"DRTEST_SDK", "/sdk"}}}}},
-      {"plug-in's variables win", "/sdk",
-       Value{{"EnvironmentVariables", Value{{"DRTEST_SDK", "/own"}, {"A", "1"}}}, {"Other", 5}},
-       Value{{"EnvironmentVariables", Value{{"A", "1"}, {"DRTEST_SDK", "/own"}}}, {"Other", 5}}},
-      {"service that is no dictionary", "/sdk", "junk",
-       Value{{"EnvironmentVariables", Value{{"DRTEST_SDK", "/sdk"}}}}},
-      {"variables that are no dictionary", "/sdk", Value{{"EnvironmentVariables", "junk"}},
-       Value{{"EnvironmentVariables", Value{{"DRTEST_SDK", "/sdk"}}}}},
-      {"variables that are no strings", std::nullopt,
-       Value{{"EnvironmentVariables", Value{{"A", 1}, {"B", "b"}, {"C", Value::EmptyArray()}}}},
-       Value{{"EnvironmentVariables", Value{{"B", "b"}}}}},
+      {std::nullopt, Value(), env(Value::EmptyDictionary())},
+      {"/sdk", Value(), kSdk},
+      {"/sdk", env(Value{{"DRTEST_SDK", "/own"}, {"A", "1"}}).changing("Other", 5),
+       env(Value{{"A", "1"}, {"DRTEST_SDK", "/own"}}).changing("Other", 5)},
+      {"/sdk", "junk", kSdk},
+      {"/sdk", env("junk"), kSdk},
+      {std::nullopt, env(Value{{"A", 1}, {"B", "b"}, {"C", Value::EmptyArray()}}),
+       env(Value{{"B", "b"}})},
   };
-  int n = 0;
+  size_t n = 0;
   for (const Row& row : rows) {
-    SCOPED_TRACE(row.what);
+    SCOPED_TRACE(row.ipcService.description());
     testSdk = row.testSdk;
-    ++n;
     auto plugIn = make(PlugInInfo("a").changing("IPCService", row.ipcService));
     ASSERT_TRUE(plugIn);
     ScopedLogCapture log;
     pid_t pid = ::getpid();  // grants to processes that are gone are dropped
     EXPECT_EQ(plugIn->enableForPid(pid), std::nullopt);
-    EXPECT_EQ(log.lines(),
-              (std::vector<std::string>{"enabling pid=" + std::to_string(pid) +
-                                        " for plug-in com.example.a.ext(2.0) " +
-                                        plugIn->uuid()->string() + " " + *plugIn->url()}));
+    EXPECT_EQ(
+        log.lines(),
+        (std::vector<std::string>{Format("enabling pid=%d for plug-in com.example.a.ext(2.0) %@ %@",
+                                         pid, *plugIn->uuid(), *plugIn->url())}));
     std::vector<ExternalServiceGrant> grants = manager->externalServiceGrants();
-    ASSERT_EQ(grants.size(), static_cast<size_t>(n));
+    ASSERT_EQ(grants.size(), ++n);
     EXPECT_EQ(grants.back().hostPid, pid);
     EXPECT_EQ(grants.back().executablePath, *plugIn->url() + "/Contents/Exec/a");
     EXPECT_EQ(grants.back().overlay,
@@ -144,36 +132,26 @@ TEST_F(EnableTest, SendsTheServiceOverlayWithTheEnvironment) {
   }
 }
 
+// The service manager refuses (the executable cannot be run), or the bundle
+// is gone: an error, its log lines, and no grant.
 TEST_F(EnableTest, RefusalsAreErrorsWithTheirLogLines) {
   auto plugIn = make(PlugInInfo("a"));
   ASSERT_TRUE(plugIn);
   const std::string id = "com.example.a.ext(" + plugIn->uuid()->string() + ")";
   const std::string path = *plugIn->url();
-
-  {  // The service manager refuses: the executable cannot be run.
-    ASSERT_EQ(::chmod((path + "/Contents/Exec/a").c_str(), 0644), 0);
-    ScopedLogCapture log;
-    std::optional<Error> error = plugIn->enableForPid(77);
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain(), "Dromon");
-    EXPECT_EQ(error->code(), 4);
-    EXPECT_EQ(error->ownDescription(), "unable to enable plug-in " + id + " for pid 77");
-    ASSERT_EQ(log.lines().size(), 2u);
-    EXPECT_EQ(log.lines()[1],
-              "ipc error 13 allowing pid 77 to use plug-in com.example.a.ext(2.0) " +
-                  plugIn->uuid()->string() + " at " + path);
-    EXPECT_TRUE(manager->externalServiceGrants().empty());
-  }
-  {  // The bundle is gone.
-    std::filesystem::remove_all(path);
-    ScopedLogCapture log;
-    std::optional<Error> error = plugIn->enableForPid(77);
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->code(), 4);
-    EXPECT_EQ(error->ownDescription(), "cannot obtain executable path for plug-in " + id);
-    EXPECT_EQ(log.lines().size(), 1u);  // "enabling ...", and no service-manager line
-    EXPECT_TRUE(manager->externalServiceGrants().empty());
-  }
+  ASSERT_EQ(::chmod((path + "/Contents/Exec/a").c_str(), 0644), 0);
+  ScopedLogCapture log;
+  EXPECT_EQ(plugIn->enableForPid(77),
+            Error("Dromon", 4, "unable to enable plug-in " + id + " for pid 77"));
+  ASSERT_EQ(log.lines().size(), 2u);
+  EXPECT_EQ(log.lines()[1], "ipc error 13 allowing pid 77 to use plug-in com.example.a.ext(2.0) " +
+                                plugIn->uuid()->string() + " at " + path);
+  std::filesystem::remove_all(path);
+  log.clear();
+  EXPECT_EQ(plugIn->enableForPid(77),
+            Error("Dromon", 4, "cannot obtain executable path for plug-in " + id));
+  EXPECT_EQ(log.lines().size(), 1u);  // "enabling ...", and no service-manager line
+  EXPECT_TRUE(manager->externalServiceGrants().empty());
 }
 
 // Other plug-ins' versions come from the database; here from a table.
@@ -190,71 +168,62 @@ class CheckBusyTest : public PlugInFixture {
   std::map<std::string, std::optional<std::string>> versions;
 };
 
+// Instances of other versions are skipped; one without a version or a
+// record counts; an incomplete one is skipped with a log line.
 TEST_F(CheckBusyTest, FindsTheFirstInstanceOfAPlugInOfThisVersion) {
-  const std::string bundle = "com.example.a";
   auto plugIn = make(PlugInInfo("a"));
   ASSERT_TRUE(plugIn);
   const Uuid self = *plugIn->uuid(), v1 = Uuid::random(), v200 = Uuid::random(),
              none = Uuid::random(), unknown = Uuid::random();
   versions = {{v1.string(), "1.0"}, {v200.string(), "2.00"}, {none.string(), std::nullopt}};
-  auto instance = [&](pid_t pid, Uuid as, std::optional<std::string> path = "/b/A.plugin") {
-    return BusyExtensionInstance{pid, std::move(path), bundle, as};
+  auto at = [&](pid_t pid, Uuid as, std::optional<std::string> path = "/b/A.plugin") {
+    return BusyExtensionInstance{pid, std::move(path), "com.example.a", as};
   };
-  const std::string kIncomplete =
-      "ipc reported incomplete bundle \"com.example.a\" for plug-in com.example.a.ext";
   struct Row {
-    const char* what;
     std::vector<BusyExtensionInstance> instances;
     bool fails;
-    std::optional<pid_t> busy;  // the pid of the answer
+    pid_t busy;  // the pid of the answer; 0: none
     std::optional<std::string> version;
-    std::vector<std::string> lines;
+    const char* line;
   };
   const Row rows[] = {
-      {"nothing running", {}, false, std::nullopt, std::nullopt, {}},
-      {"another version, then this plug-in",
-       {instance(1, v1), instance(2, self)},
-       false,
-       2,
-       "2.0",
-       {}},
-      {"only other versions", {instance(1, v1), instance(2, v200)}, false, std::nullopt, "", {}},
-      {"a plug-in without a version counts", {instance(3, none)}, false, 3, std::nullopt, {}},
-      {"an entry without a record counts", {instance(3, unknown)}, false, 3, std::nullopt, {}},
-      {"incomplete record skipped",
-       {instance(4, self, std::nullopt), instance(5, self)},
+      {{}, false, 0, std::nullopt, nullptr},
+      {{at(1, v1), at(2, self)}, false, 2, "2.0", nullptr},
+      {{at(1, v1), at(2, v200)}, false, 0, "", nullptr},
+      {{at(3, none)}, false, 3, std::nullopt, nullptr},
+      {{at(3, unknown)}, false, 3, std::nullopt, nullptr},
+      {{at(4, self, std::nullopt), at(5, self)},
        false,
        5,
        "2.0",
-       {kIncomplete}},
-      {"listing fails",
-       {instance(6, self)},
+       "ipc reported incomplete bundle \"com.example.a\" for plug-in com.example.a.ext"},
+      {{at(6, self)},
        true,
+       0,
        std::nullopt,
-       std::nullopt,
-       {"ipc failed to report dirty state for \"com.example.a\""}},
+       "ipc failed to report dirty state for \"com.example.a\""},
   };
   for (const Row& row : rows) {
-    SCOPED_TRACE(row.what);
+    SCOPED_TRACE(row.busy);
     serviceManager.instances = row.instances;
     serviceManager.busyError.reset();
     if (row.fails) serviceManager.busyError = PosixError(EIO, "proc");
     serviceManager.busyQueries.clear();
     ScopedLogCapture log;
     std::optional<BusyInstance> busy = plugIn->checkBusy();
-    EXPECT_EQ(busy ? std::optional<pid_t>(busy->pid) : std::nullopt, row.busy);
+    EXPECT_EQ(busy ? busy->pid : 0, row.busy);
     if (busy) {
       EXPECT_EQ(busy->version, row.version);
     }
-    EXPECT_EQ(log.lines(), row.lines);
-    EXPECT_EQ(serviceManager.busyQueries, (std::vector<std::vector<std::string>>{{bundle}}));
+    EXPECT_EQ(log.lines(),
+              row.line ? std::vector<std::string>{row.line} : std::vector<std::string>{});
+    EXPECT_EQ(serviceManager.busyQueries,
+              (std::vector<std::vector<std::string>>{{"com.example.a"}}));
   }
-
   // Without a bundle identifier nothing can be asked.
   auto anonymous = make(PlugInInfo("a").changing("BNBundleIdentifier", Value()));
   ASSERT_TRUE(anonymous);
   serviceManager.busyQueries.clear();
-  serviceManager.instances = {instance(7, self)};
   serviceManager.busyError.reset();
   EXPECT_EQ(anonymous->checkBusy(), std::nullopt);
   EXPECT_TRUE(serviceManager.busyQueries.empty());

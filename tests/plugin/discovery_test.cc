@@ -39,66 +39,71 @@ class DiscoveryTest : public PlugInFixture {
     for (const auto& [k, v] : entitlements.dictionary()) granted[k] = v;
     return make(info, Value(std::move(granted)), std::move(f));
   }
-
-  Discovery discovery(uint64_t flags, DiscoveryServices services = {}) {
+  // An internal filter: outside any application and the system volume.
+  DRDPlugInPtr filter(int n) {
+    RegistryEntry::Fields f;
+    f.registrationDate = Date{static_cast<double>(n)};
+    std::string path = folder / ("Effecta/InternalFilters.app/f" + std::to_string(n) + ".appex");
+    return DRDPlugIn::initWithRGData(entry(PlugInInfo("f"), Sandboxed(), f, path), services());
+  }
+  Discovery discovery(uint64_t flags, DiscoveryServices services = {}, bool old = false) {
     DiscoveryHost h;
     h.client = &host;
+    h.needs17732150Workaround = old;
     return Discovery(h, Value(), flags, Value(), std::move(services));
   }
 
   FakeHost host;
 };
 
+// Newer versions win; then a system copy over an app copy, unless the app
+// copy was registered later; equal times keep the first. Every version
+// (0x1) keeps unequal versions, and with duplicates (0x4) equal ones too.
 TEST_F(DiscoveryTest, DuplicatesOfOneIdentifier) {
   struct Row {
-    const char* what;
     Copy first, second;
     uint64_t flags;
-    const char* returned;  // "first", "second" or "both"
+    const char* returned;  // "first", "second" or "first+second"
   } rows[] = {
-      {"newer version wins", {"1.2", true, 100}, {"1.10", true, 50}, 0, "second"},
-      {"older version loses", {"1.10", true, 50}, {"1.2", true, 100}, 0, "first"},
-      {"system copy beats an app copy", {"1", false, 200}, {"1", true, 100}, 0, "second"},
-      {"later registration wins", {"1", false, 100}, {"1", false, 200}, 0, "second"},
-      {"equal time keeps the first", {"1", false, 100}, {"1", false, 100}, 0, "first"},
-      {"earlier registration loses", {"1", false, 200}, {"1", false, 100}, 0, "first"},
-      {"later app copy beats a system copy", {"1", true, 100}, {"1", false, 200}, 0, "second"},
-      {"all versions keeps both", {"1.2", true, 100}, {"1.10", true, 50}, 0x1, "both"},
-      {"all versions collapses equal ones", {"1", true, 100}, {"1", true, 50}, 0x1, "first"},
-      {"duplicates too keeps equal ones", {"1", true, 100}, {"1", true, 50}, 0x5, "both"},
-      {"duplicates alone changes nothing", {"1", true, 100}, {"1", true, 50}, 0x4, "first"},
+      {{"1.2", true, 100}, {"1.10", true, 50}, 0, "second"},
+      {{"1.10", true, 50}, {"1.2", true, 100}, 0, "first"},
+      {{"1", false, 200}, {"1", true, 100}, 0, "second"},
+      {{"1", false, 100}, {"1", false, 200}, 0, "second"},
+      {{"1", false, 100}, {"1", false, 100}, 0, "first"},
+      {{"1", false, 200}, {"1", false, 100}, 0, "first"},
+      {{"1", true, 100}, {"1", false, 200}, 0, "second"},
+      {{"1.2", true, 100}, {"1.10", true, 50}, 0x1, "first+second"},
+      {{"1", true, 100}, {"1", true, 50}, 0x1, "first"},
+      {{"1", true, 100}, {"1", true, 50}, 0x5, "first+second"},
+      {{"1", true, 100}, {"1", true, 50}, 0x4, "first"},
   };
   for (const Row& row : rows) {
+    SCOPED_TRACE(row.first.version + " " + row.second.version + " " + std::to_string(row.flags));
     Discovery d = discovery(row.flags);
-    DRDPlugInPtr a = copy("p", row.first);
-    DRDPlugInPtr b = copy("p", row.second);
+    DRDPlugInPtr a = copy("p", row.first), b = copy("p", row.second);
     d.examine(a);
     d.examine(b);
-    Value matches = d.finish();
     std::string returned;
+    const Value matches = d.finish();
     for (const Value& form : matches.array()) {
       returned +=
           (returned.empty() ? "" : "+") +
           std::string(form["uuid"].stringValue() == a->uuid()->string() ? "first" : "second");
     }
-    if (returned == "first+second") returned = "both";
-    EXPECT_EQ(returned, row.returned) << row.what;
-    // The copy left out names the one that won.
-    for (const Discovery::Verdict& v : d.verdicts()) {
-      if (v.outcome == DiscoveryOutcome::kSuperseded) {
-        EXPECT_EQ(v.by, v.plugIn == a ? b : a) << row.what;
-      }
+    EXPECT_EQ(returned, row.returned);
+    for (const Discovery::Verdict& v : d.verdicts()) {  // the copy left out names the winner
+      EXPECT_TRUE(v.outcome != DiscoveryOutcome::kSuperseded || v.by == (v.plugIn == a ? b : a));
     }
   }
 }
 
 TEST_F(DiscoveryTest, ReplacementMarksSurviveAVeto) {
-  const Value replaces{{"com.corvel.developer.replace-plugin",
-                        Value(Array{Value("com.example.old.ext"), Value(7)})}};
+  const char* kReplace = "com.corvel.developer.replace-plugin";
   DRDPlugInPtr old = copy("old", {"1", true, 1});
-  DRDPlugInPtr replacer = copy("new", {"1", true, 1}, replaces);
-  DRDPlugInPtr self = copy("self", {"1", true, 1},
-                           Value{{"com.corvel.developer.replace-plugin", "com.example.self.ext"}});
+  DRDPlugInPtr replacer =
+      copy("new", {"1", true, 1},
+           Value{{kReplace, Value(Array{Value("com.example.old.ext"), Value(7)})}});
+  DRDPlugInPtr self = copy("self", {"1", true, 1}, Value{{kReplace, "com.example.self.ext"}});
   DiscoveryServices services;
   // The replacer itself is vetoed; the replaced form still names it.
   services.mayUse = [](const Value& form) {
@@ -115,36 +120,34 @@ TEST_F(DiscoveryTest, ReplacementMarksSurviveAVeto) {
   EXPECT_EQ(d.verdicts()[1].outcome, DiscoveryOutcome::kVetoed);
 }
 
+TEST(WorkaroundTest, OlderListedHostsNeedIt) {
+  const std::pair<const char*, const char*> need[] = {
+      {"com.corvel.Brivane", "10.1.4"},    {"com.corvel.Brivane", "9.9"},
+      {"com.corvel.BrivaneTrial", "10.1"}, {"com.corvel.Quellor", "4.1.9"},
+      {"com.corvel.vorelapp", "5.1"},      {"com.corvel.OdelloApp", "10"}};
+  const std::pair<const char*, const char*> needNot[] = {
+      {"com.corvel.Brivane", "10.2"},     {"com.corvel.Brivane", "10.10"},
+      {"com.corvel.Brivane", "10.2.1"},   {"com.corvel.Quellor", "4.2"},
+      {"com.corvel.brivane", "1.0"},      {"com.example.other", "1.0"},
+      {"com.corvel.BrivaneTrialX", "1.0"}};
+  for (const auto& [id, version] : need)
+    EXPECT_TRUE(Needs17732150Workaround(id, version)) << id << " " << version;
+  for (const auto& [id, version] : needNot)
+    EXPECT_FALSE(Needs17732150Workaround(id, version)) << id << " " << version;
+}
+
+// Only an old host finds an internal filter, and from then on equal copies
+// are all kept when every version is asked for.
 TEST_F(DiscoveryTest, WorkaroundBitStaysSetForLaterCandidates) {
-  // Two copies outside any application and the system volume, one of them
-  // an internal filter: only an old host finds it, and from then on equal
-  // copies are all kept when every version is asked for.
-  auto filter = [&](int n) {
-    RegistryEntry::Fields f;
-    f.uuid = Uuid::random();
-    f.url = registry_test::MakeBundle(
-        folder / ("Effecta/InternalFilters.app/f" + std::to_string(n) + ".appex"), PlugInInfo("f"),
-        Sandboxed());
-    f.plugInIdentifier = "com.example.f.ext";
-    f.registrationDate = Date{static_cast<double>(n)};
-    auto files = std::make_shared<RegistryBundleFiles>(pdoc::WriteXml(PlugInInfo("f")).value(),
-                                                       pdoc::WriteXml(Sandboxed()).value());
-    return DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services());
-  };
   DRDPlugInPtr first = filter(1), second = filter(2);
   ASSERT_TRUE(first && second);
-
   Discovery plain = discovery(0x1);
   plain.examine(first);
   EXPECT_EQ(plain.verdicts()[0].outcome, DiscoveryOutcome::kNotInApplication);
-
-  DiscoveryHost old;
-  old.client = &host;
-  old.needs17732150Workaround = true;
   std::vector<std::string> logged;
   DiscoveryServices services;
   services.log = [&](const std::string& line) { logged.push_back(line); };
-  Discovery d(old, Value(), 0x1, Value(), services);
+  Discovery d = discovery(0x1, services, true);
   d.examine(first);
   d.examine(second);
   EXPECT_EQ(d.flags() & 0x4, 0x4u);
@@ -153,18 +156,10 @@ TEST_F(DiscoveryTest, WorkaroundBitStaysSetForLaterCandidates) {
   EXPECT_NE(logged[0].find("found a 17732150 PlugIn: " + *first->path()), std::string::npos);
 }
 
+// An internal filter that fails the rules comes first: for an old host its
+// visibility check still sets the bit that keeps equal copies below. The
+// chosen candidates must give the same answer, flags and log as all.
 TEST_F(DiscoveryTest, ExaminingTheChosenCandidatesAnswersAsExaminingAll) {
-  // An internal filter that fails the rules comes first: for an old host its
-  // visibility check still sets the bit that keeps equal copies below.
-  RegistryEntry::Fields f;
-  f.uuid = Uuid::random();
-  f.url = registry_test::MakeBundle(folder / "Effecta/InternalFilters.app/f.appex", PlugInInfo("f"),
-                                    Sandboxed());
-  f.plugInIdentifier = "com.example.f.ext";
-  auto files = std::make_shared<RegistryBundleFiles>(pdoc::WriteXml(PlugInInfo("f")).value(),
-                                                     pdoc::WriteXml(Sandboxed()).value());
-  std::vector<DRDPlugInPtr> records{
-      DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services())};
   auto named = [&](const std::string& name, const char* point, double registered) {
     RegistryEntry::Fields g;
     g.registrationDate = Date{registered};
@@ -172,34 +167,34 @@ TEST_F(DiscoveryTest, ExaminingTheChosenCandidatesAnswersAsExaminingAll) {
     return make(PlugInInfo(name, Value(), Value{{"UXExtensionPointName", point}}), Sandboxed(),
                 std::move(g));
   };
-  records.push_back(named("a", "viewer", 1));
-  records.push_back(named("b", "editor", 1));
-  records.push_back(named("a", "viewer", 2));  // the same identifier and version
-  records.push_back(named("c", "viewer", 1));
+  const std::vector<DRDPlugInPtr> records{filter(0), named("a", "viewer", 1),
+                                          named("b", "editor", 1), named("a", "viewer", 2),
+                                          named("c", "viewer", 1)};
   for (const DRDPlugInPtr& r : records) ASSERT_TRUE(r);
   const PlugInSet set(records);
-
+  const Value viewer{{"UXExtensionPointName", "viewer"}};
   struct Row {
-    const char* what;
     Value rules;
     uint64_t flags;
     bool workaround;
   } rows[] = {
-      {"new host", Value{{"UXExtensionPointName", "viewer"}}, 0x1, false},
-      {"old host keeps equal copies", Value{{"UXExtensionPointName", "viewer"}}, 0x1, true},
-      {"old host, newest copy", Value{{"UXExtensionPointName", "viewer"}}, 0, true},
-      {"old host, system only", Value{{"UXExtensionPointName", "=viewer"}}, 0x9, true},
-      {"everything", Value{{"UXExtensionPointName", "editor"}}, message::kDiscoverAll, true},
-      {"rules not indexed", Value{{"UXExtensionPointName", ">=a"}}, 0x1, true},
+      {viewer, 0x1, false},
+      {viewer, 0x1, true},
+      {viewer, 0, true},
+      {Value{{"UXExtensionPointName", "=viewer"}}, 0x9, true},
+      {Value{{"UXExtensionPointName", "editor"}}, message::kDiscoverAll, true},
+      {Value{{"UXExtensionPointName", ">=a"}}, 0x1, true},
   };
   for (const Row& row : rows) {
-    DiscoveryHost h;
-    h.client = &host;
-    h.needs17732150Workaround = row.workaround;
+    SCOPED_TRACE(row.rules.description() + " " + std::to_string(row.flags) +
+                 (row.workaround ? " old" : ""));
     auto run = [&](const std::vector<DRDPlugInPtr>& examined, std::vector<std::string>& logged) {
       DiscoveryServices services;
       services.log = [&](const std::string& line) { logged.push_back(line); };
       services.debug = services.log;
+      DiscoveryHost h;
+      h.client = &host;
+      h.needs17732150Workaround = row.workaround;
       Discovery d(h, row.rules, row.flags, Value(), services);
       for (const DRDPlugInPtr& p : examined) d.examine(p);
       return std::make_pair(d.finish(), d.flags());
@@ -212,13 +207,10 @@ TEST_F(DiscoveryTest, ExaminingTheChosenCandidatesAnswersAsExaminingAll) {
       for (uint32_t i : *chosen) some.push_back(records[i]);
     }
     std::vector<std::string> allLogged, someLogged;
-    auto all = run(records, allLogged);
-    auto picked = run(some, someLogged);
-    EXPECT_EQ(picked.first, all.first) << row.what;
-    EXPECT_EQ(picked.second, all.second) << row.what;
-    EXPECT_EQ(someLogged, allLogged) << row.what;
-    if (std::string(row.what) == "old host keeps equal copies") {
-      EXPECT_EQ(all.first.size(), 3u);  // both copies of "a", and "c"
+    EXPECT_EQ(run(some, someLogged), run(records, allLogged));
+    EXPECT_EQ(someLogged, allLogged);
+    if (row.workaround && row.flags == 0x1 && row.rules == viewer) {
+      EXPECT_EQ(run(records, allLogged).first.size(), 3u);  // both copies of "a", and "c"
       EXPECT_LT(some.size(), records.size());
     }
   }

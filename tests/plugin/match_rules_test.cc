@@ -59,110 +59,112 @@ class MatchRulesTest : public PlugInFixture {
   std::shared_ptr<DRDPlugIn> plugIn;
 };
 
+// Entitlement keys consult only the entitlement; then the identifier, UUID,
+// attributes and bundle information; a key the plug-in lacks fails all but
+// false; array values match on any string element; "?" introduces a type
+// operator; a dictionary pattern is an activation rule.
 TEST_F(MatchRulesTest, EveryKeyPatternAndOperator) {
+  struct Text {
+    const char *key, *pattern;
+    bool matches;
+  };
+  const Text texts[] = {{"ENTITLEMENT:ent.string", "NO", true},
+                        {"ENTITLEMENT:Version", "10.10", false},
+                        {"UXExtensionIdentifier", "com.example.a.ext", true},
+                        {"UXExtensionIdentifier", "com.example.A.ext", false},
+                        {"OnlyInBundle", "bundle-value", true},
+                        {"Name", "BundleName", false},
+                        {"UXExtensionVersion", ">=2", true},
+                        {"dot.key", "dotted", true},
+                        {"Missing", "<>", false},
+                        {"EqX", "==x", true},
+                        {"EqX", "=x", false},
+                        {"Tags", "b", true},
+                        {"Tags", "c", false},
+                        {"NoTags", "a", false},
+                        {"Mixed", "x", true},
+                        {"Mixed", "7", false},
+                        {"Zero", "0", false},
+                        {"One", "1", false},
+                        {"Dict", "v", false},
+                        {"Bytes", "x", false},
+                        {"Type", "?UT-CONFORMS:org.example.picture", true},
+                        {"Type", "?UT-CONFORMS:org.example.photo", true},
+                        {"Super", "?UT-CONFORMS:org.example.photo", false},
+                        {"Super", "?UT-IS:org.example.photo", true},
+                        {"Type", "?UT-IS:org.example.picture", false},
+                        {"Type", "?UT-CONFORMS:", false},
+                        {"Tags", "?UT-CONFORMS:b", true},
+                        {"Type", "?", false},
+                        {"Type", "?UT-LIKE:x", false},
+                        {"Type", "?ut-is:org.example.photo", false},
+                        {"Name", "=?UT-IS:Photo", false}};
+  // Keys against true and false, in that order ('1': match).
+  const std::pair<const char*, const char*> flags[] = {
+      {"ENTITLEMENT:com.corvel.security.app-sandbox", "1-"},
+      {"ENTITLEMENT:ent.string", "10"},
+      {"ENTITLEMENT:ent.false", "01"},
+      {"ENTITLEMENT:ent.zero", "-1"},
+      {"ENTITLEMENT:ent.array", "1-"},
+      {"ENTITLEMENT:Version", "-1"},
+      {"ENTITLEMENT:", "0-"},
+      {"entitlement:com.corvel.security.app-sandbox", "0-"},
+      {"dot", "-1"},
+      {"Missing", "01"},
+      {"Empty", "1-"},
+      {"Tags", "10"},
+      {"NoTags", "10"},
+      {"Zero", "01"},
+      {"One", "1-"},
+      {"Dict", "1-"}};
   const std::string uuid = plugIn->uuid()->string();
   std::string lower = uuid;
   for (char& c : lower) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-  struct Row {
-    const char* key;
-    Value pattern;
-    bool matches;
-  };
-  const Row rows[] = {
-      // Entitlement keys consult only the entitlement.
-      {"ENTITLEMENT:com.corvel.security.app-sandbox", true, true},
-      {"ENTITLEMENT:ent.string", true, true},
-      {"ENTITLEMENT:ent.string", false, false},
-      {"ENTITLEMENT:ent.string", "NO", true},
-      {"ENTITLEMENT:ent.false", true, false},
-      {"ENTITLEMENT:ent.false", false, true},
-      {"ENTITLEMENT:ent.zero", false, true},
-      {"ENTITLEMENT:ent.array", true, true},
-      {"ENTITLEMENT:Version", false, true},
-      {"ENTITLEMENT:Version", "10.10", false},
-      {"ENTITLEMENT:", true, false},
-      {"entitlement:com.corvel.security.app-sandbox", true, false},
-      // Identifier, UUID, attributes, then bundle information; no paths.
-      {"UXExtensionIdentifier", "com.example.a.ext", true},
-      {"UXExtensionIdentifier", "com.example.A.ext", false},
-      {"UXExtensionIdentifier", Strings({"com.example.x", "com.example.a.ext"}), true},
-      {"com.corvel.uuid", uuid.c_str(), true},
-      {"com.corvel.uuid", lower.c_str(), false},
-      {"OnlyInBundle", "bundle-value", true},
-      {"Name", "BundleName", false},
-      {"UXExtensionVersion", ">=2", true},
-      {"dot.key", "dotted", true},
-      {"dot", false, true},
-      // A key the plug-in lacks fails all but false.
-      {"Missing", false, true},
-      {"Missing", true, false},
-      {"Missing", "<>", false},
-      {"Missing", Strings({"x"}), false},
-      {"Missing", Value{{"org.example.photo", 1}}, false},
-      // An empty string is present; operator characters in the operand.
-      {"Empty", true, true},
-      {"EqX", "==x", true},
-      {"EqX", "=x", false},
-      // Array values: any string element.
-      {"Tags", "b", true},
-      {"Tags", "c", false},
-      {"Tags", Strings({"c", "a"}), true},
-      {"Tags", true, true},
-      {"Tags", false, false},
-      {"NoTags", "a", false},
-      {"NoTags", Strings({"a"}), false},
-      {"NoTags", true, true},
-      {"NoTags", false, false},
-      {"Mixed", "x", true},
-      {"Mixed", "7", false},
-      // Number, dictionary and data values.
-      {"Zero", true, false},
-      {"Zero", false, true},
-      {"Zero", "0", false},
-      {"One", true, true},
-      {"One", "1", false},
-      {"One", 2, false},
-      {"Dict", "v", false},
-      {"Dict", true, true},
-      {"Bytes", "x", false},
-      // Patterns of other types.
-      {"Name", 1.0, true},
-      {"Name", 0, false},
-      {"Name", 2, false},
-      {"Name", 0.5, false},
-      {"Name", Date{0}, false},
-      {"Name", Data{'P'}, false},
-      {"Name", *plugIn->uuid(), false},
-      {"Name", Value::EmptyArray(), false},
-      {"Name", Value(Array{Value(1), Value(true)}), false},
-      {"Name", Value(Array{Strings({"Photo"})}), false},
-      {"Name", Strings({"", "Photo"}), true},
-      // Type operators.
-      {"Type", "?UT-CONFORMS:org.example.picture", true},
-      {"Type", "?UT-CONFORMS:org.example.photo", true},
-      {"Super", "?UT-CONFORMS:org.example.photo", false},
-      {"Super", "?UT-IS:org.example.photo", true},
-      {"Type", "?UT-IS:org.example.picture", false},
-      {"Type", "?UT-CONFORMS:", false},
-      {"Tags", "?UT-CONFORMS:b", true},
-      {"Type", "?", false},
-      {"Type", "?UT-LIKE:x", false},
-      {"Type", "?ut-is:org.example.photo", false},
-      {"Name", "=?UT-IS:Photo", false},
-      // Activation rules.
-      {"Rule", Value{{"org.example.photo", 2}}, true},
-      {"Rule", Value{{"org.example.photo", 3}}, false},
-      {"Rule", Value{{"org.example.other", 1}}, false},
-      {"Rule", Value{{"org.example.other", 0}}, true},
-      {"Rule", Value::EmptyDictionary(), true},
-      {"RuleTrue", Value{{"org.example.other", 9}}, true},
-      {"Name", Value{{"Photo", 1}}, false},
-      {"Tags", Value{{"a", 1}}, false},
-  };
+  const std::pair<const char*, Value> others[] = {
+      {"com.corvel.uuid", uuid},
+      {"com.corvel.uuid", lower},
+      {"UXExtensionIdentifier", Strings({"com.example.x", "com.example.a.ext"})},
+      {"Missing", Strings({"x"})},
+      {"Missing", Value{{"org.example.photo", 1}}},
+      {"Tags", Strings({"c", "a"})},
+      {"NoTags", Strings({"a"})},
+      {"One", 2},
+      {"Name", 1.0},
+      {"Name", 0},
+      {"Name", 2},
+      {"Name", 0.5},
+      {"Name", Date{0}},
+      {"Name", Data{'P'}},
+      {"Name", *plugIn->uuid()},
+      {"Name", Value::EmptyArray()},
+      {"Name", Value(Array{Value(1), Value(true)})},
+      {"Name", Value(Array{Strings({"Photo"})})},
+      {"Name", Strings({"", "Photo"})},
+      {"Rule", Value{{"org.example.photo", 2}}},
+      {"Rule", Value{{"org.example.photo", 3}}},
+      {"Rule", Value{{"org.example.other", 1}}},
+      {"Rule", Value{{"org.example.other", 0}}},
+      {"Rule", Value::EmptyDictionary()},
+      {"RuleTrue", Value{{"org.example.other", 9}}},
+      {"Name", Value{{"Photo", 1}}},
+      {"Tags", Value{{"a", 1}}}};
+  const char* othersMatch = "101001001000000000110011100";
+  ASSERT_EQ(std::string(othersMatch).size(), std::size(others));
   ScopedLogCapture quiet;
-  for (const Row& row : rows) {
-    SCOPED_TRACE(std::string(row.key) + " " + row.pattern.description());
-    EXPECT_EQ(plugIn->match(Value{{row.key, row.pattern}}), row.matches);
+  for (const Text& row : texts) {
+    EXPECT_EQ(plugIn->match(Value{{row.key, row.pattern}}), row.matches)
+        << row.key << " " << row.pattern;
+  }
+  for (const auto& [key, answers] : flags) {
+    for (int i = 0; i < 2; ++i) {
+      if (answers[i] == '-') continue;
+      EXPECT_EQ(plugIn->match(Value{{key, i == 0}}), answers[i] == '1') << key << " " << (i == 0);
+    }
+  }
+  for (size_t i = 0; i < std::size(others); ++i) {
+    const auto& [key, pattern] = others[i];
+    EXPECT_EQ(plugIn->match(Value{{key, pattern}}), othersMatch[i] == '1')
+        << key << " " << pattern.description();
   }
 
   // Each comparison operator against an operand the value sorts after, is

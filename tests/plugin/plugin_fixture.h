@@ -46,24 +46,18 @@ class PlugInFixture : public ::testing::Test {
   PlugInFixture() { serviceManager.sdks.insert_or_assign(kPoint, Value::EmptyDictionary()); }
 
   // Lays out a new bundle (info, entitlements, and the executable that
-  // "BNBundleExecutable" names) and answers its path.
-  std::string makeBundle(const Value& info, const Value& entitlements = Value()) {
-    std::string path = folder / ("p" + std::to_string(++bundles_) + "/A.plugin");
-    registry_test::MakeBundle(path, info, entitlements);
+  // "BNBundleExecutable" names) and answers the registry entry of its one
+  // plug-in; `f` gives the fields beyond the bundle's files.
+  RegistryEntryPtr entry(const Value& info, const Value& entitlements = Value(),
+                         RegistryEntry::Fields f = {}, std::string path = "") {
+    f.uuid = Uuid::random();
+    f.url = path.empty() ? folder / ("p" + std::to_string(++bundles_) + "/A.plugin") : path;
+    registry_test::MakeBundle(f.url, info, entitlements);
     if (auto exe = info["BNBundleExecutable"].string()) {
-      std::string exePath = path + "/Contents/Exec/" + std::string(*exe);
+      std::string exePath = f.url + "/Contents/Exec/" + std::string(*exe);
       registry_test::WriteBytes(exePath, "#!/bin/sh\n");
       EXPECT_EQ(::chmod(exePath.c_str(), 0755), 0);
     }
-    return path;
-  }
-
-  // The registry entry of a new bundle's one plug-in; `f` gives the fields
-  // beyond the bundle's files.
-  RegistryEntryPtr entry(const Value& info, const Value& entitlements = Value(),
-                         RegistryEntry::Fields f = {}) {
-    f.uuid = Uuid::random();
-    f.url = makeBundle(info, entitlements);
     f.plugInIdentifier =
         info["UXExtension"]["UXExtensionAttributes"]["UXExtensionIdentifier"].stringValue();
     if (f.plugInIdentifier.empty()) f.plugInIdentifier = info["BNBundleIdentifier"].stringValue();

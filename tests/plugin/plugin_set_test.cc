@@ -20,10 +20,10 @@ constexpr const char* kNotAscii = "v\u00efewer";
 constexpr const char* kArabicIndic11 = "\u0661.\u0661";  // "1.1" in Arabic-Indic digits
 
 TEST(VersionEqualityKeyTest, EqualKeysExactlyWhenTheComparisonSaysEqual) {
-  const char* texts[] = {"",     "0",    "00",    "000",  "1",      "01",     "001",  "10",
-                         "1.1",  "1.01", "01.01", "1.10", "1.1.0",  "v1",     "v01",  "V1",
-                         "a0b",  "a00b", "a0",    "a",    "viewer", "Viewer", "1a2",  "01a02",
-                         "1 .1", "1.",   ".1",    "0.1",  "00.1",   "100",    "0100", "0a"};
+  const char* texts[] = {"",     "0",     "00",   "1",     "01",  "10",    "1.1",
+                         "1.01", "01.01", "1.10", "1.1.0", "v1",  "v01",   "V1",
+                         "a0b",  "a00b",  "a0",   "a",     "1a2", "01a02", "1 .1",
+                         "1.",   ".1",    "0.1",  "00.1",  "100", "0100",  "0a"};
   for (const char* a : texts) {
     for (const char* b : texts) {
       EXPECT_EQ(*VersionEqualityKey(a) == *VersionEqualityKey(b), compareVersionString(a, b) == 0)
@@ -40,20 +40,18 @@ class PlugInSetTest : public PlugInFixture {
   // One record per row of values for "UXExtensionPointName" (in the
   // attributes, or in the bundle's information dictionary).
   void SetUp() override {
-    const Value values[] = {
-        Value("viewer"),
-        Value("Viewer"),
-        Value("1.1"),
-        Value("1.01"),
-        Value(Array{Value("editor"), Value("viewer"), Value("=viewer")}),
-        Value(Array{Value("x"), Value(3)}),
-        Value(3),
-        Value(),                // none
-        Value(kArabicIndic11),  // compares equal to "1.1"
-        Value(Array{Value(kNotAscii), Value("editor")}),
-        Value(true),
-        Value(""),
-    };
+    const Value values[] = {"viewer",
+                            "Viewer",
+                            "1.1",
+                            "1.01",
+                            Value(Array{Value("editor"), Value("viewer"), Value("=viewer")}),
+                            Value(Array{Value("x"), Value(3)}),
+                            3,
+                            Value(),
+                            kArabicIndic11,
+                            Value(Array{Value(kNotAscii), Value("editor")}),
+                            true,
+                            ""};
     int n = 0;
     for (const Value& v : values) {
       Value attrs = v.isPresent() ? Value{{"UXExtensionPointName", v}} : Value();
@@ -69,53 +67,52 @@ class PlugInSetTest : public PlugInFixture {
 
 TEST_F(PlugInSetTest, SelectsEveryRecordTheRulesMatch) {
   const std::string point = "UXExtensionPointName";
+  auto list = [](std::initializer_list<Value> v) { return Value(Array(v)); };
+  // Plain names, the equality operator, equal versions (in any script), and
+  // arrays of them, also beside other rules, narrow; ordering and type
+  // operators, activation rules, patterns not ASCII and no rules do not.
   struct Row {
-    const char* what;
     Value rules;
     bool narrows;  // whether the index is used (else every record is evaluated)
   } rows[] = {
-      {"plain name", Value{{point, "viewer"}}, true},
-      {"equality operator", Value{{point, "=viewer"}}, true},
-      {"leading zeros", Value{{point, "1.001"}}, true},
-      {"ASCII pattern meets a value in another script", Value{{point, "1.1"}}, true},
-      {"empty pattern", Value{{point, ""}}, true},
-      {"no record has it", Value{{point, "nothing"}}, true},
-      {"array of names, other elements skipped",
-       Value{{point, Value(Array{Value("editor"), Value(3), Value("x")})}}, true},
-      {"empty array", Value{{point, Value(Array{})}}, true},
-      {"two rules", Value{{point, "viewer"}, {"UXExtensionIdentifier", "com.example.p0.ext"}},
-       true},
-      {"entitlement rule", Value{{"ENTITLEMENT:com.corvel.security.app-sandbox", "1"}}, true},
-      {"one equality rule among others",
-       Value{{point, "viewer"}, {"BNBundleVersion", ">=1"}, {"Missing", false}}, true},
-      {"ordering operator", Value{{point, "<>viewer"}}, false},
-      {"at least", Value{{point, ">=1"}}, false},
-      {"array with an operator", Value{{point, Value(Array{Value("viewer"), Value("<2")})}}, false},
-      {"pattern not ASCII", Value{{point, kNotAscii}}, false},
-      {"true", Value{{point, true}}, false},
-      {"false", Value{{point, false}}, false},
-      {"number", Value{{point, 3}}, false},
-      {"type operator logs", Value{{point, "viewer"}, {"Other", "?UT-CONFORMS:x"}}, false},
-      {"type operator in an array",
-       Value{{point, Value(Array{Value("viewer"), Value("?UT-IS:x")})}}, false},
-      {"activation rule", Value{{point, "viewer"}, {"Other", Value{{"a", 1}}}}, false},
-      {"no rules", Value::EmptyDictionary(), false},
-      {"absent rules", Value(), false},
+      {Value{{point, "viewer"}}, true},
+      {Value{{point, "=viewer"}}, true},
+      {Value{{point, "1.001"}}, true},
+      {Value{{point, "1.1"}}, true},
+      {Value{{point, ""}}, true},
+      {Value{{point, "nothing"}}, true},
+      {Value{{point, list({"editor", 3, "x"})}}, true},
+      {Value{{point, list({})}}, true},
+      {Value{{point, "viewer"}, {"UXExtensionIdentifier", "com.example.p0.ext"}}, true},
+      {Value{{"ENTITLEMENT:com.corvel.security.app-sandbox", "1"}}, true},
+      {Value{{point, "viewer"}, {"BNBundleVersion", ">=1"}, {"Missing", false}}, true},
+      {Value{{point, "<>viewer"}}, false},
+      {Value{{point, list({"viewer", "<2"})}}, false},
+      {Value{{point, kNotAscii}}, false},
+      {Value{{point, true}}, false},
+      {Value{{point, false}}, false},
+      {Value{{point, 3}}, false},
+      {Value{{point, "viewer"}, {"Other", "?UT-CONFORMS:x"}}, false},
+      {Value{{point, list({"viewer", "?UT-IS:x"})}}, false},
+      {Value{{point, "viewer"}, {"Other", Value{{"a", 1}}}}, false},
+      {Value::EmptyDictionary(), false},
+      {Value(), false},
   };
   PlugInSet set(records);
   for (const Row& row : rows) {
     std::optional<std::vector<uint32_t>> chosen = set.mayMatch(row.rules);
-    EXPECT_EQ(chosen.has_value(), row.narrows) << row.what;
+    EXPECT_EQ(chosen.has_value(), row.narrows) << row.rules.description();
     if (!chosen) continue;
-    EXPECT_TRUE(std::is_sorted(chosen->begin(), chosen->end())) << row.what;
-    EXPECT_EQ(std::adjacent_find(chosen->begin(), chosen->end()), chosen->end()) << row.what;
+    EXPECT_TRUE(std::is_sorted(chosen->begin(), chosen->end())) << row.rules.description();
+    EXPECT_EQ(std::adjacent_find(chosen->begin(), chosen->end()), chosen->end())
+        << row.rules.description();
     for (uint32_t i = 0; i < records.size(); ++i) {
       const bool selected = std::binary_search(chosen->begin(), chosen->end(), i);
       if (records[i]->match(row.rules)) {
-        EXPECT_TRUE(selected) << row.what << ": record " << i;
+        EXPECT_TRUE(selected) << row.rules.description() << ": record " << i;
       }
     }
-    EXPECT_LT(chosen->size(), records.size()) << row.what;
+    EXPECT_LT(chosen->size(), records.size()) << row.rules.description();
   }
   // The values that are not ASCII are always evaluated; the one in another
   // script does match.

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <tuple>
 
 #include "platform/file_system.h"
 
@@ -19,37 +20,28 @@ using testing::FakeCodeSigning;
 using testing::TempFolder;
 using testing::WriteTestFile;
 
+// A bundle gone, its folder swapped for a link to elsewhere, or a path that
+// leaves the registered bundle: no token, and the error says why.
 TEST(ExtensionIssuingTest, IssuesReadTokensWithinTheRegisteredBundleOnly) {
   TempFolder folder;
-  SandboxOptions options;
-  options.keyPath = folder / "run/sandbox.key";
+  SandboxOptions options{.keyPath = folder / "run/sandbox.key"};
   FakeCodeSigning signing;
   auto sandbox = MakeLinuxSandbox(options, &signing);
-
   const std::string root = CanonicalPath(folder / ".").value_or("");
-  const std::string bundle = root + "/Ünïcode Plug-in.appex";
+  const std::string bundle = root + "/\u00dcn\u00efcode Plug-in.appex";
   ASSERT_TRUE(WriteTestFile(bundle + "/Contents/Info.pdoc", "{}"));
   Result<std::string> token = issueReadExtensionForURL(sandbox.get(), bundle + "/", bundle);
   ASSERT_TRUE(token.ok());
-  EXPECT_EQ(token->find('\0'), std::string::npos);
   EXPECT_EQ(consumeExtension(*token, options).value_or(""), bundle);
-
-  // A bundle gone, or its folder swapped for a link to elsewhere: no token.
-  const std::string gone = root + "/gone.appex";
-  const std::string swapped = root + "/swapped.appex";
+  EXPECT_EQ(token->find('\0'), std::string::npos);
+  const std::string gone = root + "/gone.appex", swapped = root + "/swapped.appex";
   ASSERT_EQ(::symlink(root.c_str(), swapped.c_str()), 0);
-  const struct {
-    std::string path, registered;
-    int errnum;
-  } refused[] = {
-      {gone, gone, ENOENT},
-      {swapped, swapped, EACCES},
-      {bundle + "/..", bundle, EACCES},
-  };
-  for (const auto& row : refused) {
-    Result<std::string> refusal = issueReadExtensionForURL(sandbox.get(), row.path, row.registered);
-    ASSERT_FALSE(refusal.ok()) << row.path;
-    EXPECT_EQ(refusal.error().code(), row.errnum) << row.path;
+  const std::tuple<std::string, std::string, int> refused[] = {
+      {gone, gone, ENOENT}, {swapped, swapped, EACCES}, {bundle + "/..", bundle, EACCES}};
+  for (const auto& [path, registered, errnum] : refused) {
+    Result<std::string> refusal = issueReadExtensionForURL(sandbox.get(), path, registered);
+    ASSERT_FALSE(refusal.ok()) << path;
+    EXPECT_EQ(refusal.error().code(), errnum) << path;
   }
 }
 

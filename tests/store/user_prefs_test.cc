@@ -17,63 +17,51 @@ using testing::WriteTestFile;
 
 class UserPrefsTest : public ::testing::Test {
  protected:
-  UserPrefsTest()
-      : options_{folder_ / "config/dromon", "0123abcd"},
-        preferences_(MakeFilePreferences(options_)),
-        prefs_(preferences_.get()) {
-    EXPECT_TRUE(FileSystem::Default()->makeDirectories(options_.directory + "/ByHost").ok());
+  void SetUp() override {
+    ASSERT_TRUE(FileSystem::Default()->makeDirectories(options_.directory + "/ByHost").ok());
   }
-
-  std::string hostFile() const {
-    return options_.directory + "/ByHost/com.corvel.dromon.userprefs.0123abcd.pdoc";
-  }
-
   TempFolder folder_;
-  PreferencesOptions options_;
-  std::unique_ptr<Preferences> preferences_;
-  DRDUserPrefs prefs_;
+  PreferencesOptions options_{folder_ / "config/dromon", "0123abcd"};
+  const std::string hostFile_ =
+      options_.directory + "/ByHost/com.corvel.dromon.userprefs.0123abcd.pdoc";
+  std::unique_ptr<Preferences> preferences_ = MakeFilePreferences(options_);
+  DRDUserPrefs prefs_{preferences_.get()};
 };
 
-const Value kRules = Value(Array{Value{{"UXExtensionIdentifier", Value("com.example.hidden")}}});
-
+// Preferences for any host, or for another host, are not this host's; a
+// change (by another process) is seen at the next read, whatever its kind.
 TEST_F(UserPrefsTest, OnlyThisHostsFileIsReadAndChangesAreSeenAtTheNextRead) {
-  // Preferences for any host, or for another host, are not this host's.
+  const Value rules = Value(Array{Value{{"UXExtensionIdentifier", "com.example.hidden"}}});
   for (const char* name :
        {"/com.corvel.dromon.userprefs.pdoc", "/ByHost/com.corvel.dromon.userprefs.ffff.pdoc"}) {
-    ASSERT_TRUE(pdoc::WriteFile(options_.directory + name, Value{{"exclusions", kRules}}).ok());
+    ASSERT_TRUE(pdoc::WriteFile(options_.directory + name, Value{{"exclusions", rules}}).ok());
   }
   EXPECT_TRUE(prefs_.exclusions().isAbsent());
   pid_t pid = ::fork();
   ASSERT_GE(pid, 0);
-  if (pid == 0) ::_exit(pdoc::WriteFile(hostFile(), Value{{"exclusions", kRules}}).ok() ? 0 : 1);
+  if (pid == 0) ::_exit(pdoc::WriteFile(hostFile_, Value{{"exclusions", rules}}).ok() ? 0 : 1);
   int status;
   ASSERT_EQ(::waitpid(pid, &status, 0), pid);
   ASSERT_EQ(WEXITSTATUS(status), 0);
-  EXPECT_EQ(prefs_.exclusions(), kRules);
-  // Replaced by something that is not an array: answered as it is.
-  ASSERT_TRUE(pdoc::WriteFile(hostFile(), Value{{"exclusions", Value("odd")}}).ok());
+  EXPECT_EQ(prefs_.exclusions(), rules);
+  ASSERT_TRUE(pdoc::WriteFile(hostFile_, Value{{"exclusions", Value("odd")}}).ok());
   EXPECT_EQ(prefs_.exclusions(), Value("odd"));
 }
 
 TEST_F(UserPrefsTest, BrokenFileReadsAsNoExclusionsAndIsLoggedOnce) {
-  ScopedLogCapture log;
   for (const char* bytes : {"<pdoc><dict><key>exclusions", "[1, 2]"}) {
-    SCOPED_TRACE(bytes);
-    log.clear();
-    ASSERT_TRUE(WriteTestFile(hostFile(), bytes));
-    EXPECT_TRUE(prefs_.exclusions().isAbsent());
-    EXPECT_TRUE(prefs_.exclusions().isAbsent());
-    EXPECT_EQ(log.lines().size(), 1u);
-    EXPECT_TRUE(log.contains(hostFile()));
+    ScopedLogCapture log;
+    ASSERT_TRUE(WriteTestFile(hostFile_, bytes));
+    EXPECT_TRUE(prefs_.exclusions().isAbsent() && prefs_.exclusions().isAbsent()) << bytes;
+    ASSERT_EQ(log.lines().size(), 1u) << bytes;
+    EXPECT_TRUE(log.contains(hostFile_));
   }
 }
 
 TEST(PreferencesOptionsTest, LocationsComeFromTheEnvironment) {
   const char* xdg = "/cfg";
-  auto env = [&](const char* name) -> const char* {
-    return std::string(name) == "HOME"              ? "/home/u"
-           : std::string(name) == "XDG_CONFIG_HOME" ? xdg
-                                                    : nullptr;
+  auto env = [&](std::string_view name) -> const char* {
+    return name == "HOME" ? "/home/u" : name == "XDG_CONFIG_HOME" ? xdg : nullptr;
   };
   PreferencesOptions options = PreferencesOptionsFromEnvironment(env);
   EXPECT_EQ(options.directory, "/cfg/dromon");
