@@ -472,12 +472,23 @@ TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
 }
 
 // Runs `sql` on its own connection to `path`; answers sqlite3_exec's code.
-int RunSql(const std::string& path, const char* sql) {
+// `out` gets the first column of the last row a statement answered.
+int RunSql(const std::string& path, const char* sql, int64_t* out = nullptr) {
   sqlite3* db = nullptr;
   int rc = sqlite3_open(path.c_str(), &db);
-  if (rc == SQLITE_OK) rc = sqlite3_exec(db, sql, nullptr, nullptr, nullptr);
+  auto keep = [](void* to, int, char** values, char**) {
+    if (to && values[0]) *static_cast<int64_t*>(to) = std::stoll(values[0]);
+    return 0;
+  };
+  if (rc == SQLITE_OK) rc = sqlite3_exec(db, sql, keep, out, nullptr);
   sqlite3_close(db);
   return rc;
+}
+
+// The one integer `sql` answers on the database at `path`, or -1.
+int64_t QueryInt(const std::string& path, const char* sql) {
+  int64_t out = -1;
+  return RunSql(path, sql, &out) == SQLITE_OK ? out : -1;
 }
 
 TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
@@ -524,20 +535,6 @@ TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
     EXPECT_NE(text.find(row.text), std::string::npos) << text;
     EXPECT_EQ(ReadBytes(DatabasePath()), damaged);
   }
-}
-
-// Runs a query that answers one integer on the database at `path`.
-int64_t QueryInt(const std::string& path, const char* sql) {
-  sqlite3* db = nullptr;
-  sqlite3_stmt* s = nullptr;
-  int64_t out = -1;
-  if (sqlite3_open(path.c_str(), &db) == SQLITE_OK &&
-      sqlite3_prepare_v2(db, sql, -1, &s, nullptr) == SQLITE_OK && sqlite3_step(s) == SQLITE_ROW) {
-    out = sqlite3_column_int64(s, 0);
-  }
-  sqlite3_finalize(s);
-  sqlite3_close(db);
-  return out;
 }
 
 // What each stored bundle's bytes parse to, by path.
