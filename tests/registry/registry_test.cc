@@ -98,8 +98,8 @@ class RegistryTest : public ::testing::Test {
     return std::move(*r);
   }
 
-  // Reopens `registry` and expects every entry recorded as it was.
-  void ExpectKeptAcrossReopening(std::unique_ptr<Registry>& registry) {
+  // Expects `registry` to hold the entries `before`, each recorded as it was.
+  void ExpectEntries(Registry& registry, const RegistryEntries& before) {
     auto recorded = [](const RegistryEntry& e) {
       return std::make_tuple(e.uuid(), e.url(), e.plugInIdentifier(), e.multiple(),
                              e.bundleIdentifier(), e.bundleVersion(), e.registrationDate(),
@@ -107,15 +107,18 @@ class RegistryTest : public ::testing::Test {
                              e.shortName(), e.infoDictionary(), e.plugInDictionary(),
                              e.entitlements());
     };
-    const RegistryEntries before = registry->allEntries();
-    registry.reset();
-    registry = Open();
-    ASSERT_EQ(registry->allEntries().size(), before.size());
+    ASSERT_EQ(UuidsOf(registry.allEntries()), UuidsOf(before));
     for (const RegistryEntryPtr& e : before) {
-      RegistryEntryPtr again = registry->entryForUuid(e->uuid());
+      RegistryEntryPtr again = registry.entryForUuid(e->uuid());
       ASSERT_NE(again, nullptr) << e->description();
       EXPECT_TRUE(recorded(*again) == recorded(*e)) << e->description();
     }
+  }
+  void ExpectKeptAcrossReopening(std::unique_ptr<Registry>& registry) {
+    const RegistryEntries before = registry->allEntries();
+    registry.reset();
+    registry = Open();
+    ExpectEntries(*registry, before);
   }
 
   // `registry` with a new Recorder subscribed.
@@ -171,15 +174,12 @@ TEST_F(RegistryTest, RegistersOneEntryPerPlugInNamedAsDeclaredAndKeepsItInPrivat
     ASSERT_EQ(entries.size(), row.sections.size());
     for (size_t i = 0; i < entries.size(); ++i) {
       const RegistryEntry& e = *entries[i];
-      EXPECT_EQ(e.plugInDictionary(), row.sections[i]);
-      EXPECT_EQ(e.multiple(), row.multiple);
-      EXPECT_EQ(e.url(), path);
-      EXPECT_EQ(e.infoDictionary(), row.info);
-      EXPECT_EQ(e.entitlements(), entitlements);
-      EXPECT_EQ(e.bundleIdentifier(), "com.x.bundle");
-      EXPECT_EQ(e.bundleVersion(), "7");
-      EXPECT_EQ(e.displayName(), "N");
-      EXPECT_EQ(e.shortName(), "S");
+      EXPECT_TRUE(std::forward_as_tuple(e.plugInDictionary(), e.multiple(), e.url(),
+                                        e.infoDictionary(), e.entitlements(), e.bundleIdentifier(),
+                                        e.bundleVersion(), e.displayName(), e.shortName()) ==
+                  std::make_tuple(row.sections[i], row.multiple, path, row.info, entitlements,
+                                  "com.x.bundle", "7", "N", "S"))
+          << e.description();
       EXPECT_GE(e.registrationDate().seconds, before - 1);
       EXPECT_LE(e.registrationDate().seconds, before + 60);
       EXPECT_EQ(registry->entryForUuid(e.uuid()), entries[i]);
@@ -596,15 +596,7 @@ TEST_F(RegistryTest, DatabaseOfTheFirstSchemaOpensWithTheSameEntriesAndGainsPars
   ASSERT_NE(registry, nullptr);
   EXPECT_EQ(QueryInt(DatabasePath(), "PRAGMA user_version"), 3);
   EXPECT_EQ(QueryInt(DatabasePath(), "SELECT count(*) FROM bundles WHERE parsed IS NULL"), 0);
-  ASSERT_EQ(UuidsOf(registry->allEntries()), UuidsOf(before));
-  for (const RegistryEntryPtr& e : before) {
-    SCOPED_TRACE(e->description());
-    RegistryEntryPtr again = registry->entryForUuid(e->uuid());
-    EXPECT_EQ(again->infoDictionary(), e->infoDictionary());
-    EXPECT_EQ(again->plugInDictionary(), e->plugInDictionary());
-    EXPECT_EQ(again->entitlements(), e->entitlements());
-    EXPECT_EQ(again->displayName(), e->displayName());
-  }
+  ExpectEntries(*registry, before);
   ExpectKeptAcrossReopening(registry);
 }
 

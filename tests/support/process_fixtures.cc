@@ -22,10 +22,16 @@ TempFolder::TempFolder() {
     std::perror("mkdtemp");
     std::abort();
   }
+  path_ = std::filesystem::canonical(path_).string();
 }
 
 TempFolder::~TempFolder() {
   std::error_code ec;
+  // Every folder writable again first, in case a test took rights away.
+  for (const auto& e : std::filesystem::recursive_directory_iterator(path_, ec)) {
+    std::filesystem::permissions(e.path(), std::filesystem::perms::owner_all,
+                                 std::filesystem::perm_options::add, ec);
+  }
   std::filesystem::remove_all(path_, ec);
 }
 

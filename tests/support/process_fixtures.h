@@ -6,19 +6,23 @@
 #include <sys/types.h>
 
 #include <string>
+#include <string_view>
 
 namespace dr::testing {
 
 class TempFolder {
  public:
-  TempFolder();  // under $TMPDIR (else /tmp); aborts the test binary if it cannot
+  // Under $TMPDIR (else /tmp); aborts the test binary if it cannot.
+  TempFolder();
   ~TempFolder();
   TempFolder(const TempFolder&) = delete;
   TempFolder& operator=(const TempFolder&) = delete;
 
-  const std::string& path() const { return path_; }
+  const std::string& path() const { return path_; }  // canonical
   // path() + "/" + relative
-  std::string operator/(const std::string& relative) const { return path_ + "/" + relative; }
+  std::string operator/(std::string_view relative) const {
+    return path_ + "/" + std::string(relative);
+  }
 
  private:
   std::string path_;
