@@ -1,7 +1,6 @@
 #include "platform/message_service.h"
 
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -16,11 +15,13 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <future>
 #include <thread>
 #include <vector>
 
 #include "core/log.h"
+#include "tests/support/drm1_peer.h"
 #include "tests/support/process_fixtures.h"
 #include "tests/support/stand_in_listener.h"
 
@@ -28,62 +29,47 @@ namespace dr {
 namespace {
 
 using namespace std::chrono_literals;
+using Peer = testing::Drm1Peer;
 
-// A blocking test peer speaking DRM1 on a real socket.
-class Peer {
- public:
-  explicit Peer(const std::string& path) {
-    fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-    connected_ = ::connect(fd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) == 0;
+// Polls `done` until it holds or `timeout` passes; answers its last value.
+bool WaitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout = 5s) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!done() && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(10ms);
   }
-  ~Peer() { ::close(fd_); }
-  bool connected() const { return connected_; }
-  int fd() const { return fd_; }
+  return done();
+}
 
-  void sendRaw(const std::string& bytes) {
-    ASSERT_EQ(::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL),
-              static_cast<ssize_t>(bytes.size()));
-  }
-  void sendRequest(uint64_t serial, const Value& body) {
-    sendRaw(*drm1::EncodeFrame(serial, 0, drm1::kFlagWantsReply, body));
-  }
-  // The next frame, or nothing on EOF, error or timeout.
-  std::optional<drm1::Frame> receive(std::chrono::milliseconds timeout = 5s) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
-      Result<std::optional<drm1::Frame>> f = decoder_.next();
-      if (!f) return std::nullopt;
-      if (f->has_value()) return std::move(**f);
-      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      struct pollfd p = {fd_, POLLIN, 0};
-      if (left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
-        return std::nullopt;
-      }
-      char buf[65536];
-      ssize_t n = ::recv(fd_, buf, sizeof buf, 0);
-      if (n <= 0) {
-        eof_ = true;
-        return std::nullopt;
-      }
-      decoder_.feed(std::string_view(buf, static_cast<size_t>(n)));
+// A child process that opens `n` connections to `path` and keeps them open
+// until killed; answers its pid once all are made.
+pid_t ConnectFromAnotherProcess(const std::string& path, int n) {
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+  int ready[2];
+  if (::pipe(ready) != 0) return -1;
+  pid_t child = ::fork();
+  if (child == 0) {  // system calls only: the parent has threads running
+    for (int i = 0; i < n; ++i) {
+      int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) ::_exit(2);
     }
+    char byte = 1;
+    if (::write(ready[1], &byte, 1) != 1) ::_exit(3);
+    ::pause();
+    ::_exit(0);
   }
-  bool sawEof() {
-    while (!eof_ && receive(2s)) {
-    }
-    return eof_;
-  }
+  ::close(ready[1]);
+  char byte = 0;
+  if (::read(ready[0], &byte, 1) != 1) child = -1;
+  ::close(ready[0]);
+  return child;
+}
 
- private:
-  int fd_ = -1;
-  bool connected_ = false;
-  bool eof_ = false;
-  drm1::FrameDecoder decoder_{drm1::kFromDaemon};
-};
+void Kill(pid_t child) {
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
+}
 
 class MessageServiceTest : public ::testing::Test {
  protected:
@@ -111,6 +97,16 @@ class MessageServiceTest : public ::testing::Test {
         context_);
   }
 
+  // Sends request `serial` and expects its echo.
+  void ExpectEcho(Peer& peer, uint64_t serial) {
+    ASSERT_TRUE(peer.send(serial, Value{{"n", serial}}));
+    std::optional<drm1::Frame> reply = peer.receive();
+    ASSERT_TRUE(reply) << serial;
+    EXPECT_TRUE(reply->header.isReply());
+    EXPECT_EQ(reply->header.replyTo, serial);
+    EXPECT_EQ(reply->body, (Value{{"n", serial}, {"echo", true}}));
+  }
+
   testing::TempFolder folder_;
   ListenerOptions options_;
   SerialQueue queue_{"ipc"};
@@ -127,10 +123,9 @@ TEST_F(MessageServiceTest, AnswersEachRequestWithOneBoundReplyInOrder) {
 
   Peer peer(listener->path());
   ASSERT_TRUE(peer.connected());
-  for (uint64_t serial : {5, 6, 9}) peer.sendRequest(serial, Value{{"n", serial}});
-  // A message that wants no reply gets none.
-  peer.sendRaw(*drm1::EncodeFrame(10, 0, 0, Value{{"n", 10}}));
-  peer.sendRequest(11, Value{{"n", 11}});
+  for (uint64_t serial : {5, 6, 9}) peer.send(serial, Value{{"n", serial}});
+  peer.send(10, Value{{"n", 10}}, /*wantsReply=*/false);  // gets no reply
+  peer.send(11, Value{{"n", 11}});
   uint64_t lastSerial = 0;
   for (uint64_t expected : {5, 6, 9, 11}) {
     std::optional<drm1::Frame> reply = peer.receive();
@@ -164,9 +159,7 @@ TEST_F(MessageServiceTest, MessagesHoldTheirConnectionsBudgetUntilLetGo) {
       context_);
   ASSERT_TRUE(listener);
   Peer peer(listener->path());
-  for (uint64_t serial = 1; serial <= 100; ++serial) {
-    peer.sendRaw(*drm1::EncodeFrame(serial, 0, 0, Value{{"n", serial}}));
-  }
+  for (uint64_t serial = 1; serial <= 100; ++serial) peer.send(serial, Value{{"n", serial}}, false);
   constexpr size_t kLimit = PeerConnection::kMaxMessagesInFlight;
   std::unique_lock<std::mutex> lock(held->mu);
   auto& messages = held->messages;
@@ -177,72 +170,52 @@ TEST_F(MessageServiceTest, MessagesHoldTheirConnectionsBudgetUntilLetGo) {
   EXPECT_EQ(messages.back().serial, kLimit + 1);
 }
 
-TEST_F(MessageServiceTest, ProtocolErrorClosesOnlyThatConnectionAndReleasesItsContext) {
-  auto listener = EchoListener();
-  ASSERT_TRUE(listener);
-  ScopedLogCapture log;
-  Peer good(listener->path()), bad(listener->path());
-  good.sendRequest(1, Value{{"a", 1}});
-  ASSERT_TRUE(good.receive());
-  bad.sendRaw("DRM2" + std::string(28, '\0'));
-  EXPECT_TRUE(bad.sawEof());
-  good.sendRequest(2, Value{{"a", 2}});
-  std::optional<drm1::Frame> reply = good.receive();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->header.replyTo, 2u);
-  EXPECT_TRUE(log.contains("protocol error on <connection"));
-  EXPECT_TRUE(log.contains("bad magic"));
-
-  // Each connection that ends delivers one connection-invalid event and then
-  // lets go of its context; the good connection still holds its own.
-  for (int i = 0; i < 200 && (*invalid_ < 1 || context_.use_count() > 2); ++i) {
-    std::this_thread::sleep_for(10ms);
-  }
-  EXPECT_EQ(*invalid_, 1);
-  EXPECT_EQ(context_.use_count(), 2);
-}
-
 // Connections one after another are read by the loop that served earlier
 // ones: nothing a connection left behind (a cut frame, a protocol error, an
-// unanswered request) may reach the next one, and each still ends with its
-// one connection-invalid event and lets go of its context.
-TEST_F(MessageServiceTest, ConnectionsOneAfterAnotherStartClean) {
+// unanswered request) may reach the next one or a connection beside it, and
+// each ends with its one connection-invalid event and lets go of its context.
+TEST_F(MessageServiceTest, ConnectionsEndAloneAndOneAfterAnotherStartClean) {
   auto listener = EchoListener();
   ASSERT_TRUE(listener);
   ScopedLogCapture log;
   const std::string request = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Value{{"n", 1}});
-  struct Leftover {
+  const std::string badMagic = "DRM2" + std::string(28, '\0');
+  // A protocol error closes only its own connection.
+  Peer good(listener->path()), bad(listener->path());
+  ExpectEcho(good, 1);
+  bad.sendRaw(badMagic);
+  EXPECT_TRUE(bad.sawEndOfStream());
+  ExpectEcho(good, 2);
+  EXPECT_TRUE(log.contains("protocol error on <connection"));
+  EXPECT_TRUE(log.contains("bad magic"));
+  EXPECT_TRUE(WaitUntil([&] { return *invalid_ >= 1 && context_.use_count() <= 2; }));
+  EXPECT_EQ(*invalid_, 1);
+  EXPECT_EQ(context_.use_count(), 2);  // the good connection still holds its own
+  good.close();
+
+  const struct {
     const char* name;
     std::string bytes;  // sent after the answered request, before hanging up
-  };
-  const std::vector<Leftover> leftovers = {
+  } leftovers[] = {
       {"nothing", ""},
       {"half a header", request.substr(0, drm1::kHeaderSize / 2)},
       {"a header without its body", request.substr(0, drm1::kHeaderSize)},
       {"a frame without its last byte", request.substr(0, request.size() - 1)},
-      {"bad magic", "DRM2" + std::string(28, '\0')},
+      {"bad magic", badMagic},
       {"an unanswered request",
        *drm1::EncodeFrame(1000, 0, drm1::kFlagWantsReply, Value{{"n", 1000}})},
   };
-  int ended = 0;
+  int ended = 2;
   for (int round = 0; round < 5; ++round) {
-    for (const Leftover& leftover : leftovers) {
+    for (const auto& leftover : leftovers) {
       SCOPED_TRACE(leftover.name);
       Peer peer(listener->path());
-      ASSERT_TRUE(peer.connected());
-      const uint64_t serial = static_cast<uint64_t>(100 + ended);
-      peer.sendRequest(serial, Value{{"n", serial}});
-      std::optional<drm1::Frame> reply = peer.receive();
-      ASSERT_TRUE(reply);
-      EXPECT_EQ(reply->header.replyTo, serial);
-      EXPECT_EQ(reply->body, (Value{{"n", serial}, {"echo", true}}));
+      ExpectEcho(peer, static_cast<uint64_t>(100 + ended));
       if (!leftover.bytes.empty()) peer.sendRaw(leftover.bytes);
       ++ended;
     }
   }
-  for (int i = 0; i < 500 && (*invalid_ < ended || context_.use_count() > 1); ++i) {
-    std::this_thread::sleep_for(10ms);
-  }
+  EXPECT_TRUE(WaitUntil([&] { return *invalid_ >= ended && context_.use_count() <= 1; }));
   EXPECT_EQ(*invalid_, ended);
   EXPECT_EQ(context_.use_count(), 1) << "a finished connection kept its context";
 }
@@ -267,17 +240,14 @@ TEST_F(MessageServiceTest, ReplacesAStaleSocketButNeverALiveOneOrAnotherFile) {
   auto replaced = EchoListener();
   ASSERT_TRUE(replaced);
   Peer peer(path);
-  peer.sendRequest(1, Value{{"x", 1}});
-  EXPECT_TRUE(peer.receive());
+  ExpectEcho(peer, 1);
   replaced.reset();
 
   // Anything else at the path is left alone.
   { std::ofstream(path) << "precious"; }
-  Result<std::unique_ptr<Listener>> onFile = Listener::Create(options_, &queue_);
-  ASSERT_FALSE(onFile);
+  ASSERT_FALSE(Listener::Create(options_, &queue_));
   std::ifstream in(path);
-  std::string content((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  EXPECT_EQ(content, "precious");
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "precious");
 
   for (const char* bad : {"", "a/b", ".."}) {
     options_.serviceName = bad;
@@ -291,7 +261,6 @@ TEST_F(MessageServiceTest, APeerThatTakesNoRepliesIsNotReadAndThenClosed) {
   std::shared_ptr<PeerConnection> connection;
   std::atomic<int> delivered{0};
   std::mutex mu;
-  std::condition_variable cv;
   (*listener)->setEventHandler([&](std::shared_ptr<PeerConnection> c) {
     c->setEventHandler([&](const ConnectionEvent& e) {
       if (e.kind == ConnectionEvent::Kind::kMessage) ++delivered;
@@ -299,14 +268,13 @@ TEST_F(MessageServiceTest, APeerThatTakesNoRepliesIsNotReadAndThenClosed) {
     c->resume();
     std::lock_guard<std::mutex> lock(mu);
     connection = c;
-    cv.notify_all();
   });
   (*listener)->resume();
   Peer peer((*listener)->path());
-  {
-    std::unique_lock<std::mutex> lock(mu);
-    ASSERT_TRUE(cv.wait_for(lock, 5s, [&] { return connection != nullptr; }));
-  }
+  ASSERT_TRUE(WaitUntil([&] {
+    std::lock_guard<std::mutex> lock(mu);
+    return connection != nullptr;
+  }));
   ScopedLogCapture log;
   const Value big = Value{{"blob", Value(Data(1 << 20, 0x5A))}};
   uint64_t serial = 0;
@@ -318,20 +286,17 @@ TEST_F(MessageServiceTest, APeerThatTakesNoRepliesIsNotReadAndThenClosed) {
   flood();
   EXPECT_TRUE(log.contains("more than 64 MiB of replies unread"));
   // Its requests wait while its replies do, and go once it takes them.
-  peer.sendRequest(1, Value{{"request", "x"}});
+  peer.send(1, Value{{"request", "x"}});
   std::this_thread::sleep_for(300ms);
   EXPECT_EQ(delivered.load(), 0);
   for (int i = 0; i < 80; ++i) ASSERT_TRUE(peer.receive()) << i;
-  for (int i = 0; i < 100 && delivered.load() == 0; ++i) std::this_thread::sleep_for(50ms);
+  EXPECT_TRUE(WaitUntil([&] { return delivered.load() != 0; }));
   EXPECT_EQ(delivered.load(), 1);
   EXPECT_TRUE(connection->isOpen());
   // Taking none of them for long ends it.
   flood();
-  const auto deadline = std::chrono::steady_clock::now() + PeerConnection::kReplyStallLimit + 5s;
-  while (connection->isOpen() && std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(100ms);
-  }
-  EXPECT_FALSE(connection->isOpen());
+  EXPECT_TRUE(
+      WaitUntil([&] { return !connection->isOpen(); }, PeerConnection::kReplyStallLimit + 5s));
   EXPECT_TRUE(log.contains("took none of its replies for 30 s"));
 }
 
@@ -350,8 +315,7 @@ TEST_F(MessageServiceTest, RefusesPeersOfAnotherUser) {
     Peer peer(listener->path());
     if (!peer.connected()) ::_exit(4);
     // The daemon may already have closed the socket; no reply may come.
-    std::string frame = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Value{{"x", 1}});
-    [[maybe_unused]] ssize_t sent = ::send(peer.fd(), frame.data(), frame.size(), MSG_NOSIGNAL);
+    peer.send(1, Value{{"x", 1}});
     ::_exit(peer.receive(3s) ? 1 : 0);
   }
   int status = 0;
@@ -363,9 +327,9 @@ TEST_F(MessageServiceTest, RefusesPeersOfAnotherUser) {
 
 // A process that connects in a loop must not make another process's new
 // connection wait behind all of its own: connections are handed over in
-// turns by process. The handler is made slow for the looping process's
-// connections, so they pile up; the test's own connection must come within
-// the first few turns instead of after all of them.
+// turns by process. The handler is slow for the looping process's
+// connections, so they pile up; the test's own must come within the first
+// few turns instead of after all of them.
 TEST_F(MessageServiceTest, NewPeersTakeTurnsByProcess) {
   auto listener = Listener::Create(options_, &queue_);
   ASSERT_TRUE(listener) << listener.error().description();
@@ -378,38 +342,15 @@ TEST_F(MessageServiceTest, NewPeersTakeTurnsByProcess) {
   });
   (*listener)->resume();
   constexpr int kLooped = 40;
-  int ready[2];
-  ASSERT_EQ(::pipe(ready), 0);
-  // The child only makes system calls: the parent has threads running.
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, (*listener)->path().c_str(), sizeof addr.sun_path - 1);
-  pid_t child = ::fork();
-  if (child == 0) {
-    for (int i = 0; i < kLooped; ++i) {
-      int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-      if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) ::_exit(2);
-    }
-    char byte = 1;
-    if (::write(ready[1], &byte, 1) != 1) ::_exit(3);
-    ::pause();  // keep the connections open until the parent is done
-    ::_exit(0);
-  }
-  ::close(ready[1]);
-  char byte = 0;
-  ASSERT_EQ(::read(ready[0], &byte, 1), 1);
-  ::close(ready[0]);
+  const pid_t child = ConnectFromAnotherProcess((*listener)->path(), kLooped);
+  ASSERT_GT(child, 0);
   Peer mine((*listener)->path());
   ASSERT_TRUE(mine.connected());
-  for (int i = 0; i < 500; ++i) {
-    {
-      std::lock_guard<std::mutex> lock(mu);
-      if (order.size() == kLooped + 1) break;
-    }
-    std::this_thread::sleep_for(10ms);
-  }
-  ::kill(child, SIGKILL);
-  ::waitpid(child, nullptr, 0);
+  WaitUntil([&] {
+    std::lock_guard<std::mutex> lock(mu);
+    return order.size() == kLooped + 1;
+  });
+  Kill(child);
   (*listener)->stop();
   queue_.sync([] {});
   std::lock_guard<std::mutex> lock(mu);
@@ -438,42 +379,18 @@ TEST_F(MessageServiceTest, AcceptsNoMoreThanTheWaitingLimitWhileTheQueueIsBusy) 
   });
   const size_t base = OpenDescriptors();
   (*listener)->resume();
-  constexpr int kPeers = 2 * Listener::kMaxWaitingConnections;
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, (*listener)->path().c_str(), sizeof addr.sun_path - 1);
-  int ready[2];
-  ASSERT_EQ(::pipe(ready), 0);
-  pid_t child = ::fork();
-  if (child == 0) {  // system calls only: the parent has threads running
-    for (int i = 0; i < kPeers; ++i) {
-      int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-      if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) ::_exit(2);
-    }
-    char byte = 1;
-    if (::write(ready[1], &byte, 1) != 1) ::_exit(3);
-    ::pause();
-    ::_exit(0);
-  }
-  ::close(ready[1]);
-  char byte = 0;
-  ASSERT_EQ(::read(ready[0], &byte, 1), 1);
-  ::close(ready[0]);
+  constexpr size_t kPeers = 2 * Listener::kMaxWaitingConnections;
+  const pid_t child = ConnectFromAnotherProcess((*listener)->path(), static_cast<int>(kPeers));
+  ASSERT_GT(child, 0);
   // Each accepted connection holds its socket, a wake-up descriptor and, where
   // the kernel gives one, a pidfd: at most three.
   const size_t limit = 3 * (Listener::kMaxWaitingConnections + 1) + 8;
-  for (int i = 0; i < 100 && OpenDescriptors() - base < 2 * Listener::kMaxWaitingConnections; ++i) {
-    std::this_thread::sleep_for(20ms);
-  }
+  WaitUntil([&] { return OpenDescriptors() - base >= kPeers; }, 2s);
   std::this_thread::sleep_for(200ms);  // room for the listener to overrun, were it to
   EXPECT_LE(OpenDescriptors() - base, limit);
   release.set_value();
-  for (int i = 0; i < 500 && handed < static_cast<size_t>(kPeers); ++i) {
-    std::this_thread::sleep_for(10ms);
-  }
-  EXPECT_EQ(handed, static_cast<size_t>(kPeers));
-  ::kill(child, SIGKILL);
-  ::waitpid(child, nullptr, 0);
+  EXPECT_TRUE(WaitUntil([&] { return handed == kPeers; }));
+  Kill(child);
   (*listener)->stop();
   queue_.sync([] {});
 }

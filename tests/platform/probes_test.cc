@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <filesystem>
 #include <map>
 #include <regex>
 #include <string>
@@ -21,31 +22,20 @@ struct NoteProbe {
 
 // Provider-drd probes of the running test program, by name.
 std::map<std::string, NoteProbe> ReadProbeNotes() {
-  char exe[4096];
-  ssize_t n = ::readlink("/proc/self/exe", exe, sizeof exe - 1);
-  if (n <= 0) return {};
-  exe[n] = '\0';
-  std::string command = "readelf -n '" + std::string(exe) + "' 2>&1";
-  FILE* pipe = ::popen(command.c_str(), "r");
-  if (pipe == nullptr) return {};
-  std::map<std::string, NoteProbe> probes;
-  std::string provider, name;
-  char line[4096];
-  static const std::regex kField(R"(^\s*(Provider|Name|Location|Arguments):\s*(.*?)\s*$)");
-  static const std::regex kSemaphore(R"(Semaphore:\s*(0x[0-9a-f]+))");
-  while (std::fgets(line, sizeof line, pipe) != nullptr) {
-    std::smatch m;
-    std::string text = line;
-    if (!std::regex_match(text, m, kField)) continue;
-    if (m[1] == "Provider") provider = m[2];
-    if (m[1] == "Name") name = m[2];
-    if (provider != "drd") continue;
-    if (std::smatch s; m[1] == "Location" && std::regex_search(text, s, kSemaphore)) {
-      probes[name].semaphore = s[1];
-    }
-    if (m[1] == "Arguments") probes[name].arguments = m[2];
+  const std::string exe = std::filesystem::read_symlink("/proc/self/exe");
+  FILE* pipe = ::popen(("readelf -n '" + exe + "' 2>&1").c_str(), "r");
+  std::string text;
+  char buffer[4096];
+  for (size_t n; pipe && (n = std::fread(buffer, 1, sizeof buffer, pipe)) > 0;) {
+    text.append(buffer, n);
   }
-  ::pclose(pipe);
+  if (pipe) ::pclose(pipe);
+  static const std::regex kProbe(
+      R"(Provider: drd\s+Name: (\S+)\s+Location: [^\n]*Semaphore: (0x[0-9a-f]+)\s+Arguments: ([^\n]*))");
+  std::map<std::string, NoteProbe> probes;
+  for (std::sregex_iterator it(text.begin(), text.end(), kProbe), end; it != end; ++it) {
+    probes[(*it)[1]] = {(*it)[2], (*it)[3]};
+  }
   return probes;
 }
 

@@ -98,8 +98,8 @@ class RegistryTest : public ::testing::Test {
     return std::move(*r);
   }
 
-  // Reopens `registry` and expects every entry recorded as it was.
-  void ExpectKeptAcrossReopening(std::unique_ptr<Registry>& registry) {
+  // Expects `registry` to hold the entries `before`, each recorded as it was.
+  void ExpectEntries(Registry& registry, const RegistryEntries& before) {
     auto recorded = [](const RegistryEntry& e) {
       return std::make_tuple(e.uuid(), e.url(), e.plugInIdentifier(), e.multiple(),
                              e.bundleIdentifier(), e.bundleVersion(), e.registrationDate(),
@@ -107,15 +107,18 @@ class RegistryTest : public ::testing::Test {
                              e.shortName(), e.infoDictionary(), e.plugInDictionary(),
                              e.entitlements());
     };
-    const RegistryEntries before = registry->allEntries();
-    registry.reset();
-    registry = Open();
-    ASSERT_EQ(registry->allEntries().size(), before.size());
+    ASSERT_EQ(UuidsOf(registry.allEntries()), UuidsOf(before));
     for (const RegistryEntryPtr& e : before) {
-      RegistryEntryPtr again = registry->entryForUuid(e->uuid());
+      RegistryEntryPtr again = registry.entryForUuid(e->uuid());
       ASSERT_NE(again, nullptr) << e->description();
       EXPECT_TRUE(recorded(*again) == recorded(*e)) << e->description();
     }
+  }
+  void ExpectKeptAcrossReopening(std::unique_ptr<Registry>& registry) {
+    const RegistryEntries before = registry->allEntries();
+    registry.reset();
+    registry = Open();
+    ExpectEntries(*registry, before);
   }
 
   // `registry` with a new Recorder subscribed.
@@ -171,15 +174,12 @@ TEST_F(RegistryTest, RegistersOneEntryPerPlugInNamedAsDeclaredAndKeepsItInPrivat
     ASSERT_EQ(entries.size(), row.sections.size());
     for (size_t i = 0; i < entries.size(); ++i) {
       const RegistryEntry& e = *entries[i];
-      EXPECT_EQ(e.plugInDictionary(), row.sections[i]);
-      EXPECT_EQ(e.multiple(), row.multiple);
-      EXPECT_EQ(e.url(), path);
-      EXPECT_EQ(e.infoDictionary(), row.info);
-      EXPECT_EQ(e.entitlements(), entitlements);
-      EXPECT_EQ(e.bundleIdentifier(), "com.x.bundle");
-      EXPECT_EQ(e.bundleVersion(), "7");
-      EXPECT_EQ(e.displayName(), "N");
-      EXPECT_EQ(e.shortName(), "S");
+      EXPECT_TRUE(std::forward_as_tuple(e.plugInDictionary(), e.multiple(), e.url(),
+                                        e.infoDictionary(), e.entitlements(), e.bundleIdentifier(),
+                                        e.bundleVersion(), e.displayName(), e.shortName()) ==
+                  std::make_tuple(row.sections[i], row.multiple, path, row.info, entitlements,
+                                  "com.x.bundle", "7", "N", "S"))
+          << e.description();
       EXPECT_GE(e.registrationDate().seconds, before - 1);
       EXPECT_LE(e.registrationDate().seconds, before + 60);
       EXPECT_EQ(registry->entryForUuid(e.uuid()), entries[i]);
@@ -472,12 +472,23 @@ TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
 }
 
 // Runs `sql` on its own connection to `path`; answers sqlite3_exec's code.
-int RunSql(const std::string& path, const char* sql) {
+// `out` gets the first column of the last row a statement answered.
+int RunSql(const std::string& path, const char* sql, int64_t* out = nullptr) {
   sqlite3* db = nullptr;
   int rc = sqlite3_open(path.c_str(), &db);
-  if (rc == SQLITE_OK) rc = sqlite3_exec(db, sql, nullptr, nullptr, nullptr);
+  auto keep = [](void* to, int, char** values, char**) {
+    if (to && values[0]) *static_cast<int64_t*>(to) = std::stoll(values[0]);
+    return 0;
+  };
+  if (rc == SQLITE_OK) rc = sqlite3_exec(db, sql, keep, out, nullptr);
   sqlite3_close(db);
   return rc;
+}
+
+// The one integer `sql` answers on the database at `path`, or -1.
+int64_t QueryInt(const std::string& path, const char* sql) {
+  int64_t out = -1;
+  return RunSql(path, sql, &out) == SQLITE_OK ? out : -1;
 }
 
 TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
@@ -524,20 +535,6 @@ TEST_F(RegistryTest, DamagedOrForeignDatabaseIsReportedAndLeftAsItIs) {
     EXPECT_NE(text.find(row.text), std::string::npos) << text;
     EXPECT_EQ(ReadBytes(DatabasePath()), damaged);
   }
-}
-
-// Runs a query that answers one integer on the database at `path`.
-int64_t QueryInt(const std::string& path, const char* sql) {
-  sqlite3* db = nullptr;
-  sqlite3_stmt* s = nullptr;
-  int64_t out = -1;
-  if (sqlite3_open(path.c_str(), &db) == SQLITE_OK &&
-      sqlite3_prepare_v2(db, sql, -1, &s, nullptr) == SQLITE_OK && sqlite3_step(s) == SQLITE_ROW) {
-    out = sqlite3_column_int64(s, 0);
-  }
-  sqlite3_finalize(s);
-  sqlite3_close(db);
-  return out;
 }
 
 // What each stored bundle's bytes parse to, by path.
@@ -599,15 +596,7 @@ TEST_F(RegistryTest, DatabaseOfTheFirstSchemaOpensWithTheSameEntriesAndGainsPars
   ASSERT_NE(registry, nullptr);
   EXPECT_EQ(QueryInt(DatabasePath(), "PRAGMA user_version"), 3);
   EXPECT_EQ(QueryInt(DatabasePath(), "SELECT count(*) FROM bundles WHERE parsed IS NULL"), 0);
-  ASSERT_EQ(UuidsOf(registry->allEntries()), UuidsOf(before));
-  for (const RegistryEntryPtr& e : before) {
-    SCOPED_TRACE(e->description());
-    RegistryEntryPtr again = registry->entryForUuid(e->uuid());
-    EXPECT_EQ(again->infoDictionary(), e->infoDictionary());
-    EXPECT_EQ(again->plugInDictionary(), e->plugInDictionary());
-    EXPECT_EQ(again->entitlements(), e->entitlements());
-    EXPECT_EQ(again->displayName(), e->displayName());
-  }
+  ExpectEntries(*registry, before);
   ExpectKeptAcrossReopening(registry);
 }
 

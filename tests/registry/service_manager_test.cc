@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -17,9 +16,8 @@
 #include "registry/registry.h"
 #include "registry/service_manager_linux.h"
 #include "tests/support/bundle_fixture.h"
+#include "tests/support/process_fixtures.h"
 #include "tests/support/test_registry.h"
-
-extern char** environ;
 
 namespace dr {
 namespace {
@@ -61,64 +59,14 @@ TEST(ServiceManagerTest, SdkDictionaryFromTheFirstFolderThatHasIt) {
       EXPECT_EQ(*got, r.expected);
     }
   }
-}
-
-TEST(ServiceManagerTest, DefaultFoldersFollowXdgDataHome) {
-  test::BundleFixture dir;
+  // Without a path, the folder under XDG_DATA_HOME.
   dir.writePdoc("data/dromon/SDKs/com.example.user.pdoc", Value{{"from", "user"}});
   test::ScopedEnv noPath("DR_SDK_PATH", std::nullopt);
   test::ScopedEnv data("XDG_DATA_HOME", dir.path("data"));
-  Result<Value> got = DefaultServiceManager()->sdkDictionary("com.example.user");
-  ASSERT_TRUE(got.ok());
-  EXPECT_EQ(*got, (Value{{"from", "user"}}));
+  EXPECT_EQ(sm->sdkDictionary("com.example.user").value_or(Value()), (Value{{"from", "user"}}));
 }
 
-// A real program (a copy of sleep) started from `executable`, so that the
-// kernel reports that path as its executable. Killed and reaped at the end
-// unless a test reaped it.
-class Child {
- public:
-  explicit Child(const std::string& executable) {
-    std::error_code ec;
-    std::filesystem::create_directories(std::filesystem::path(executable).parent_path(), ec);
-    std::filesystem::copy_file("/bin/sleep", executable,
-                               std::filesystem::copy_options::overwrite_existing, ec);
-    std::filesystem::permissions(executable, std::filesystem::perms::owner_all, ec);
-    std::string arg0 = executable, arg1 = "60";
-    char* argv[] = {arg0.data(), arg1.data(), nullptr};
-    // posix_spawn returns after the exec, so /proc/<pid>/exe names the copy.
-    if (::posix_spawn(&pid_, executable.c_str(), nullptr, nullptr, argv, environ) != 0) pid_ = -1;
-    EXPECT_GT(pid_, 0) << executable;
-  }
-  ~Child() {
-    if (pid_ <= 0 || reaped_) return;
-    ::kill(pid_, SIGKILL);
-    wait();
-  }
-  Child(const Child&) = delete;
-  Child& operator=(const Child&) = delete;
-
-  pid_t pid() const { return pid_; }
-  bool alive() const { return !reaped_ && ::kill(pid_, 0) == 0; }
-  // Waits for the child to end and reaps it; answers the signal that ended
-  // it, or 0.
-  int wait() {
-    int status = 0;
-    EXPECT_EQ(::waitpid(pid_, &status, 0), pid_);
-    reaped_ = true;
-    return WIFSIGNALED(status) ? WTERMSIG(status) : 0;
-  }
-  // Kills the child and waits until it is a zombie, without reaping it.
-  void killLeavingZombie() {
-    ::kill(pid_, SIGKILL);
-    siginfo_t info;
-    EXPECT_EQ(::waitid(P_PID, static_cast<id_t>(pid_), &info, WEXITED | WNOWAIT), 0);
-  }
-
- private:
-  pid_t pid_ = -1;
-  bool reaped_ = false;
-};
+using Child = testing::RunningProgram;
 
 // Plug-in bundles on disk, registered in a real registry:
 //   A.appex      com.example.a 1.0
@@ -160,7 +108,9 @@ TEST_F(ServiceManagerProcessTest, BusyInstancesAreTheLiveProcessesOfTheAskedBund
   const std::string inner = "Outer.appex/Contents/PlugIns/Inner";
   Child a(exe("A")), b(exe("B")), innerChild(exe(inner)), loose(exe("Loose"));
   Child zombie(exe("A")), reaped(exe("A"));
-  zombie.killLeavingZombie();
+  ::kill(zombie.pid(), SIGKILL);  // a zombie until the end of the test
+  siginfo_t info;
+  ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(zombie.pid()), &info, WEXITED | WNOWAIT), 0);
   ::kill(reaped.pid(), SIGKILL);
   reaped.wait();
 
@@ -251,14 +201,14 @@ TEST_F(ServiceManagerProcessTest, RemoveStopsOnlyThatVersionsInstances) {
 
   EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.a", "2.0"), kNoInstanceRunning);
   EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.c", "1.0"), kNoInstanceRunning);
-  EXPECT_TRUE(a.alive());
+  EXPECT_EQ(::kill(a.pid(), 0), 0);
   EXPECT_EQ(sm_->externalServiceGrants().size(), 2u);
 
   EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.a", "1.0"), 0);
   EXPECT_EQ(a.wait(), SIGTERM);
   EXPECT_TRUE(log.contains("stopped pid " + std::to_string(a.pid()) +
                            ", an instance of com.example.a 1.0 at " + bundle("A")));
-  EXPECT_TRUE(b.alive());
+  EXPECT_EQ(::kill(b.pid(), 0), 0);
   ASSERT_EQ(sm_->externalServiceGrants().size(), 1u);
   EXPECT_EQ(sm_->externalServiceGrants()[0].bundleIdentifier, "com.example.b");
   // Nothing runs any more.

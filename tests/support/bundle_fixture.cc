@@ -11,21 +11,10 @@
 
 namespace dr::test {
 
-BundleFixture::BundleFixture() {
-  const char* tmp = std::getenv("TMPDIR");
-  std::string pattern = std::string(tmp && *tmp ? tmp : "/tmp") + "/drd-bundles-XXXXXX";
-  if (::mkdtemp(pattern.data()) == nullptr) ADD_FAILURE() << "mkdtemp " << pattern;
-  root_ = pattern;
-}
+BundleFixture::BundleFixture() = default;
+BundleFixture::~BundleFixture() = default;
 
-BundleFixture::~BundleFixture() {
-  std::error_code ec;
-  std::filesystem::remove_all(root_, ec);
-}
-
-std::string BundleFixture::path(const std::string& relative) const {
-  return root_ + "/" + relative;
-}
+std::string BundleFixture::path(const std::string& relative) const { return root_ / relative; }
 
 std::string BundleFixture::makeFolder(const std::string& relative) {
   std::filesystem::create_directories(path(relative));

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "core/value.h"
+#include "tests/support/process_fixtures.h"
 
 namespace dr::test {
 
@@ -16,7 +17,7 @@ class BundleFixture {
   BundleFixture(const BundleFixture&) = delete;
   BundleFixture& operator=(const BundleFixture&) = delete;
 
-  const std::string& root() const { return root_; }
+  const std::string& root() const { return root_.path(); }
   // root()/relative
   std::string path(const std::string& relative) const;
 
@@ -33,7 +34,7 @@ class BundleFixture {
   std::string makeFolder(const std::string& relative);
 
  private:
-  std::string root_;
+  testing::TempFolder root_;
 };
 
 class ScopedEnv {

@@ -24,8 +24,7 @@ class FakeServiceManager : public ServiceManager {
   std::map<std::string, Result<Value>> sdks;
   int lookups = 0;
 
-  // What addExternalService answers; a grant is recorded only on 0.
-  int addResult = 0;
+  // Every grant addExternalService got.
   std::vector<ExternalServiceGrant> grants;
 
   // What busyExtensionInstances answers: the instances whose identifier was
@@ -50,14 +49,12 @@ class FakeServiceManager : public ServiceManager {
 
   int addExternalService(pid_t hostPid, const std::string& executablePath,
                          const Value& overlay) override {
-    if (addResult == 0) {
-      ExternalServiceGrant g;
-      g.hostPid = hostPid;
-      g.executablePath = executablePath;
-      g.overlay = overlay;
-      grants.push_back(std::move(g));
-    }
-    return addResult;
+    ExternalServiceGrant g;
+    g.hostPid = hostPid;
+    g.executablePath = executablePath;
+    g.overlay = overlay;
+    grants.push_back(std::move(g));
+    return 0;
   }
 
   Result<std::vector<BusyExtensionInstance>> busyExtensionInstances(

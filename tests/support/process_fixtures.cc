@@ -22,10 +22,16 @@ TempFolder::TempFolder() {
     std::perror("mkdtemp");
     std::abort();
   }
+  path_ = std::filesystem::canonical(path_).string();
 }
 
 TempFolder::~TempFolder() {
   std::error_code ec;
+  // Every folder writable again first, in case a test took rights away.
+  for (const auto& e : std::filesystem::recursive_directory_iterator(path_, ec)) {
+    std::filesystem::permissions(e.path(), std::filesystem::perms::owner_all,
+                                 std::filesystem::perm_options::add, ec);
+  }
   std::filesystem::remove_all(path_, ec);
 }
 
@@ -43,7 +49,6 @@ RunningProgram::RunningProgram(const std::string& executablePath) {
   std::filesystem::create_directories(std::filesystem::path(executablePath).parent_path(), ec);
   std::filesystem::copy_file("/bin/sleep", executablePath,
                              std::filesystem::copy_options::overwrite_existing, ec);
-  if (ec) return;
   std::filesystem::permissions(executablePath, std::filesystem::perms::owner_all, ec);
   std::string arg0 = executablePath, arg1 = "60";
   char* argv[] = {arg0.data(), arg1.data(), nullptr};
@@ -56,10 +61,15 @@ RunningProgram::RunningProgram(const std::string& executablePath) {
 }
 
 RunningProgram::~RunningProgram() {
-  if (pid_ <= 0) return;
+  if (pid_ <= 0 || reaped_) return;
   ::kill(pid_, SIGKILL);
-  int status;
-  ::waitpid(pid_, &status, 0);
+  wait();
+}
+
+int RunningProgram::wait() {
+  int status = 0;
+  reaped_ = ::waitpid(pid_, &status, 0) == pid_;
+  return reaped_ && WIFSIGNALED(status) ? WTERMSIG(status) : 0;
 }
 
 }  // namespace dr::testing

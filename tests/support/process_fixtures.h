@@ -6,19 +6,23 @@
 #include <sys/types.h>
 
 #include <string>
+#include <string_view>
 
 namespace dr::testing {
 
 class TempFolder {
  public:
-  TempFolder();  // under $TMPDIR (else /tmp); aborts the test binary if it cannot
+  // Under $TMPDIR (else /tmp); aborts the test binary if it cannot.
+  TempFolder();
   ~TempFolder();
   TempFolder(const TempFolder&) = delete;
   TempFolder& operator=(const TempFolder&) = delete;
 
-  const std::string& path() const { return path_; }
+  const std::string& path() const { return path_; }  // canonical
   // path() + "/" + relative
-  std::string operator/(const std::string& relative) const { return path_ + "/" + relative; }
+  std::string operator/(std::string_view relative) const {
+    return path_ + "/" + std::string(relative);
+  }
 
  private:
   std::string path_;
@@ -27,9 +31,9 @@ class TempFolder {
 // Writes `bytes` to `path`, making missing folders (0700); false on failure.
 bool WriteTestFile(const std::string& path, const std::string& bytes, mode_t mode = 0600);
 
-// A copy of the system's sleep program at `executablePath` (folders made),
-// started and sleeping; killed and reaped when destroyed. pid() is -1 when
-// it could not be started.
+// A copy of the system's sleep program at `executablePath` (folders made; a
+// copy already running there is started again), started and sleeping;
+// killed and reaped when destroyed. pid() is -1 when it could not be started.
 class RunningProgram {
  public:
   explicit RunningProgram(const std::string& executablePath);
@@ -38,9 +42,12 @@ class RunningProgram {
   RunningProgram& operator=(const RunningProgram&) = delete;
 
   pid_t pid() const { return pid_; }
+  // Waits for it to end and reaps it; the signal that ended it, or 0.
+  int wait();
 
  private:
   pid_t pid_ = -1;
+  bool reaped_ = false;
 };
 
 }  // namespace dr::testing

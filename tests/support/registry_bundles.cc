@@ -12,27 +12,6 @@
 
 namespace dr::registry_test {
 
-TempFolder::TempFolder() {
-  char pattern[] = "/tmp/registry_test.XXXXXX";
-  const char* made = ::mkdtemp(pattern);
-  EXPECT_NE(made, nullptr);
-  path_ = std::filesystem::canonical(made ? made : "/tmp").string();
-}
-
-TempFolder::~TempFolder() {
-  std::error_code ignored;
-  // Make every folder writable again first, in case a test took rights away.
-  for (const auto& e : std::filesystem::recursive_directory_iterator(path_, ignored)) {
-    std::filesystem::permissions(e.path(), std::filesystem::perms::owner_all,
-                                 std::filesystem::perm_options::add, ignored);
-  }
-  std::filesystem::remove_all(path_, ignored);
-}
-
-std::string TempFolder::operator/(std::string_view relative) const {
-  return path_ + "/" + std::string(relative);
-}
-
 void WriteBytes(const std::string& path, std::string_view bytes) {
   std::filesystem::create_directories(std::filesystem::path(path).parent_path());
   std::ofstream out(path, std::ios::binary | std::ios::trunc);

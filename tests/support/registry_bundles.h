@@ -1,5 +1,5 @@
-// Test helpers for the registry: a temporary folder and plug-in bundles and
-// applications built in it on disk. For tests only; not thread-safe.
+// Test helpers for the registry: plug-in bundles and applications built on
+// disk. For tests only; not thread-safe.
 #pragma once
 
 #include <sys/types.h>
@@ -8,22 +8,11 @@
 #include <string_view>
 
 #include "core/value.h"
+#include "tests/support/process_fixtures.h"
 
 namespace dr::registry_test {
 
-// A new folder under /tmp (mkdtemp), removed with its contents at the end.
-class TempFolder {
- public:
-  TempFolder();
-  ~TempFolder();
-  TempFolder(const TempFolder&) = delete;
-  TempFolder& operator=(const TempFolder&) = delete;
-  const std::string& path() const { return path_; }  // canonical
-  std::string operator/(std::string_view relative) const;
-
- private:
-  std::string path_;
-};
+using TempFolder = testing::TempFolder;
 
 // Writes `bytes` to `path`, creating missing folders.
 void WriteBytes(const std::string& path, std::string_view bytes);

@@ -65,31 +65,22 @@ TEST(Drm1Test, EncodesFramesToTheByte) {
   EXPECT_EQ(*frame,
             HeaderBytes(static_cast<uint32_t>(expected.size()), 7, 3, kFlagIsReply) + expected);
 
-  Result<Value> back = DecodeWhole(*frame);
+  // Every kind of value comes back as it went, of the same kind.
+  const Value more = body.changing("min", std::numeric_limits<int64_t>::min())
+                         .changing("umax", std::numeric_limits<uint64_t>::max())
+                         .changing("real", -0.25)
+                         .changing("empty", "")
+                         .changing("list", Array{Value::EmptyArray(), Value::EmptyDictionary()})
+                         .changing("blob", Data{});
+  Result<Value> back = DecodeWhole(*EncodeFrame(1, 0, 0, more));
   ASSERT_TRUE(back) << back.error().description();
-  EXPECT_EQ(*back, body);
-}
-
-TEST(Drm1Test, RoundTripsEveryKindOfValue) {
-  const Value body = Value{
-      {"min", Value(std::numeric_limits<int64_t>::min())},
-      {"umax", Value(std::numeric_limits<uint64_t>::max())},
-      {"real", Value(-0.25)},
-      {"empty", ""},
-      {"nested", Value{{"list", Value(Array{Value::EmptyArray(), Value::EmptyDictionary()})}}},
-      {"blob", Value(Data{})},
-  };
-  Result<std::string> frame = EncodeFrame(1, 0, kFlagWantsReply, body);
-  ASSERT_TRUE(frame);
-  Result<Value> back = DecodeWhole(*frame);
-  ASSERT_TRUE(back);
-  EXPECT_EQ(*back, body);
+  EXPECT_EQ(*back, more);
   EXPECT_EQ((*back)["umax"].type(), Value::Type::kUInt);
   EXPECT_EQ((*back)["min"].type(), Value::Type::kInt);
+  EXPECT_EQ(DecodeWhole(*frame).value_or(Value()), body);
   // Null decodes to absent and so leaves no entry behind.
-  Result<Value> withNull = DecodeWhole(Frame(OneEntry(Tag(kTagNull))));
-  ASSERT_TRUE(withNull);
-  EXPECT_EQ(withNull->size(), 0u);
+  EXPECT_EQ(DecodeWhole(Frame(OneEntry(Tag(kTagNull)))).value_or(Value()),
+            Value::EmptyDictionary());
 }
 
 // `levels` - 1 arrays around a boolean: with the top dictionary, `levels`
@@ -194,20 +185,14 @@ TEST(Drm1Test, DecoderSplitsAStreamFedInPiecesAndStaysBrokenAfterAnError) {
 }
 
 TEST(Drm1Test, RefusesToEncodeWhatPeersWouldRefuse) {
-  const Value rows[] = {
-      Value("not a dictionary"),
-      Value{{"k", std::string("\xFF")}},
-      Value{{"k", std::string("a\0b", 3)}},
-      Value{{std::string("\xC0\x80"), 1}},
-  };
-  for (const Value& body : rows) {
+  Value deep = Value(true);
+  for (int i = 0; i < kMaxDepth; ++i) deep = Value(Array{deep});
+  for (const Value& body :
+       {Value("not a dictionary"), Value{{std::string("\xC0\x80"), 1}}, Value{{"k", deep}}}) {
     Result<std::string> f = EncodeFrame(1, 0, 0, body);
     ASSERT_FALSE(f) << body.description();
     EXPECT_EQ(f.error().code(), kUnencodable);
   }
-  Value deep = Value(true);
-  for (int i = 0; i < kMaxDepth; ++i) deep = Value(Array{deep});
-  EXPECT_FALSE(EncodeFrame(1, 0, 0, Value{{"k", deep}}));
 }
 
 // Text is read eight bytes at a time, so a NUL or a byte that is not UTF-8
