@@ -58,12 +58,14 @@ class ServerTest : public ::testing::Test {
   }
 
   registry_test::TempFolder folder_;
-  std::unique_ptr<Registry> registry_;
   testing::FakeNotificationCenter notifications_;
   testing::FakeUsageReports reports_;
   test::FakeServiceManager serviceManager_;
   testing::FakeCodeSigning codeSigning_;
   testing::FakePreferences preferences_;
+  // After the services it reports to: going, it finishes the install events
+  // it queued, which reach the server and so the services.
+  std::unique_ptr<Registry> registry_;
   std::shared_ptr<DRDServer> server_;
 };
 
