@@ -286,8 +286,8 @@ void Transaction::readyPlugIns() {
   // Every plug-in passed the checks; enable them all, even after a failure.
   std::optional<Error> firstFailure;
   for (const DRDPlugInPtr& p : toEnable) {
-    std::optional<Error> error = p->enableForPid(pid);
-    if (error && !firstFailure) firstFailure = std::move(error);
+    Status status = p->enableForPid(pid);
+    if (!status.ok() && !firstFailure) firstFailure = status.error();
   }
   if (firstFailure) {
     failError(kErrorMalformed, *firstFailure);

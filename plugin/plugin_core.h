@@ -217,14 +217,14 @@ class DRPlugInCore {
   // Fills in the defaults: protocol, principal class and shared resources of
   // an app extension, the format, the version.
   void canonicalize();
-  // The first thing missing that every plug-in needs, or nothing.
-  virtual std::optional<Error> diagnose();
+  // OK, or the first thing missing that every plug-in needs.
+  virtual Status diagnose();
 
   // ---- Form ---------------------------------------------------------------
 
-  // The record as a form (a new dictionary). Never fails; `error` is left
-  // untouched. REQUIRES: identifier, url, plugInDictionary and uuid present.
-  Value exportForm(std::optional<Error>* error = nullptr) const;
+  // The record as a form (a new dictionary). Never fails.
+  // REQUIRES: identifier, url, plugInDictionary and uuid present.
+  Value exportForm() const;
   // The same form as a mutable dictionary, for a caller that adds entries
   // before wrapping it (no absent values in it).
   Dictionary formEntries() const;

@@ -79,7 +79,7 @@ void DRPlugInCore::canonicalize() {
   setPlugInDictionary(Value(std::move(pd)));
 }
 
-std::optional<Error> DRPlugInCore::diagnose() {
+Status DRPlugInCore::diagnose() {
   if (!identifier()) {
     return DRMakeErrorWithFormat(
         kDRErrorInvalidPlugIn,
@@ -114,7 +114,7 @@ std::optional<Error> DRPlugInCore::diagnose() {
                                    EscapeInvalidUtf8(*text));
     }
   }
-  return std::nullopt;
+  return Status::OK();
 }
 
 }  // namespace dr

@@ -196,7 +196,7 @@ class LinuxInstallFolders final : public InstallFolders {
       bool keep = false;
       for (const Folder& f : folders_) keep |= !f.readable && f.path == b.installFolder;
       if (keep) continue;
-      if (Status s = registry_->unregisterInstalledBundle(b.path); !s) {
+      if (Status s = registry_->unregisterInstalledBundle(b.path); !s.ok()) {
         o_.log(Format("install folder \"%@\": %@", b.installFolder, s));
       }
     }
@@ -357,7 +357,7 @@ class LinuxInstallFolders final : public InstallFolders {
       std::erase_if(found_, [&](const Found& f) { return f.location == location; });
       return;
     }
-    if (Status s = registry_->unregisterInstalledBundle(known.canonical); !s) {
+    if (Status s = registry_->unregisterInstalledBundle(known.canonical); !s.ok()) {
       o_.log(Format("install folder \"%@\": %@", folders_[known.folder].path, s));
     }
   }

@@ -179,7 +179,7 @@ class SqliteRegistry final : public Registry {
     if (!installed && !removed) return Status::OK();
     if (Status s = db_->commit(installed ? path : std::string(), nullptr,
                                {removed ? path : std::string(), nullptr});
-        !s) {
+        !s.ok()) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot unregister \"%@\": %@", path, s.error().localizedDescription()));
     }
@@ -229,7 +229,7 @@ class SqliteRegistry final : public Registry {
         mark->plugInIdentifiers.push_back(entry->plugInIdentifier());
       }
     }
-    if (Status s = db_->commit(path, nullptr, {std::string(), mark ? &*mark : nullptr}); !s) {
+    if (Status s = db_->commit(path, nullptr, {std::string(), mark ? &*mark : nullptr}); !s.ok()) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot unregister \"%@\": %@", url, s.error().localizedDescription()));
     }
@@ -270,7 +270,7 @@ class SqliteRegistry final : public Registry {
       if (!origin && keepOrigin) origin = existing.origin;
       if (existing.contentHash == scanned.contentHash && existing.origin == origin) {
         if (existing.stamp == stamp && !wasRemoved) return InstallOutcome::kUnchanged;
-        if (Status s = db_->updateOrigin(path, origin, stamp); !s) {
+        if (Status s = db_->updateOrigin(path, origin, stamp); !s.ok()) {
           return Error(s.error().domain(), s.error().code(),
                        Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
         }
@@ -289,7 +289,7 @@ class SqliteRegistry final : public Registry {
     for (size_t i = 0; i < row.bundle.plugIns.size(); ++i) row.uuids.push_back(Uuid::random());
     if (Status s = db_->commit(old.empty() ? std::string() : path, &row,
                                {wasRemoved ? path : std::string(), nullptr});
-        !s) {
+        !s.ok()) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
     }
@@ -445,7 +445,7 @@ Result<std::unique_ptr<Registry>> Registry::Open(const RegistryOptions& options)
   if (!db) return db.error();
   auto registry = std::make_unique<SqliteRegistry>(options, NormalizedRoots(options.systemRoots),
                                                    std::move(*db));
-  if (Status s = registry->load(); !s) return s.error();
+  if (Status s = registry->load(); !s.ok()) return s.error();
   return std::unique_ptr<Registry>(std::move(registry));
 }
 

@@ -218,7 +218,7 @@ Result<std::unique_ptr<RegistryFile>> RegistryFile::Open(const std::string& path
   if (path.empty() || path.front() != '/') return storageError("not an absolute path");
   const size_t slash = path.rfind('/');
   if (slash > 0) {
-    if (Status s = fs->makeDirectories(path.substr(0, slash), 0700); !s) {
+    if (Status s = fs->makeDirectories(path.substr(0, slash), 0700); !s.ok()) {
       return storageError("cannot create its folder: " + s.error().localizedDescription());
     }
   }
@@ -240,15 +240,15 @@ Result<std::unique_ptr<RegistryFile>> RegistryFile::Open(const std::string& path
   sqlite3_busy_timeout(db, static_cast<int>(busyTimeout.count()));
 
   // Nothing is written before the file has proved to be a sound database.
-  if (Status s = out->checkIntegrity(); !s) return s.error();
+  if (Status s = out->checkIntegrity(); !s.ok()) return s.error();
   if (Status s = out->exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL;"
                            " PRAGMA foreign_keys=ON;",
                            "cannot configure");
-      !s) {
+      !s.ok()) {
     return s.error();
   }
-  if (Status s = out->migrate(); !s) return s.error();
-  if (Status s = out->prepareAll(); !s) return s.error();
+  if (Status s = out->migrate(); !s.ok()) return s.error();
+  if (Status s = out->prepareAll(); !s.ok()) return s.error();
   return out;
 }
 
@@ -313,7 +313,7 @@ Status RegistryFile::migrate() {
   for (;;) {
     // Each step re-reads the version inside its transaction, so two
     // processes opening a new file at once do not both run a step.
-    if (Status s = exec("BEGIN IMMEDIATE", "cannot update the schema"); !s) return s;
+    if (Status s = exec("BEGIN IMMEDIATE", "cannot update the schema"); !s.ok()) return s;
     auto fail = [&](Status s) {
       sqlite3_exec(db_, "ROLLBACK", nullptr, nullptr, nullptr);
       return s;
@@ -326,22 +326,22 @@ Status RegistryFile::migrate() {
     if (int rc = ReadInt(db_, "SELECT count(*) FROM sqlite_schema", &objects); rc != SQLITE_OK) {
       return fail(errorOf(rc, "cannot read the schema"));
     }
-    if (Status s = checkVersion(version, objects); !s) return fail(s);
+    if (Status s = checkVersion(version, objects); !s.ok()) return fail(s);
     if (version == kSchemaVersion) return exec("COMMIT", "cannot update the schema");
     if (Status s = exec(kMigrations[version].sql,
                         Format("cannot update the schema to version %d", version + 1));
-        !s) {
+        !s.ok()) {
       return fail(s);
     }
     if (kMigrations[version].fillParsedCopies) {
-      if (Status s = fillParsedCopies(); !s) return fail(s);
+      if (Status s = fillParsedCopies(); !s.ok()) return fail(s);
     }
     if (Status s = exec(Format("PRAGMA user_version = %d", version + 1).c_str(),
                         "cannot update the schema version");
-        !s) {
+        !s.ok()) {
       return fail(s);
     }
-    if (Status s = exec("COMMIT", "cannot update the schema"); !s) return fail(s);
+    if (Status s = exec("COMMIT", "cannot update the schema"); !s.ok()) return fail(s);
   }
 }
 
@@ -515,7 +515,7 @@ Result<std::vector<BundleRow>> RegistryFile::loadAll() {
     }
     if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the bundles");
   }
-  if (Status s = decodeParsedCopies(pending, rows); !s) return s.error();
+  if (Status s = decodeParsedCopies(pending, rows); !s.ok()) return s.error();
   rc = sqlite3_prepare_v2(db_,
                           "SELECT bundle_id, uuid, identifier, multiple FROM plugins "
                           "ORDER BY bundle_id, identifier",
@@ -668,11 +668,11 @@ Status RegistryFile::updateOrigin(const std::string& path, const std::optional<s
   sqlite3_bind_text(u, 3, stamp.data(), static_cast<int>(stamp.size()), SQLITE_STATIC);
   Status s = Status::OK();
   if (int rc = updateOrigin_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot update a bundle");
-  if (s) s = runRemovedChange(RemovedChange{path, nullptr});
-  if (s) {
+  if (s.ok()) s = runRemovedChange(RemovedChange{path, nullptr});
+  if (s.ok()) {
     if (int rc = commit_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot commit a change");
   }
-  if (!s) rollback_->run();
+  if (!s.ok()) rollback_->run();
   return s;
 }
 
@@ -680,11 +680,11 @@ Status RegistryFile::commit(const std::string& removePath, BundleRow* insert,
                             const RemovedChange& removed) {
   if (int rc = begin_->run(); rc != SQLITE_DONE) return errorOf(rc, "cannot begin a change");
   Status s = runChange(removePath, insert);
-  if (s) s = runRemovedChange(removed);
-  if (s) {
+  if (s.ok()) s = runRemovedChange(removed);
+  if (s.ok()) {
     if (int rc = commit_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot commit a change");
   }
-  if (!s) {
+  if (!s.ok()) {
     rollback_->run();
     if (insert != nullptr) insert->id = 0;
   }

@@ -130,7 +130,7 @@ TEST_F(EnableTest, SendsTheServiceOverlayWithTheEnvironment) {
     ASSERT_TRUE(plugIn);
     ScopedLogCapture log;
     pid_t pid = ::getpid();  // grants to processes that are gone are dropped
-    EXPECT_EQ(plugIn->enableForPid(pid), std::nullopt);
+    EXPECT_TRUE(plugIn->enableForPid(pid).ok());
     EXPECT_EQ(log.lines(),
               (std::vector<std::string>{"enabling pid=" + std::to_string(pid) +
                                         " for plug-in com.example.a.ext(2.0) " +
@@ -153,8 +153,9 @@ TEST_F(EnableTest, RefusalsAreErrorsWithTheirLogLines) {
   {  // The service manager refuses: the executable cannot be run.
     ASSERT_EQ(::chmod((path + "/Contents/Exec/a").c_str(), 0644), 0);
     ScopedLogCapture log;
-    std::optional<Error> error = plugIn->enableForPid(77);
-    ASSERT_TRUE(error);
+    Status status = plugIn->enableForPid(77);
+    ASSERT_FALSE(status.ok());
+    const Error* error = &status.error();
     EXPECT_EQ(error->domain(), "Dromon");
     EXPECT_EQ(error->code(), 4);
     EXPECT_EQ(error->ownDescription(), "unable to enable plug-in " + id + " for pid 77");
@@ -167,8 +168,9 @@ TEST_F(EnableTest, RefusalsAreErrorsWithTheirLogLines) {
   {  // The bundle is gone.
     std::filesystem::remove_all(path);
     ScopedLogCapture log;
-    std::optional<Error> error = plugIn->enableForPid(77);
-    ASSERT_TRUE(error);
+    Status status = plugIn->enableForPid(77);
+    ASSERT_FALSE(status.ok());
+    const Error* error = &status.error();
     EXPECT_EQ(error->code(), 4);
     EXPECT_EQ(error->ownDescription(), "cannot obtain executable path for plug-in " + id);
     EXPECT_EQ(log.lines().size(), 1u);  // "enabling ...", and no service-manager line

@@ -34,9 +34,7 @@ TEST(FormTest, ExportAndRebuildGiveAnEqualRecord) {
   p->setLocalizedShortName("View");
   p->setLocalizedContainingName("Host");
 
-  std::optional<Error> error;
-  Value form = p->exportForm(&error);
-  EXPECT_FALSE(error.has_value());
+  Value form = p->exportForm();
   EXPECT_EQ(form["uuid"], Value(p->uuid()->string()));
   EXPECT_EQ(form["version"], Value("4.1"));
   EXPECT_EQ(form["annotations"], Value::EmptyDictionary());  // never absent

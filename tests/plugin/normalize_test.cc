@@ -199,7 +199,7 @@ TEST(ResolveSdkTest, MergesTheRegisteredSdkAndCanonicalizes) {
   EXPECT_EQ(p->attributes()["UXExtensionPointName"], Value("viewer"));
   EXPECT_EQ(p->version(), "1");
   EXPECT_TRUE(p->bundleInfoDictionary()["UXExtension"].sameNode(p->plugInDictionary()));
-  EXPECT_FALSE(p->diagnose().has_value());
+  EXPECT_TRUE(p->diagnose().ok());
 }
 
 TEST(ResolveSdkTest, LogsAndFallsBack) {
@@ -309,15 +309,16 @@ TEST(DiagnoseTest, NamesWhatIsMissing) {
     ASSERT_NE(p, nullptr);
     ScopedLogCapture log;
     p->resolveSDK(&sm);
-    std::optional<Error> error = p->diagnose();
-    EXPECT_EQ(error ? error->ownDescription() : "", r.error);
-    EXPECT_TRUE(!error || (error->domain() == "Dromon" && error->code() == 12));
+    Status status = p->diagnose();
+    EXPECT_EQ(status.ok() ? "" : status.error().ownDescription().value_or(""), r.error);
+    EXPECT_TRUE(status.ok() ||
+                (status.error().domain() == "Dromon" && status.error().code() == 12));
   }
 
   DRPlugInCore empty;
-  std::optional<Error> error = empty.diagnose();
-  ASSERT_TRUE(error.has_value());
-  EXPECT_EQ(error->ownDescription(),
+  Status status = empty.diagnose();
+  ASSERT_FALSE(status.ok());
+  EXPECT_EQ(status.error().ownDescription(),
             "missing identifier (no UXExtensionIdentifier, nor even BNBundleIdentifier)");
 }
 
