@@ -401,7 +401,7 @@ void Transaction::annotatePlugIns() {
     // In a form the settings sit two levels below it (its "annotations",
     // then this): deeper ones would make every reply that carries the
     // plug-in's form impossible to send.
-    if (!extension.isDictionary() || extension.depth() > DRPlugInCore::kMaxFormDepth - 2 ||
+    if (!extension.isDictionary() || extension.depth() > kMaxFormDepth - 2 ||
         !pdoc::WriteXml(extension)) {
       failMessage(kErrorMalformed, "invalid request format (annotation extension)");
       return;

@@ -36,7 +36,6 @@
 #include "core/value.h"
 #include "platform/service_manager.h"
 #include "registry/service_manager_linux.h"
-#include "wire/drm1.h"
 
 namespace dr {
 
@@ -231,11 +230,6 @@ class DRPlugInCore {
   // What a form's "annotations" holds for a plug-in without any: one shared
   // empty dictionary rather than a new node per form.
   static const Value& NoAnnotations();
-  // The most levels a form may nest: a form travels at the third level of a
-  // reply (the reply, its "matches", the form), and a message nests at most
-  // drm1::kMaxDepth levels. A plug-in whose form would nest deeper is
-  // refused by diagnose, as no reply could carry it.
-  static constexpr size_t kMaxFormDepth = drm1::kMaxDepth - 2;
   // annotations := form["annotations"]; absent (or not a dictionary) clears.
   void updateFromForm(const Value& form);
 

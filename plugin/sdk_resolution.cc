@@ -96,12 +96,10 @@ Status DRPlugInCore::diagnose() {
     return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn, "missing \"%@\" key in Info.pdoc or SDK",
                                  missing);
   }
-  // The form's "bundleInfo" is one level below the form (and "info", the
-  // plug-in dictionary, is within it). A dictionary nested deeper than a
-  // reply can carry it, or text a reply cannot carry (stored by an older
-  // drd, or from the SDK), would make every reply carrying the form fail,
-  // for every host.
-  static_assert(kMaxTravellingDepth == kMaxFormDepth - 1);
+  // A "bundleInfo" (and "info", the plug-in dictionary, within it) nested
+  // deeper than a reply can carry it, or text a reply cannot carry (stored
+  // by an older drd, or from the SDK), would make every reply carrying the
+  // form fail, for every host.
   if (std::optional<std::string> why = WhyCannotTravel(bundleInfoDictionary())) {
     return DRMakeErrorWithFormat(kDRErrorInvalidPlugIn,
                                  "Info.pdoc and SDK cannot be carried in a reply: %@", *why);
