@@ -73,9 +73,9 @@ class SqliteRegistry final : public Registry {
 
   Status load() {
     auto rows = db_->loadAll();
-    if (!rows) return rows.status();
+    if (!rows.ok()) return rows.status();
     auto removed = db_->loadRemoved();
-    if (!removed) return removed.status();
+    if (!removed.ok()) return removed.status();
     std::unique_lock<std::shared_mutex> lock(indexMu_);
     for (BundleRow& row : *rows) insertIntoIndex(std::move(row));
     for (RemovedBundle& r : *removed) {
@@ -146,7 +146,7 @@ class SqliteRegistry final : public Registry {
     // The bundle is read before taking the write lock: a slow disk holds up
     // no other registration.
     auto scanned = registry_internal::ScanBundle(url, systemRoots_, fs_);
-    if (!scanned) return scanned.status();
+    if (!scanned.ok()) return scanned.status();
     std::optional<std::string> origin = installFolderOf(scanned->path);
     auto registered = registerScanned(url, std::move(*scanned), std::move(origin), stamp, true);
     return registered.status();
@@ -167,7 +167,7 @@ class SqliteRegistry final : public Registry {
       }
     }
     auto scanned = registry_internal::ScanBundle(path, systemRoots_, fs_);
-    if (!scanned) return scanned.error();
+    if (!scanned.ok()) return scanned.error();
     return registerScanned(path, std::move(*scanned), installFolder, stamp, false);
   }
 
@@ -442,7 +442,7 @@ std::vector<std::string> NormalizedRoots(const std::vector<std::string>& roots) 
 Result<std::unique_ptr<Registry>> Registry::Open(const RegistryOptions& options) {
   FileSystem* fs = options.fileSystem ? options.fileSystem : FileSystem::Default();
   auto db = registry_internal::RegistryFile::Open(options.databasePath, options.busyTimeout, fs);
-  if (!db) return db.error();
+  if (!db.ok()) return db.error();
   auto registry = std::make_unique<SqliteRegistry>(options, NormalizedRoots(options.systemRoots),
                                                    std::move(*db));
   if (Status s = registry->load(); !s.ok()) return s.error();

@@ -75,7 +75,7 @@ class BodyReader {
       return ProtocolError("the body is not a dictionary");
     }
     Result<Value> v = read(1);
-    if (!v) return v;
+    if (!v.ok()) return v;
     if (pos_ != in_.size()) {
       return ProtocolError(std::to_string(in_.size() - pos_) + " trailing bytes after the body");
     }
@@ -139,7 +139,7 @@ class BodyReader {
         return Value(Date{Load<double>(p)});
       case kTagString: {
         Result<std::string_view> s = text("string");
-        if (!s) return s.error();
+        if (!s.ok()) return s.error();
         return Value(*s);
       }
       case kTagData: {
@@ -181,7 +181,7 @@ class BodyReader {
           a.reserve(room);
           for (uint32_t i = 0; i < *n; ++i) {
             Result<Value> v = read(depth + 1);
-            if (!v) return v;
+            if (!v.ok()) return v;
             a.push_back(std::move(*v));
           }
           return Value(std::move(a));
@@ -190,9 +190,9 @@ class BodyReader {
         d.reserve(room);
         for (uint32_t i = 0; i < *n; ++i) {
           Result<std::string_view> key = text("key");
-          if (!key) return key.error();
+          if (!key.ok()) return key.error();
           Result<Value> v = read(depth + 1);
-          if (!v) return v;
+          if (!v.ok()) return v;
           if (!d.add(Key(*key), std::move(*v))) return ProtocolError("duplicate key");
         }
         return Value(d.finish());
