@@ -3,9 +3,13 @@
 // An Error is a domain, a signed code and an optional description. Status is
 // "OK or one Error" (OK is a null pointer, so success costs nothing), and
 // Result<T> is "a T or one Error". Their members are shaped like
-// std::expected so they can become aliases of it later. No exception crosses
-// a layer: where a library throws, the caller catches and converts at the
-// call. All three types are plain values and may be used from any thread.
+// std::expected so they can become aliases of it later. Every fallible
+// function of drd answers one of them, tested with `.ok()`: never an
+// optional error, nor errno passed up through layers (the few adapters that
+// keep a system call's shape at the OS boundary say why in their headers).
+// No exception crosses a layer: where a library throws, the caller catches
+// and converts at the call. All three types are plain values and may be
+// used from any thread.
 #pragma once
 
 #include <cassert>
@@ -69,8 +73,9 @@ class Status {
 
   static Status OK() { return Status(); }
 
+  // Tested as `status.ok()` only: no conversion to bool, which would read
+  // as "failed" to a reader used to a returned error.
   bool ok() const { return error_ == nullptr; }
-  explicit operator bool() const { return ok(); }
   // REQUIRES: !ok().
   const Error& error() const {
     assert(error_);

@@ -120,7 +120,6 @@ class Value {
   bool isInteger() const { return type() == Type::kInt || type() == Type::kUInt; }
   bool isString() const { return type() == Type::kString; }
   bool isData() const { return type() == Type::kData; }
-  bool isDate() const { return type() == Type::kDate; }
   bool isUuid() const { return type() == Type::kUuid; }
   bool isArray() const { return type() == Type::kArray; }
   bool isDictionary() const { return type() == Type::kDictionary; }
@@ -218,7 +217,6 @@ class Dictionary {
   const_iterator begin() const { return entries_.begin(); }
   const_iterator end() const { return entries_.end(); }
   const_iterator cbegin() const { return entries_.begin(); }
-  const_iterator cend() const { return entries_.end(); }
 
   size_t size() const { return entries_.size(); }
   bool empty() const { return entries_.empty(); }

@@ -423,7 +423,7 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
   }
   const uint32_t flags = drm1::kFlagIsReply | (descriptors.empty() ? 0 : drm1::kFlagDescriptors);
   Result<std::string> frame = drm1::EncodeFrame(nextSerial_, requestSerial, flags, body);
-  if (!frame) return frame.error();
+  if (!frame.ok()) return frame.error();
   ++nextSerial_;
   const bool queuedBefore = !outbox_.empty();
   if (queuedBefore) outboxQueued_ += frame->size();
@@ -609,7 +609,7 @@ PeerConnection::Pump PeerConnection::deliverFrames() {
       idle = inFlight_ == 0;
     }
     Result<std::optional<drm1::Header>> header = decoder_.nextHeader();
-    if (!header) {
+    if (!header.ok()) {
       SystemLog("protocol error on %@: %@", description(), header.error());
       return Pump::kBroken;
     }
@@ -631,7 +631,7 @@ PeerConnection::Pump PeerConnection::deliverFrames() {
       reserved_ = most;
     }
     Result<std::optional<drm1::Frame>> frame = decoder_.next();
-    if (!frame) {
+    if (!frame.ok()) {
       SystemLog("protocol error on %@: %@", description(), frame.error());
       return Pump::kBroken;
     }

@@ -4,6 +4,9 @@
 // bundle). Grants live in memory only; a restarted daemon starts with none.
 // Every member is safe to call from any thread. Process answers are
 // snapshots of /proc: a process may start or exit right after the call.
+// Granting and removing answer a bare errno-style number rather than a
+// Status: that number is all their callers use, and it is what drd's log
+// lines about grants and removals print.
 #pragma once
 
 #include <sys/types.h>

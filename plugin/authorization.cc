@@ -29,7 +29,7 @@ std::optional<std::string> DRDPlugIn::allowForClient(const PlugInClient& client)
   return std::nullopt;
 }
 
-std::optional<Error> DRDPlugIn::enableForPid(pid_t pid) const {
+Status DRDPlugIn::enableForPid(pid_t pid) const {
   Dictionary environment;
   const char* testSdk = services_.getenv ? services_.getenv(kTestSdkEnvironmentVariable)
                                          : std::getenv(kTestSdkEnvironmentVariable);
@@ -72,7 +72,7 @@ std::optional<Error> DRDPlugIn::enableForPid(pid_t pid) const {
                                  "unable to enable plug-in %@(%@) for pid %d", identifier(), id,
                                  pid);
   }
-  return std::nullopt;
+  return Status::OK();
 }
 
 std::optional<BusyInstance> DRDPlugIn::checkBusy() const {

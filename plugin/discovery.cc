@@ -240,11 +240,12 @@ Value Discovery::finish() {
       auto found = replacements_.find(identifier.stringValue());
       if (found == replacements_.end()) continue;
       const Replacer& r = found->second;
-      a.form = a.form.changing(kOverriderFormKey, r.uuid);
+      a.form = dictionaryChangingTo(a.form, kOverriderFormKey, r.uuid);
       // A replacer dropped as a duplicate meanwhile has no form to mark.
       Accepted& replacer = accepted_[r.accepted];
       if (!replacer.removed) {
-        replacer.form = replacer.form.changing(kOverridingFormKey, a.form[kFormIdentifierKey]);
+        replacer.form =
+            dictionaryChangingTo(replacer.form, kOverridingFormKey, a.form[kFormIdentifierKey]);
       }
     }
   }

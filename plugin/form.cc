@@ -18,6 +18,7 @@
 // "bundleInfo" is already merged and canonicalised, so a rebuilt record needs
 // no SDK lookup.
 #include "core/value.h"
+#include "plugin/helpers.h"
 #include "plugin/plugin_core.h"
 #include "plugin/plugin_keys.h"
 
@@ -39,9 +40,7 @@ const Value& DRPlugInCore::NoAnnotations() {
   return empty;
 }
 
-Value DRPlugInCore::exportForm(std::optional<Error>* /*error*/) const {
-  return Value(formEntries());
-}
+Value DRPlugInCore::exportForm() const { return Value(formEntries()); }
 
 // One lock for the whole form rather than one per property (a form is made
 // for every plug-in a match returns), which also makes the form one
@@ -55,9 +54,10 @@ Dictionary DRPlugInCore::formEntries() const {
   std::lock_guard<std::mutex> lock(mu_);
   add(kFormAnnotationsKey, annotations_.isDictionary() ? annotations_ : NoAnnotations());
   // Copied only when there is something to leave out.
-  add(kFormBundleInfoKey, bundleInfoDictionary_.has(kBNBundleInfoPdocURLKey)
-                              ? bundleInfoDictionary_.changing(kBNBundleInfoPdocURLKey, Value())
-                              : bundleInfoDictionary_);
+  add(kFormBundleInfoKey,
+      bundleInfoDictionary_.has(kBNBundleInfoPdocURLKey)
+          ? dictionaryChangingTo(bundleInfoDictionary_, kBNBundleInfoPdocURLKey, Value())
+          : bundleInfoDictionary_);
   add(kFormContainingPathKey, containingUrl_);
   add(kFormHubProtocolVersionKey, hubProtocolVersion_);
   add(kFormIdentifierKey, identifier_);

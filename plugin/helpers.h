@@ -14,6 +14,9 @@ namespace dr {
 // A new dictionary: a copy of `dictionary` in which `key` maps to `value`, or
 // from which `key` is removed when `value` is absent. `dictionary` itself is
 // never changed. An absent (or non-dictionary) receiver yields absent.
+// The plug-in layer's name for Value::changing, which does the work (core
+// and the client library, below this layer, call that directly); the
+// plug-in layer copies-and-changes dictionaries through this name only.
 Value dictionaryChangingTo(const Value& dictionary, std::string_view key, const Value& value);
 
 // Orders two version strings: -1 when `a` comes before `b`, 0 when they are

@@ -82,8 +82,8 @@ std::shared_ptr<DRDPlugIn> DRDPlugIn::initWithRGData(const RegistryEntryPtr& ent
   plugIn->setLocalizedName(entry->displayName());
   plugIn->setLocalizedShortName(entry->shortName());
 
-  if (std::optional<Error> error = plugIn->diagnose()) {
-    SystemLog("ignoring mis-configured plug-in at %@: %@", entry->url(), *error);
+  if (Status status = plugIn->diagnose(); !status.ok()) {
+    SystemLog("ignoring mis-configured plug-in at %@: %@", entry->url(), status.error());
     return nullptr;
   }
   return plugIn;
@@ -145,14 +145,14 @@ std::string DRDPlugIn::annotationKey() const {
   return identifier().value_or(std::string());
 }
 
-std::optional<Error> DRDPlugIn::diagnose() {
-  if (std::optional<Error> error = DRPlugInCore::diagnose()) return error;
-  if (isData()) return std::nullopt;
+Status DRDPlugIn::diagnose() {
+  if (Status status = DRPlugInCore::diagnose(); !status.ok()) return status;
+  if (isData()) return Status::OK();
   if (attributes()[kUXExtensionPointNameKey] == Value(kUnsandboxedExtensionPointName))
-    return std::nullopt;
+    return Status::OK();
   if (!hasEntitlement(kAppSandboxEntitlement))
     return DRMakeError(message::kErrorInvalidPlugIn, "plug-ins must be sandboxed");
-  return std::nullopt;
+  return Status::OK();
 }
 
 }  // namespace dr

@@ -89,7 +89,7 @@ class DRDPlugIn : public DRPlugInCore {
 
   // The base checks, then: data plug-ins and "Effecta" plug-ins are
   // acceptable; every other plug-in must hold the sandbox entitlement.
-  std::optional<Error> diagnose() override;
+  Status diagnose() override;
 
   // ---- Match rules (match_rules.cc) ---------------------------------------
   // Pure reads; malformed rules or patterns of any type never match, and a
@@ -113,9 +113,9 @@ class DRDPlugIn : public DRPlugInCore {
 
   // Nothing when `client` may use the plug-in, else the reason.
   std::optional<std::string> allowForClient(const PlugInClient& client) const;
-  // Makes the plug-in's service available to the process `pid`. Nothing on
-  // success, else an error (code 4) after a system-log line.
-  std::optional<Error> enableForPid(pid_t pid) const;
+  // Makes the plug-in's service available to the process `pid`. OK, or an
+  // error (code 4) after a system-log line.
+  Status enableForPid(pid_t pid) const;
   // The first running instance of this plug-in (same bundle identifier, and
   // a plug-in of the same version or of none), or nothing; also nothing when
   // instances cannot be listed (logged).

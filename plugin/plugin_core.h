@@ -36,7 +36,6 @@
 #include "core/value.h"
 #include "platform/service_manager.h"
 #include "registry/service_manager_linux.h"
-#include "wire/drm1.h"
 
 namespace dr {
 
@@ -217,25 +216,20 @@ class DRPlugInCore {
   // Fills in the defaults: protocol, principal class and shared resources of
   // an app extension, the format, the version.
   void canonicalize();
-  // The first thing missing that every plug-in needs, or nothing.
-  virtual std::optional<Error> diagnose();
+  // OK, or the first thing missing that every plug-in needs.
+  virtual Status diagnose();
 
   // ---- Form ---------------------------------------------------------------
 
-  // The record as a form (a new dictionary). Never fails; `error` is left
-  // untouched. REQUIRES: identifier, url, plugInDictionary and uuid present.
-  Value exportForm(std::optional<Error>* error = nullptr) const;
+  // The record as a form (a new dictionary). Never fails.
+  // REQUIRES: identifier, url, plugInDictionary and uuid present.
+  Value exportForm() const;
   // The same form as a mutable dictionary, for a caller that adds entries
   // before wrapping it (no absent values in it).
   Dictionary formEntries() const;
   // What a form's "annotations" holds for a plug-in without any: one shared
   // empty dictionary rather than a new node per form.
   static const Value& NoAnnotations();
-  // The most levels a form may nest: a form travels at the third level of a
-  // reply (the reply, its "matches", the form), and a message nests at most
-  // drm1::kMaxDepth levels. A plug-in whose form would nest deeper is
-  // refused by diagnose, as no reply could carry it.
-  static constexpr size_t kMaxFormDepth = drm1::kMaxDepth - 2;
   // annotations := form["annotations"]; absent (or not a dictionary) clears.
   void updateFromForm(const Value& form);
 

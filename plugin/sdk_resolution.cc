@@ -80,7 +80,7 @@ void DRPlugInCore::canonicalize() {
   setPlugInDictionary(Value(std::move(pd)));
 }
 
-std::optional<Error> DRPlugInCore::diagnose() {
+Status DRPlugInCore::diagnose() {
   if (!identifier()) {
     return DRMakeErrorWithFormat(
         message::kErrorInvalidPlugIn,
@@ -97,12 +97,10 @@ std::optional<Error> DRPlugInCore::diagnose() {
     return DRMakeErrorWithFormat(message::kErrorInvalidPlugIn,
                                  "missing \"%@\" key in Info.pdoc or SDK", missing);
   }
-  // The form's "bundleInfo" is one level below the form (and "info", the
-  // plug-in dictionary, is within it). A dictionary nested deeper than a
-  // reply can carry it, or text a reply cannot carry (stored by an older
-  // drd, or from the SDK), would make every reply carrying the form fail,
-  // for every host.
-  static_assert(kMaxTravellingDepth == kMaxFormDepth - 1);
+  // A "bundleInfo" (and "info", the plug-in dictionary, within it) nested
+  // deeper than a reply can carry it, or text a reply cannot carry (stored
+  // by an older drd, or from the SDK), would make every reply carrying the
+  // form fail, for every host.
   if (std::optional<std::string> why = WhyCannotTravel(bundleInfoDictionary())) {
     return DRMakeErrorWithFormat(message::kErrorInvalidPlugIn,
                                  "Info.pdoc and SDK cannot be carried in a reply: %@", *why);
@@ -115,7 +113,7 @@ std::optional<Error> DRPlugInCore::diagnose() {
                                    EscapeInvalidUtf8(*text));
     }
   }
-  return std::nullopt;
+  return Status::OK();
 }
 
 }  // namespace dr

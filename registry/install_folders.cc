@@ -196,7 +196,7 @@ class LinuxInstallFolders final : public InstallFolders {
       bool keep = false;
       for (const Folder& f : folders_) keep |= !f.readable && f.path == b.installFolder;
       if (keep) continue;
-      if (Status s = registry_->unregisterInstalledBundle(b.path); !s) {
+      if (Status s = registry_->unregisterInstalledBundle(b.path); !s.ok()) {
         o_.log(Format("install folder \"%@\": %@", b.installFolder, s));
       }
     }
@@ -225,7 +225,7 @@ class LinuxInstallFolders final : public InstallFolders {
       return;
     }
     auto names = NamesIn(f.path, "");
-    if (!names) {
+    if (!names.ok()) {
       logOnce(f.path, "",
               Format("install folder \"%@\": cannot read it: %@ (skipped)", f.path, names.error()));
       f.readable = false;
@@ -264,7 +264,7 @@ class LinuxInstallFolders final : public InstallFolders {
     std::set<std::string> seen;
     if (IsFolder(plugIns)) {
       auto names = NamesIn(plugIns, ".appex");
-      if (!names) {
+      if (!names.ok()) {
         logOnce(app, "",
                 Format("install folder \"%@\": cannot read \"%@\": %@ (skipped)", folders_[i].path,
                        plugIns, names.error()));
@@ -285,7 +285,7 @@ class LinuxInstallFolders final : public InstallFolders {
   void processBundle(const std::string& location, size_t i, const std::string& known = "") {
     const std::string& folder = folders_[i].path;
     auto canonical = known.empty() ? CanonicalPath(location) : Result<std::string>(known);
-    if (!canonical) {
+    if (!canonical.ok()) {
       const auto code = canonical.error().code();
       if (canonical.error().domain() == kPosixErrorDomain && (code == ENOENT || code == ENOTDIR)) {
         gone(location);
@@ -329,7 +329,7 @@ class LinuxInstallFolders final : public InstallFolders {
                      const std::string& stamp) {
     const std::string& folder = folders_[i].path;
     Result<InstallOutcome> outcome = registry_->registerInstalledBundle(canonical, folder, stamp);
-    if (outcome) {
+    if (outcome.ok()) {
       failed_.erase(location);
       return;
     }
@@ -357,7 +357,7 @@ class LinuxInstallFolders final : public InstallFolders {
       std::erase_if(found_, [&](const Found& f) { return f.location == location; });
       return;
     }
-    if (Status s = registry_->unregisterInstalledBundle(known.canonical); !s) {
+    if (Status s = registry_->unregisterInstalledBundle(known.canonical); !s.ok()) {
       o_.log(Format("install folder \"%@\": %@", folders_[known.folder].path, s));
     }
   }

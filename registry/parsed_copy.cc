@@ -27,7 +27,7 @@ std::string ChecksumOf(std::string_view info, std::optional<std::string_view> en
 // nothing when they are not what EncodeParsedCopy writes.
 std::optional<ParsedFiles> DecodeValues(std::string_view body) {
   Result<Value> top = drm1::DecodeBody(body);
-  if (!top) return std::nullopt;
+  if (!top.ok()) return std::nullopt;
   ParsedFiles out{(*top)[kInfoKey], (*top)[kEntitlementsKey]};
   if (top->size() != (out.info.isPresent() ? 2u : 1u)) return std::nullopt;
   if (out.info.isPresent() && !out.info.isDictionary()) return std::nullopt;
@@ -42,10 +42,10 @@ ParsedFiles ParseFiles(std::string_view infoBytes, std::optional<std::string_vie
   // changed parser, a tampered database) yield no information dictionary, and
   // the daemon then skips the plug-in.
   ParsedFiles out;
-  if (auto info = pdoc::Parse(infoBytes); info && info->isDictionary()) out.info = *info;
+  if (auto info = pdoc::Parse(infoBytes); info.ok() && info->isDictionary()) out.info = *info;
   out.entitlements = Value::EmptyDictionary();
   if (entitlements) {
-    if (auto e = pdoc::Parse(*entitlements); e && e->isDictionary()) out.entitlements = *e;
+    if (auto e = pdoc::Parse(*entitlements); e.ok() && e->isDictionary()) out.entitlements = *e;
   }
   return out;
 }
@@ -56,7 +56,7 @@ std::optional<std::string> EncodeParsedCopy(const ParsedFiles& parsed, std::stri
   // absent value).
   Result<std::string> body =
       drm1::EncodeValue(Value{{kInfoKey, parsed.info}, {kEntitlementsKey, parsed.entitlements}});
-  if (!body) return std::nullopt;
+  if (!body.ok()) return std::nullopt;
   // The message encoding nests less deeply than pdoc and carries no NUL in
   // text: a copy is kept only when it reads back as the very values parsed.
   std::optional<ParsedFiles> again = DecodeValues(*body);

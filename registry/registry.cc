@@ -73,9 +73,9 @@ class SqliteRegistry final : public Registry {
 
   Status load() {
     auto rows = db_->loadAll();
-    if (!rows) return rows.status();
+    if (!rows.ok()) return rows.status();
     auto removed = db_->loadRemoved();
-    if (!removed) return removed.status();
+    if (!removed.ok()) return removed.status();
     std::unique_lock<std::shared_mutex> lock(indexMu_);
     for (BundleRow& row : *rows) insertIntoIndex(std::move(row));
     for (RemovedBundle& r : *removed) {
@@ -146,7 +146,7 @@ class SqliteRegistry final : public Registry {
     // The bundle is read before taking the write lock: a slow disk holds up
     // no other registration.
     auto scanned = registry_internal::ScanBundle(url, systemRoots_, fs_);
-    if (!scanned) return scanned.status();
+    if (!scanned.ok()) return scanned.status();
     std::optional<std::string> origin = installFolderOf(scanned->path);
     auto registered = registerScanned(url, std::move(*scanned), std::move(origin), stamp, true);
     return registered.status();
@@ -167,7 +167,7 @@ class SqliteRegistry final : public Registry {
       }
     }
     auto scanned = registry_internal::ScanBundle(path, systemRoots_, fs_);
-    if (!scanned) return scanned.error();
+    if (!scanned.ok()) return scanned.error();
     return registerScanned(path, std::move(*scanned), installFolder, stamp, false);
   }
 
@@ -179,7 +179,7 @@ class SqliteRegistry final : public Registry {
     if (!installed && !removed) return Status::OK();
     if (Status s = db_->commit(installed ? path : std::string(), nullptr,
                                {removed ? path : std::string(), nullptr});
-        !s) {
+        !s.ok()) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot unregister \"%@\": %@", path, s.error().localizedDescription()));
     }
@@ -229,7 +229,7 @@ class SqliteRegistry final : public Registry {
         mark->plugInIdentifiers.push_back(entry->plugInIdentifier());
       }
     }
-    if (Status s = db_->commit(path, nullptr, {std::string(), mark ? &*mark : nullptr}); !s) {
+    if (Status s = db_->commit(path, nullptr, {std::string(), mark ? &*mark : nullptr}); !s.ok()) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot unregister \"%@\": %@", url, s.error().localizedDescription()));
     }
@@ -270,7 +270,7 @@ class SqliteRegistry final : public Registry {
       if (!origin && keepOrigin) origin = existing.origin;
       if (existing.contentHash == scanned.contentHash && existing.origin == origin) {
         if (existing.stamp == stamp && !wasRemoved) return InstallOutcome::kUnchanged;
-        if (Status s = db_->updateOrigin(path, origin, stamp); !s) {
+        if (Status s = db_->updateOrigin(path, origin, stamp); !s.ok()) {
           return Error(s.error().domain(), s.error().code(),
                        Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
         }
@@ -289,7 +289,7 @@ class SqliteRegistry final : public Registry {
     for (size_t i = 0; i < row.bundle.plugIns.size(); ++i) row.uuids.push_back(Uuid::random());
     if (Status s = db_->commit(old.empty() ? std::string() : path, &row,
                                {wasRemoved ? path : std::string(), nullptr});
-        !s) {
+        !s.ok()) {
       return Error(s.error().domain(), s.error().code(),
                    Format("cannot register \"%@\": %@", url, s.error().localizedDescription()));
     }
@@ -442,10 +442,10 @@ std::vector<std::string> NormalizedRoots(const std::vector<std::string>& roots) 
 Result<std::unique_ptr<Registry>> Registry::Open(const RegistryOptions& options) {
   FileSystem* fs = options.fileSystem ? options.fileSystem : FileSystem::Default();
   auto db = registry_internal::RegistryFile::Open(options.databasePath, options.busyTimeout, fs);
-  if (!db) return db.error();
+  if (!db.ok()) return db.error();
   auto registry = std::make_unique<SqliteRegistry>(options, NormalizedRoots(options.systemRoots),
                                                    std::move(*db));
-  if (Status s = registry->load(); !s) return s.error();
+  if (Status s = registry->load(); !s.ok()) return s.error();
   return std::unique_ptr<Registry>(std::move(registry));
 }
 

@@ -42,10 +42,21 @@ inline constexpr int64_t kRegistryStorage = 5;
 // What the registry holds must be able to travel in a reply: a bundle whose
 // path, dictionaries or names could not is refused (kRegistryRefused), since
 // a reply carrying it could not be sent and every host's discovery would fail
-// with it. A plug-in's information dictionary travels inside its form, at the
-// fourth of the levels a message may nest (the reply, its "matches", the
-// form, the dictionary), so it may nest this deep (as Value::depth counts).
-inline constexpr size_t kMaxTravellingDepth = drm1::kMaxDepth - 3;
+// with it.
+//
+// How a plug-in nests in a reply, level by level (a value of scalars only is
+// one level deep, as Value::depth counts): the reply is level 1, its
+// "matches" level 2, each plug-in's form level 3, and what a form holds (its
+// "bundleInfo", the information dictionary, and its "annotations") level 4.
+// A message nests at most drm1::kMaxDepth levels, so each of these may nest
+// only as deep as the levels left from where it lies.
+inline constexpr size_t kFormLevelInReply = 3;
+// The most levels a form may nest. A plug-in whose form would nest deeper is
+// refused by diagnose, as no reply could carry it.
+inline constexpr size_t kMaxFormDepth = drm1::kMaxDepth - kFormLevelInReply + 1;
+// The most levels the information dictionary may nest: it lies one level
+// inside the form.
+inline constexpr size_t kMaxTravellingDepth = kMaxFormDepth - 1;
 // Whether `text` can travel in a message: UTF-8 without NUL.
 bool TextCanTravel(std::string_view text);
 // Why `value` could not travel inside a plug-in's form (a string or key that

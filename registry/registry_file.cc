@@ -107,6 +107,66 @@ CREATE TABLE removed (
 };
 constexpr int kSchemaVersion = static_cast<int>(std::size(kMigrations));
 
+// The columns of each table, named once and in one order. A statement that
+// reads rows selects all of its table's columns in this order, so a column's
+// index is its place in the list; a statement that writes binds a column's
+// value to the parameter Param(column). Statements are built from these lists
+// (Select, Insert, Equals), and every index is looked up in them by name when
+// compiling, so neither an index nor a parameter is counted by eye.
+// clang-format off
+constexpr std::string_view kBundles[] = {
+    "id", "path", "content_hash", "info", "entitlements", "bundle_identifier", "bundle_version",
+    "display_name", "short_name", "registered", "system_volume", "app_path", "app_name", "parsed",
+    "origin", "stamp"};
+// clang-format on
+constexpr std::string_view kPlugIns[] = {"uuid", "bundle_id", "identifier", "multiple"};
+constexpr std::string_view kRemoved[] = {"path", "origin", "stamp", "identifiers", "removed"};
+
+// The index of the column `name` in `columns` (Bundle, PlugIn, Removed for
+// the three tables); a name not there does not compile.
+template <size_t N>
+consteval int ColumnOf(const std::string_view (&columns)[N], std::string_view name) {
+  for (size_t c = 0; c < N; ++c) {
+    if (columns[c] == name) return static_cast<int>(c);
+  }
+  throw "no such column";
+}
+consteval int Bundle(std::string_view name) { return ColumnOf(kBundles, name); }
+consteval int PlugIn(std::string_view name) { return ColumnOf(kPlugIns, name); }
+consteval int Removed(std::string_view name) { return ColumnOf(kRemoved, name); }
+
+// The parameter a column's value is bound to, in every statement.
+constexpr int Param(int column) { return column + 1; }
+
+// "SELECT <every column> FROM <table>", or only the first `count` columns
+// (a migration reads a table before its later columns exist).
+template <size_t N>
+std::string Select(const std::string_view (&columns)[N], std::string_view table, size_t count = N) {
+  std::string sql = "SELECT ";
+  for (size_t c = 0; c < count; ++c) sql.append(c == 0 ? "" : ", ").append(columns[c]);
+  return sql.append(" FROM ").append(table);
+}
+
+// "<verb> INTO <table> (<columns from first on>) VALUES (<their parameters>)".
+template <size_t N>
+std::string Insert(std::string_view verb, std::string_view table,
+                   const std::string_view (&columns)[N], size_t first = 0) {
+  std::string names;
+  std::string values;
+  for (size_t c = first; c < N; ++c) {
+    names.append(c == first ? "" : ", ").append(columns[c]);
+    values.append(c == first ? "?" : ", ?").append(std::to_string(Param(static_cast<int>(c))));
+  }
+  return std::string(verb) + " INTO " + std::string(table) + " (" + names + ") VALUES (" + values +
+         ")";
+}
+
+// "<column> = ?<its parameter>".
+template <size_t N>
+std::string Equals(const std::string_view (&columns)[N], int column) {
+  return std::string(columns[column]) + " = ?" + std::to_string(Param(column));
+}
+
 // Runs a query that answers one integer.
 int ReadInt(sqlite3* db, const char* sql, int* out) {
   sqlite3_stmt* raw = nullptr;
@@ -121,9 +181,14 @@ int ReadInt(sqlite3* db, const char* sql, int* out) {
   return rc;
 }
 
+// Binds text the caller keeps alive until the statement has run.
+void BindText(sqlite3_stmt* s, int index, std::string_view text) {
+  sqlite3_bind_text(s, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+}
+
 void BindOptionalText(sqlite3_stmt* s, int index, const std::optional<std::string>& text) {
   if (text) {
-    sqlite3_bind_text(s, index, text->data(), static_cast<int>(text->size()), SQLITE_STATIC);
+    BindText(s, index, *text);
   } else {
     sqlite3_bind_null(s, index);
   }
@@ -218,7 +283,7 @@ Result<std::unique_ptr<RegistryFile>> RegistryFile::Open(const std::string& path
   if (path.empty() || path.front() != '/') return storageError("not an absolute path");
   const size_t slash = path.rfind('/');
   if (slash > 0) {
-    if (Status s = fs->makeDirectories(path.substr(0, slash), 0700); !s) {
+    if (Status s = fs->makeDirectories(path.substr(0, slash), 0700); !s.ok()) {
       return storageError("cannot create its folder: " + s.error().localizedDescription());
     }
   }
@@ -240,15 +305,15 @@ Result<std::unique_ptr<RegistryFile>> RegistryFile::Open(const std::string& path
   sqlite3_busy_timeout(db, static_cast<int>(busyTimeout.count()));
 
   // Nothing is written before the file has proved to be a sound database.
-  if (Status s = out->checkIntegrity(); !s) return s.error();
+  if (Status s = out->checkIntegrity(); !s.ok()) return s.error();
   if (Status s = out->exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL;"
                            " PRAGMA foreign_keys=ON;",
                            "cannot configure");
-      !s) {
+      !s.ok()) {
     return s.error();
   }
-  if (Status s = out->migrate(); !s) return s.error();
-  if (Status s = out->prepareAll(); !s) return s.error();
+  if (Status s = out->migrate(); !s.ok()) return s.error();
+  if (Status s = out->prepareAll(); !s.ok()) return s.error();
   return out;
 }
 
@@ -313,7 +378,7 @@ Status RegistryFile::migrate() {
   for (;;) {
     // Each step re-reads the version inside its transaction, so two
     // processes opening a new file at once do not both run a step.
-    if (Status s = exec("BEGIN IMMEDIATE", "cannot update the schema"); !s) return s;
+    if (Status s = exec("BEGIN IMMEDIATE", "cannot update the schema"); !s.ok()) return s;
     auto fail = [&](Status s) {
       sqlite3_exec(db_, "ROLLBACK", nullptr, nullptr, nullptr);
       return s;
@@ -326,29 +391,33 @@ Status RegistryFile::migrate() {
     if (int rc = ReadInt(db_, "SELECT count(*) FROM sqlite_schema", &objects); rc != SQLITE_OK) {
       return fail(errorOf(rc, "cannot read the schema"));
     }
-    if (Status s = checkVersion(version, objects); !s) return fail(s);
+    if (Status s = checkVersion(version, objects); !s.ok()) return fail(s);
     if (version == kSchemaVersion) return exec("COMMIT", "cannot update the schema");
     if (Status s = exec(kMigrations[version].sql,
                         Format("cannot update the schema to version %d", version + 1));
-        !s) {
+        !s.ok()) {
       return fail(s);
     }
     if (kMigrations[version].fillParsedCopies) {
-      if (Status s = fillParsedCopies(); !s) return fail(s);
+      if (Status s = fillParsedCopies(); !s.ok()) return fail(s);
     }
     if (Status s = exec(Format("PRAGMA user_version = %d", version + 1).c_str(),
                         "cannot update the schema version");
-        !s) {
+        !s.ok()) {
       return fail(s);
     }
-    if (Status s = exec("COMMIT", "cannot update the schema"); !s) return fail(s);
+    if (Status s = exec("COMMIT", "cannot update the schema"); !s.ok()) return fail(s);
   }
 }
 
 Status RegistryFile::fillParsedCopies() {
+  // Runs inside the migration that adds "parsed", before later columns exist:
+  // reads only those of the first schema.
+  constexpr size_t kFirstSchemaColumns = Bundle("entitlements") + 1;
   sqlite3_stmt* raw = nullptr;
   int rc = sqlite3_prepare_v2(
-      db_, "SELECT id, info, entitlements FROM bundles WHERE parsed IS NULL", -1, &raw, nullptr);
+      db_, (Select(kBundles, "bundles", kFirstSchemaColumns) + " WHERE parsed IS NULL").c_str(), -1,
+      &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
   // The copies are all made before the first is written: the table is not
   // changed under the running query.
@@ -356,22 +425,26 @@ Status RegistryFile::fillParsedCopies() {
   {
     Statement select(raw);
     while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
-      const std::string_view info = ColumnView(raw, 1);
+      const std::string_view info = ColumnView(raw, Bundle("info"));
       std::optional<std::string_view> entitlements;
-      if (sqlite3_column_type(raw, 2) != SQLITE_NULL) entitlements = ColumnView(raw, 2);
+      if (sqlite3_column_type(raw, Bundle("entitlements")) != SQLITE_NULL) {
+        entitlements = ColumnView(raw, Bundle("entitlements"));
+      }
       if (auto copy = EncodeParsedCopy(ParseFiles(info, entitlements), info, entitlements)) {
-        copies.emplace_back(sqlite3_column_int64(raw, 0), std::move(*copy));
+        copies.emplace_back(sqlite3_column_int64(raw, Bundle("id")), std::move(*copy));
       }
     }
     if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the bundles");
   }
-  rc = sqlite3_prepare_v2(db_, "UPDATE bundles SET parsed = ?1 WHERE id = ?2", -1, &raw, nullptr);
+  const std::string update = "UPDATE bundles SET " + Equals(kBundles, Bundle("parsed")) +
+                             " WHERE " + Equals(kBundles, Bundle("id"));
+  rc = sqlite3_prepare_v2(db_, update.c_str(), -1, &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot prepare a statement");
-  Statement update(raw);
+  Statement statement(raw);
   for (const auto& [id, copy] : copies) {
-    BindBlob(raw, 1, copy);
-    sqlite3_bind_int64(raw, 2, id);
-    if (rc = update.run(); rc != SQLITE_DONE) return errorOf(rc, "cannot store a parsed copy");
+    BindBlob(raw, Param(Bundle("parsed")), copy);
+    sqlite3_bind_int64(raw, Param(Bundle("id")), id);
+    if (rc = statement.run(); rc != SQLITE_DONE) return errorOf(rc, "cannot store a parsed copy");
   }
   return Status::OK();
 }
@@ -379,30 +452,26 @@ Status RegistryFile::fillParsedCopies() {
 Status RegistryFile::prepareAll() {
   struct {
     std::unique_ptr<Statement>* slot;
-    const char* sql;
+    std::string sql;
   } const statements[] = {
       {&begin_, "BEGIN IMMEDIATE"},
       {&commit_, "COMMIT"},
       {&rollback_, "ROLLBACK"},
-      {&deletePlugIns_,
-       "DELETE FROM plugins WHERE bundle_id IN (SELECT id FROM bundles WHERE path = ?1)"},
-      {&deleteBundle_, "DELETE FROM bundles WHERE path = ?1"},
-      {&insertBundle_,
-       "INSERT INTO bundles (path, content_hash, info, entitlements, bundle_identifier, "
-       "bundle_version, display_name, short_name, registered, system_volume, app_path, app_name, "
-       "parsed, origin, stamp) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10, ?11, ?12, ?13, "
-       "?14, ?15)"},
-      {&insertPlugIn_,
-       "INSERT INTO plugins (uuid, bundle_id, identifier, multiple) VALUES (?1, ?2, ?3, ?4)"},
-      {&forgetRemoved_, "DELETE FROM removed WHERE path = ?1"},
-      {&rememberRemoved_,
-       "INSERT OR REPLACE INTO removed (path, origin, stamp, identifiers, removed) "
-       "VALUES (?1, ?2, ?3, ?4, ?5)"},
-      {&updateOrigin_, "UPDATE bundles SET origin = ?2, stamp = ?3 WHERE path = ?1"},
+      {&deletePlugIns_, "DELETE FROM plugins WHERE bundle_id IN (SELECT id FROM bundles WHERE " +
+                            Equals(kBundles, Bundle("path")) + ")"},
+      {&deleteBundle_, "DELETE FROM bundles WHERE " + Equals(kBundles, Bundle("path"))},
+      // Every column but id, which SQLite assigns.
+      {&insertBundle_, Insert("INSERT", "bundles", kBundles, Bundle("id") + 1)},
+      {&insertPlugIn_, Insert("INSERT", "plugins", kPlugIns)},
+      {&forgetRemoved_, "DELETE FROM removed WHERE " + Equals(kRemoved, Removed("path"))},
+      {&rememberRemoved_, Insert("INSERT OR REPLACE", "removed", kRemoved)},
+      {&updateOrigin_, "UPDATE bundles SET " + Equals(kBundles, Bundle("origin")) + ", " +
+                           Equals(kBundles, Bundle("stamp")) + " WHERE " +
+                           Equals(kBundles, Bundle("path"))},
   };
   for (const auto& [slot, sql] : statements) {
     sqlite3_stmt* raw = nullptr;
-    int rc = sqlite3_prepare_v3(db_, sql, -1, SQLITE_PREPARE_PERSISTENT, &raw, nullptr);
+    int rc = sqlite3_prepare_v3(db_, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &raw, nullptr);
     if (rc != SQLITE_OK) return errorOf(rc, "cannot prepare a statement");
     *slot = std::make_unique<Statement>(raw);
   }
@@ -440,17 +509,20 @@ Status RegistryFile::decodeParsedCopies(std::vector<PendingCopy>& pending,
   pending.clear();
   if (failed[0].empty() && failed[1].empty()) return Status::OK();
   sqlite3_stmt* raw = nullptr;
-  int rc = sqlite3_prepare_v2(db_, "SELECT info, entitlements FROM bundles WHERE id = ?1", -1, &raw,
-                              nullptr);
+  const std::string select =
+      Select(kBundles, "bundles") + " WHERE " + Equals(kBundles, Bundle("id"));
+  int rc = sqlite3_prepare_v2(db_, select.c_str(), -1, &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
-  Statement select(raw);
+  Statement statement(raw);
   for (const auto& list : failed) {
     for (size_t index : list) {
       ScannedBundle& b = rows[index].bundle;
-      sqlite3_bind_int64(raw, 1, rows[index].id);
+      sqlite3_bind_int64(raw, Param(Bundle("id")), rows[index].id);
       if ((rc = sqlite3_step(raw)) != SQLITE_ROW) return errorOf(rc, "cannot read the bundles");
-      b.infoBytes = ColumnBlob(raw, 0);
-      if (sqlite3_column_type(raw, 1) != SQLITE_NULL) b.entitlementsBytes = ColumnBlob(raw, 1);
+      b.infoBytes = ColumnBlob(raw, Bundle("info"));
+      if (sqlite3_column_type(raw, Bundle("entitlements")) != SQLITE_NULL) {
+        b.entitlementsBytes = ColumnBlob(raw, Bundle("entitlements"));
+      }
       sqlite3_reset(raw);
     }
   }
@@ -469,29 +541,27 @@ Result<std::vector<BundleRow>> RegistryFile::loadAll() {
   rows.reserve(static_cast<size_t>(count));
   pending.reserve(static_cast<size_t>(count));
   sqlite3_stmt* raw = nullptr;
-  rc = sqlite3_prepare_v2(db_,
-                          "SELECT id, path, content_hash, info, entitlements, "
-                          "bundle_identifier, bundle_version, display_name, short_name, "
-                          "registered, system_volume, app_path, app_name, parsed, origin, "
-                          "stamp FROM bundles ORDER BY id",
-                          -1, &raw, nullptr);
+  rc = sqlite3_prepare_v2(db_, (Select(kBundles, "bundles") + " ORDER BY id").c_str(), -1, &raw,
+                          nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the bundles");
   {
     Statement bundles(raw);
     while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
       BundleRow row;
-      row.id = sqlite3_column_int64(raw, 0);
+      row.id = sqlite3_column_int64(raw, Bundle("id"));
       ScannedBundle& b = row.bundle;
-      b.path = ColumnText(raw, 1).value_or("");
-      b.contentHash = ColumnBlob(raw, 2);
+      b.path = ColumnText(raw, Bundle("path")).value_or("");
+      b.contentHash = ColumnBlob(raw, Bundle("content_hash"));
       // A parsed copy made from these bytes stands for them, which are then
       // not kept: the entry needs only the dictionaries.
-      const std::string_view info = ColumnView(raw, 3);
+      const std::string_view info = ColumnView(raw, Bundle("info"));
       std::optional<std::string_view> entitlements;
-      if (sqlite3_column_type(raw, 4) != SQLITE_NULL) entitlements = ColumnView(raw, 4);
+      if (sqlite3_column_type(raw, Bundle("entitlements")) != SQLITE_NULL) {
+        entitlements = ColumnView(raw, Bundle("entitlements"));
+      }
       std::optional<std::string_view> values;
-      if (sqlite3_column_type(raw, 13) != SQLITE_NULL) {
-        values = CheckedParsedValues(ColumnView(raw, 13), info, entitlements);
+      if (sqlite3_column_type(raw, Bundle("parsed")) != SQLITE_NULL) {
+        values = CheckedParsedValues(ColumnView(raw, Bundle("parsed")), info, entitlements);
       }
       if (values) {
         pending.push_back({rows.size(), std::string(*values)});
@@ -499,33 +569,32 @@ Result<std::vector<BundleRow>> RegistryFile::loadAll() {
         b.infoBytes = std::string(info);
         if (entitlements) b.entitlementsBytes = std::string(*entitlements);
       }
-      b.bundleIdentifier = ColumnText(raw, 5);
-      b.bundleVersion = ColumnText(raw, 6);
-      b.displayName = ColumnText(raw, 7);
-      b.shortName = ColumnText(raw, 8);
-      row.registered = Date{sqlite3_column_double(raw, 9)};
-      b.onSystemVolume = sqlite3_column_int(raw, 10) != 0;
-      if (auto app = ColumnText(raw, 11)) {
-        b.containingApplication = RegistryApplication{*app, ColumnText(raw, 12)};
+      b.bundleIdentifier = ColumnText(raw, Bundle("bundle_identifier"));
+      b.bundleVersion = ColumnText(raw, Bundle("bundle_version"));
+      b.displayName = ColumnText(raw, Bundle("display_name"));
+      b.shortName = ColumnText(raw, Bundle("short_name"));
+      row.registered = Date{sqlite3_column_double(raw, Bundle("registered"))};
+      b.onSystemVolume = sqlite3_column_int(raw, Bundle("system_volume")) != 0;
+      if (auto app = ColumnText(raw, Bundle("app_path"))) {
+        b.containingApplication = RegistryApplication{*app, ColumnText(raw, Bundle("app_name"))};
       }
-      row.origin = ColumnText(raw, 14);
-      row.stamp = ColumnText(raw, 15).value_or("");
+      row.origin = ColumnText(raw, Bundle("origin"));
+      row.stamp = ColumnText(raw, Bundle("stamp")).value_or("");
       indexOf[row.id] = rows.size();
       rows.push_back(std::move(row));
     }
     if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the bundles");
   }
-  if (Status s = decodeParsedCopies(pending, rows); !s) return s.error();
+  if (Status s = decodeParsedCopies(pending, rows); !s.ok()) return s.error();
   rc = sqlite3_prepare_v2(db_,
-                          "SELECT bundle_id, uuid, identifier, multiple FROM plugins "
-                          "ORDER BY bundle_id, identifier",
+                          (Select(kPlugIns, "plugins") + " ORDER BY bundle_id, identifier").c_str(),
                           -1, &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the plug-ins");
   Statement plugIns(raw);
   while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
-    auto it = indexOf.find(sqlite3_column_int64(raw, 0));
-    std::string uuid = ColumnBlob(raw, 1);
-    if (it == indexOf.end() || uuid.size() != 16) {
+    auto it = indexOf.find(sqlite3_column_int64(raw, PlugIn("bundle_id")));
+    std::string uuid = ColumnBlob(raw, PlugIn("uuid"));
+    if (it == indexOf.end() || uuid.size() != Uuid().bytes.size()) {
       return Error(kRegistryErrorDomain, kRegistryCorrupt,
                    Format("registry database \"%@\": a plug-in row is inconsistent; the file "
                           "was left as it is",
@@ -533,10 +602,10 @@ Result<std::vector<BundleRow>> RegistryFile::loadAll() {
     }
     BundleRow& row = rows[it->second];
     Uuid u;
-    std::memcpy(u.bytes.data(), uuid.data(), 16);
+    std::memcpy(u.bytes.data(), uuid.data(), u.bytes.size());
     row.uuids.push_back(u);
-    row.bundle.plugIns.push_back(
-        {ColumnText(raw, 2).value_or(""), sqlite3_column_int(raw, 3) != 0});
+    row.bundle.plugIns.push_back({ColumnText(raw, PlugIn("identifier")).value_or(""),
+                                  sqlite3_column_int(raw, PlugIn("multiple")) != 0});
   }
   if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the plug-ins");
   // A bundle row without plug-ins has nothing to offer; it is never written
@@ -548,54 +617,53 @@ Result<std::vector<BundleRow>> RegistryFile::loadAll() {
 Status RegistryFile::runChange(const std::string& removePath, BundleRow* insert) {
   if (!removePath.empty()) {
     for (Statement* s : {deletePlugIns_.get(), deleteBundle_.get()}) {
-      sqlite3_bind_text(s->get(), 1, removePath.data(), static_cast<int>(removePath.size()),
-                        SQLITE_STATIC);
+      BindText(s->get(), Param(Bundle("path")), removePath);
       if (int rc = s->run(); rc != SQLITE_DONE) return errorOf(rc, "cannot remove a bundle");
     }
   }
   if (insert == nullptr) return Status::OK();
   const ScannedBundle& b = insert->bundle;
   sqlite3_stmt* s = insertBundle_->get();
-  sqlite3_bind_text(s, 1, b.path.data(), static_cast<int>(b.path.size()), SQLITE_STATIC);
-  BindBlob(s, 2, b.contentHash);
-  BindBlob(s, 3, b.infoBytes);
+  BindText(s, Param(Bundle("path")), b.path);
+  BindBlob(s, Param(Bundle("content_hash")), b.contentHash);
+  BindBlob(s, Param(Bundle("info")), b.infoBytes);
   if (b.entitlementsBytes) {
-    BindBlob(s, 4, *b.entitlementsBytes);
+    BindBlob(s, Param(Bundle("entitlements")), *b.entitlementsBytes);
   } else {
-    sqlite3_bind_null(s, 4);
+    sqlite3_bind_null(s, Param(Bundle("entitlements")));
   }
-  BindOptionalText(s, 5, b.bundleIdentifier);
-  BindOptionalText(s, 6, b.bundleVersion);
-  BindOptionalText(s, 7, b.displayName);
-  BindOptionalText(s, 8, b.shortName);
-  sqlite3_bind_double(s, 9, insert->registered.seconds);
-  sqlite3_bind_int(s, 10, b.onSystemVolume ? 1 : 0);
+  BindOptionalText(s, Param(Bundle("bundle_identifier")), b.bundleIdentifier);
+  BindOptionalText(s, Param(Bundle("bundle_version")), b.bundleVersion);
+  BindOptionalText(s, Param(Bundle("display_name")), b.displayName);
+  BindOptionalText(s, Param(Bundle("short_name")), b.shortName);
+  sqlite3_bind_double(s, Param(Bundle("registered")), insert->registered.seconds);
+  sqlite3_bind_int(s, Param(Bundle("system_volume")), b.onSystemVolume ? 1 : 0);
   if (const auto& app = b.containingApplication) {
-    sqlite3_bind_text(s, 11, app->url.data(), static_cast<int>(app->url.size()), SQLITE_STATIC);
-    BindOptionalText(s, 12, app->displayName);
+    BindText(s, Param(Bundle("app_path")), app->url);
+    BindOptionalText(s, Param(Bundle("app_name")), app->displayName);
   } else {
-    sqlite3_bind_null(s, 11);
-    sqlite3_bind_null(s, 12);
+    sqlite3_bind_null(s, Param(Bundle("app_path")));
+    sqlite3_bind_null(s, Param(Bundle("app_name")));
   }
   if (b.parsedCopy) {
-    BindBlob(s, 13, *b.parsedCopy);
+    BindBlob(s, Param(Bundle("parsed")), *b.parsedCopy);
   } else {
-    sqlite3_bind_null(s, 13);
+    sqlite3_bind_null(s, Param(Bundle("parsed")));
   }
-  BindOptionalText(s, 14, insert->origin);
-  sqlite3_bind_text(s, 15, insert->stamp.data(), static_cast<int>(insert->stamp.size()),
-                    SQLITE_STATIC);
+  BindOptionalText(s, Param(Bundle("origin")), insert->origin);
+  BindText(s, Param(Bundle("stamp")), insert->stamp);
   if (int rc = insertBundle_->run(); rc != SQLITE_DONE) {
     return errorOf(rc, "cannot store a bundle");
   }
   insert->id = sqlite3_last_insert_rowid(db_);
   for (size_t i = 0; i < b.plugIns.size(); ++i) {
     sqlite3_stmt* p = insertPlugIn_->get();
-    sqlite3_bind_blob(p, 1, insert->uuids[i].bytes.data(), 16, SQLITE_STATIC);
-    sqlite3_bind_int64(p, 2, insert->id);
+    sqlite3_bind_blob(p, Param(PlugIn("uuid")), insert->uuids[i].bytes.data(),
+                      static_cast<int>(insert->uuids[i].bytes.size()), SQLITE_STATIC);
+    sqlite3_bind_int64(p, Param(PlugIn("bundle_id")), insert->id);
     const std::string& identifier = b.plugIns[i].identifier;
-    sqlite3_bind_text(p, 3, identifier.data(), static_cast<int>(identifier.size()), SQLITE_STATIC);
-    sqlite3_bind_int(p, 4, b.plugIns[i].multiple ? 1 : 0);
+    BindText(p, Param(PlugIn("identifier")), identifier);
+    sqlite3_bind_int(p, Param(PlugIn("multiple")), b.plugIns[i].multiple ? 1 : 0);
     if (int rc = insertPlugIn_->run(); rc != SQLITE_DONE) {
       return errorOf(rc, "cannot store a plug-in");
     }
@@ -606,8 +674,7 @@ Status RegistryFile::runChange(const std::string& removePath, BundleRow* insert)
 Status RegistryFile::runRemovedChange(const RemovedChange& removed) {
   if (!removed.forget.empty()) {
     sqlite3_stmt* s = forgetRemoved_->get();
-    sqlite3_bind_text(s, 1, removed.forget.data(), static_cast<int>(removed.forget.size()),
-                      SQLITE_STATIC);
+    BindText(s, Param(Removed("path")), removed.forget);
     if (int rc = forgetRemoved_->run(); rc != SQLITE_DONE) {
       return errorOf(rc, "cannot forget a removed bundle");
     }
@@ -619,13 +686,11 @@ Status RegistryFile::runRemovedChange(const RemovedChange& removed) {
       identifiers += id;
     }
     sqlite3_stmt* s = rememberRemoved_->get();
-    sqlite3_bind_text(s, 1, r->path.data(), static_cast<int>(r->path.size()), SQLITE_STATIC);
-    sqlite3_bind_text(s, 2, r->installFolder.data(), static_cast<int>(r->installFolder.size()),
-                      SQLITE_STATIC);
-    sqlite3_bind_text(s, 3, r->stamp.data(), static_cast<int>(r->stamp.size()), SQLITE_STATIC);
-    sqlite3_bind_text(s, 4, identifiers.data(), static_cast<int>(identifiers.size()),
-                      SQLITE_STATIC);
-    sqlite3_bind_double(s, 5, r->removed.seconds);
+    BindText(s, Param(Removed("path")), r->path);
+    BindText(s, Param(Removed("origin")), r->installFolder);
+    BindText(s, Param(Removed("stamp")), r->stamp);
+    BindText(s, Param(Removed("identifiers")), identifiers);
+    sqlite3_bind_double(s, Param(Removed("removed")), r->removed.seconds);
     if (int rc = rememberRemoved_->run(); rc != SQLITE_DONE) {
       return errorOf(rc, "cannot remember a removed bundle");
     }
@@ -635,24 +700,23 @@ Status RegistryFile::runRemovedChange(const RemovedChange& removed) {
 
 Result<std::vector<RemovedBundle>> RegistryFile::loadRemoved() {
   sqlite3_stmt* raw = nullptr;
-  int rc = sqlite3_prepare_v2(db_, "SELECT path, origin, stamp, identifiers, removed FROM removed",
-                              -1, &raw, nullptr);
+  int rc = sqlite3_prepare_v2(db_, Select(kRemoved, "removed").c_str(), -1, &raw, nullptr);
   if (rc != SQLITE_OK) return errorOf(rc, "cannot read the removed bundles");
   Statement select(raw);
   std::vector<RemovedBundle> out;
   while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
     RemovedBundle r;
-    r.path = ColumnText(raw, 0).value_or("");
-    r.installFolder = ColumnText(raw, 1).value_or("");
-    r.stamp = ColumnText(raw, 2).value_or("");
-    const std::string identifiers = ColumnText(raw, 3).value_or("");
+    r.path = ColumnText(raw, Removed("path")).value_or("");
+    r.installFolder = ColumnText(raw, Removed("origin")).value_or("");
+    r.stamp = ColumnText(raw, Removed("stamp")).value_or("");
+    const std::string identifiers = ColumnText(raw, Removed("identifiers")).value_or("");
     for (size_t pos = 0; pos < identifiers.size();) {
       size_t end = identifiers.find('\n', pos);
       if (end == std::string::npos) end = identifiers.size();
       r.plugInIdentifiers.push_back(identifiers.substr(pos, end - pos));
       pos = end + 1;
     }
-    r.removed = Date{sqlite3_column_double(raw, 4)};
+    r.removed = Date{sqlite3_column_double(raw, Removed("removed"))};
     out.push_back(std::move(r));
   }
   if (rc != SQLITE_DONE) return errorOf(rc, "cannot read the removed bundles");
@@ -663,16 +727,16 @@ Status RegistryFile::updateOrigin(const std::string& path, const std::optional<s
                                   const std::string& stamp) {
   if (int rc = begin_->run(); rc != SQLITE_DONE) return errorOf(rc, "cannot begin a change");
   sqlite3_stmt* u = updateOrigin_->get();
-  sqlite3_bind_text(u, 1, path.data(), static_cast<int>(path.size()), SQLITE_STATIC);
-  BindOptionalText(u, 2, origin);
-  sqlite3_bind_text(u, 3, stamp.data(), static_cast<int>(stamp.size()), SQLITE_STATIC);
+  BindText(u, Param(Bundle("path")), path);
+  BindOptionalText(u, Param(Bundle("origin")), origin);
+  BindText(u, Param(Bundle("stamp")), stamp);
   Status s = Status::OK();
   if (int rc = updateOrigin_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot update a bundle");
-  if (s) s = runRemovedChange(RemovedChange{path, nullptr});
-  if (s) {
+  if (s.ok()) s = runRemovedChange(RemovedChange{path, nullptr});
+  if (s.ok()) {
     if (int rc = commit_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot commit a change");
   }
-  if (!s) rollback_->run();
+  if (!s.ok()) rollback_->run();
   return s;
 }
 
@@ -680,11 +744,11 @@ Status RegistryFile::commit(const std::string& removePath, BundleRow* insert,
                             const RemovedChange& removed) {
   if (int rc = begin_->run(); rc != SQLITE_DONE) return errorOf(rc, "cannot begin a change");
   Status s = runChange(removePath, insert);
-  if (s) s = runRemovedChange(removed);
-  if (s) {
+  if (s.ok()) s = runRemovedChange(removed);
+  if (s.ok()) {
     if (int rc = commit_->run(); rc != SQLITE_DONE) s = errorOf(rc, "cannot commit a change");
   }
-  if (!s) {
+  if (!s.ok()) {
     rollback_->run();
     if (insert != nullptr) insert->id = 0;
   }

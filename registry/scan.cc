@@ -132,8 +132,8 @@ std::optional<RegistryApplication> ContainingApplicationOf(const std::string& pa
     RegistryApplication app{ancestor, std::nullopt};
     // The application's own Info.pdoc only supplies its name; an application
     // without a readable one still contains the plug-in, without a name.
-    if (auto bytes = fs->readFile(ancestor + "/" + kInfoFile, kMaxBundleFile)) {
-      if (auto info = pdoc::Parse(*bytes)) app.displayName = DisplayNameOf(*info);
+    if (auto bytes = fs->readFile(ancestor + "/" + kInfoFile, kMaxBundleFile); bytes.ok()) {
+      if (auto info = pdoc::Parse(*bytes); info.ok()) app.displayName = DisplayNameOf(*info);
     }
     return app;
   }
@@ -147,7 +147,7 @@ Result<std::optional<std::string>> ReadDictionaryFile(const std::string& url,
                                                       bool required, FileSystem* fs,
                                                       Value* parsed) {
   auto bytes = fs->readFile(bundle + "/" + name, kMaxBundleFile);
-  if (!bytes) {
+  if (!bytes.ok()) {
     if (bytes.error().domain() == kFileErrorDomain &&
         bytes.error().code() == kFileReadNoSuchFileError) {
       if (!required) return std::optional<std::string>();
@@ -156,7 +156,7 @@ Result<std::optional<std::string>> ReadDictionaryFile(const std::string& url,
     return Refused(url, Format("cannot read %@: %@", name, bytes.error().localizedDescription()));
   }
   auto value = pdoc::Parse(*bytes);
-  if (!value) {
+  if (!value.ok()) {
     return Refused(url, Format("%@ is not a valid pdoc document: %@", name,
                                value.error().localizedDescription()));
   }
@@ -224,12 +224,12 @@ Result<ScannedBundle> ScanBundle(const std::string& url,
   out.path = *path;
   Value info;
   auto infoBytes = ReadDictionaryFile(url, out.path, kInfoFile, true, fs, &info);
-  if (!infoBytes) return infoBytes.error();
+  if (!infoBytes.ok()) return infoBytes.error();
   out.infoBytes = std::move(**infoBytes);
   Value entitlements;
   auto entitlementsBytes =
       ReadDictionaryFile(url, out.path, kEntitlementsFile, false, fs, &entitlements);
-  if (!entitlementsBytes) return entitlementsBytes.error();
+  if (!entitlementsBytes.ok()) return entitlementsBytes.error();
   out.entitlementsBytes = std::move(*entitlementsBytes);
 
   // Checked on the parsed values: a JSON file may spell a NUL as an escape.
@@ -247,7 +247,7 @@ Result<ScannedBundle> ScanBundle(const std::string& url,
         url, Format("%@ holds neither \"UXExtension\" nor \"Dromon\" as a dictionary", kInfoFile));
   }
   auto plugIns = PlugInsOf(url, info, top, oldStyle);
-  if (!plugIns) return plugIns.error();
+  if (!plugIns.ok()) return plugIns.error();
   out.plugIns = std::move(*plugIns);
 
   out.contentHash = HashFiles(out.infoBytes, out.entitlementsBytes);

@@ -75,7 +75,7 @@ class BodyReader {
       return ProtocolError("the body is not a dictionary");
     }
     Result<Value> v = read(1);
-    if (!v) return v;
+    if (!v.ok()) return v;
     if (pos_ != in_.size()) {
       return ProtocolError(std::to_string(in_.size() - pos_) + " trailing bytes after the body");
     }
@@ -139,7 +139,7 @@ class BodyReader {
         return Value(Date{Load<double>(p)});
       case kTagString: {
         Result<std::string_view> s = text("string");
-        if (!s) return s.error();
+        if (!s.ok()) return s.error();
         return Value(*s);
       }
       case kTagData: {
@@ -181,7 +181,7 @@ class BodyReader {
           a.reserve(room);
           for (uint32_t i = 0; i < *n; ++i) {
             Result<Value> v = read(depth + 1);
-            if (!v) return v;
+            if (!v.ok()) return v;
             a.push_back(std::move(*v));
           }
           return Value(std::move(a));
@@ -190,9 +190,9 @@ class BodyReader {
         d.reserve(room);
         for (uint32_t i = 0; i < *n; ++i) {
           Result<std::string_view> key = text("key");
-          if (!key) return key.error();
+          if (!key.ok()) return key.error();
           Result<Value> v = read(depth + 1);
-          if (!v) return v;
+          if (!v.ok()) return v;
           if (!d.add(Key(*key), std::move(*v))) return ProtocolError("duplicate key");
         }
         return Value(d.finish());
@@ -455,17 +455,17 @@ Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flag
 }
 
 Error FrameDecoder::fail(Error error) {
-  error_ = std::move(error);
-  return *error_;
+  status_ = error;
+  return error;
 }
 
 Result<std::optional<Header>> FrameDecoder::nextHeader() {
-  if (error_) return *error_;
+  if (!status_.ok()) return status_;
   if (header_) return header_;
   std::string_view pending = std::string_view(buffer_).substr(consumed_);
   if (pending.size() < kHeaderSize) return std::optional<Header>();
   Result<Header> header = DecodeHeader(pending, limits_);
-  if (!header) return fail(header.error());
+  if (!header.ok()) return fail(header.error());
   if (header->serial <= lastSerial_) {
     return fail(ProtocolError("serial " + std::to_string(header->serial) +
                               " not above the one before, " + std::to_string(lastSerial_)));
@@ -476,7 +476,7 @@ Result<std::optional<Header>> FrameDecoder::nextHeader() {
 
 Result<std::optional<Frame>> FrameDecoder::next() {
   Result<std::optional<Header>> header = nextHeader();
-  if (!header) return header.error();
+  if (!header.ok()) return header.error();
   if (!header->has_value()) return std::optional<Frame>();
   const Header h = **header;
   if (buffered() - kHeaderSize < h.bodyLength) return std::optional<Frame>();
@@ -484,7 +484,7 @@ Result<std::optional<Frame>> FrameDecoder::next() {
   Result<Value> body =
       DecodeBody(std::string_view(buffer_).substr(consumed_ + kHeaderSize, h.bodyLength),
                  limits_.maxValues, &values);
-  if (!body) return fail(body.error());
+  if (!body.ok()) return fail(body.error());
   consumed_ += kHeaderSize + h.bodyLength;
   lastSerial_ = h.serial;
   header_.reset();

@@ -145,7 +145,7 @@ class FrameDecoder {
   size_t consumed_ = 0;
   uint64_t lastSerial_ = 0;       // of the last frame taken
   std::optional<Header> header_;  // of the next frame, once checked
-  std::optional<Error> error_;
+  Status status_;                 // failed: the error next() keeps answering
 };
 
 }  // namespace dr::drm1

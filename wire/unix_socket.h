@@ -3,6 +3,9 @@
 // Descriptors travel as SCM_RIGHTS ancillary data with the first byte of the
 // bytes they go with. Stateless; any thread. Both calls never block and
 // never raise SIGPIPE; they answer as sendmsg/recvmsg do (-1 with errno).
+// They stay system-call shaped rather than answering a Status: their callers
+// are non-blocking loops that must tell EAGAIN and EINTR from a failure
+// before anything else, as for any other read or write on a socket.
 #pragma once
 
 #include <sys/types.h>

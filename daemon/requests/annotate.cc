@@ -37,7 +37,7 @@ void annotatePlugIns(Transaction& t, DRDatabase& database) {
     // In a form the settings sit two levels below it (its "annotations",
     // then this): deeper ones would make every reply that carries the
     // plug-in's form impossible to send.
-    if (!extension.isDictionary() || extension.depth() > DRPlugInCore::kMaxFormDepth - 2 ||
+    if (!extension.isDictionary() || extension.depth() > kMaxFormDepth - 2 ||
         !pdoc::WriteXml(extension)) {
       t.failMessage(kErrorMalformed, "invalid request format (annotation extension)");
       return;

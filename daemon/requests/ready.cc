@@ -48,8 +48,8 @@ void readyPlugIns(Transaction& t, DRDatabase& database, PlugInHolds& holds) {
   // Every plug-in passed the checks; enable them all, even after a failure.
   Status firstFailure;
   for (const DRDPlugInPtr& p : toEnable) {
-    std::optional<Error> error = p->enableForPid(pid);
-    if (error && firstFailure.ok()) firstFailure = std::move(*error);
+    Status enabled = p->enableForPid(pid);
+    if (!enabled.ok() && firstFailure.ok()) firstFailure = std::move(enabled);
   }
   if (!firstFailure.ok()) {
     t.failError(kErrorMalformed, firstFailure.error());

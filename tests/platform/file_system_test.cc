@@ -33,21 +33,21 @@ Names NamesIn(const std::string& folder) {
 TEST(FileSystemTest, WritesReplaceAtomicallyOrLeaveEverythingAsItWas) {
   TempFolder dir;
   FileSystem* fs = FileSystem::Default();
-  ASSERT_TRUE(fs->writeFileAtomically(dir / "state", "old contents", 0644));
+  ASSERT_TRUE(fs->writeFileAtomically(dir / "state", "old contents", 0644).ok());
   const std::string bytes("new\0bytes", 9);
-  ASSERT_TRUE(fs->writeFileAtomically(dir / "state", bytes, 0600));
+  ASSERT_TRUE(fs->writeFileAtomically(dir / "state", bytes, 0600).ok());
   EXPECT_EQ(ReadBytes(dir / "state"), bytes);
   EXPECT_EQ(ModeOf(dir / "state"), 0600u);
-  ASSERT_TRUE(fs->replaceFile(dir / "state", bytes + "!", 0640));  // the write without syncs
+  ASSERT_TRUE(fs->replaceFile(dir / "state", bytes + "!", 0640).ok());  // the write without syncs
   EXPECT_EQ(ReadBytes(dir / "state"), bytes + "!");
   EXPECT_EQ(ModeOf(dir / "state"), 0640u);
 
-  ASSERT_TRUE(fs->makeDirectories(dir / "a/b/c", 0700));
+  ASSERT_TRUE(fs->makeDirectories(dir / "a/b/c", 0700).ok());
   EXPECT_EQ(ModeOf(dir / "a"), 0700u);
   EXPECT_EQ(ModeOf(dir / "a/b/c"), 0700u);
-  EXPECT_TRUE(fs->makeDirectories(dir / "a/b/c")) << "existing folders are fine";
-  ASSERT_TRUE(fs->writeFileAtomically(dir / "a/b/c/inner", "inner"));
-  ASSERT_TRUE(fs->writeFileAtomically(dir / "plain", "plain"));
+  EXPECT_TRUE(fs->makeDirectories(dir / "a/b/c").ok()) << "existing folders are fine";
+  ASSERT_TRUE(fs->writeFileAtomically(dir / "a/b/c/inner", "inner").ok());
+  ASSERT_TRUE(fs->writeFileAtomically(dir / "plain", "plain").ok());
   const struct {
     bool folder;  // else a file
     const char* path;
@@ -66,7 +66,7 @@ TEST(FileSystemTest, WritesReplaceAtomicallyOrLeaveEverythingAsItWas) {
       statuses.push_back(fs->replaceFile(dir / row.path, "replacement"));
     }
     for (const Status& status : statuses) {
-      ASSERT_FALSE(status) << row.path;
+      ASSERT_FALSE(status.ok()) << row.path;
       EXPECT_EQ(status.error().domain(), kFileErrorDomain);
       EXPECT_EQ(status.error().code(), kFileWriteError);
     }
@@ -79,8 +79,8 @@ TEST(FileSystemTest, WritesReplaceAtomicallyOrLeaveEverythingAsItWas) {
 
 TEST(FileSystemTest, ReadsWholeFilesAndRefusesTheRest) {
   TempFolder dir;
-  ASSERT_TRUE(FileSystem::Default()->writeFileAtomically(dir / "ten", "0123456789"));
-  ASSERT_TRUE(FileSystem::Default()->makeDirectories(dir / "folder"));
+  ASSERT_TRUE(FileSystem::Default()->writeFileAtomically(dir / "ten", "0123456789").ok());
+  ASSERT_TRUE(FileSystem::Default()->makeDirectories(dir / "folder").ok());
   ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);  // no writer: opening it may block
   const struct {
     std::string name;
@@ -114,7 +114,7 @@ TEST(FileSystemTest, RemovesOnlyTheLeftoverTemporariesOfItsTarget) {
   FileSystem* fs = FileSystem::Default();
   const std::string uuid = "0F1E2D3C-4B5A-4978-8695-A4B3C2D1E0F9";
   const std::string lower = "0f1e2d3c-4b5a-4978-8695-a4b3c2d1e0f9";
-  ASSERT_TRUE(fs->writeFileAtomically(dir / "Annotations", "kept"));
+  ASSERT_TRUE(fs->writeFileAtomically(dir / "Annotations", "kept").ok());
   struct Entry {
     std::string name;
     bool folder;
@@ -134,7 +134,7 @@ TEST(FileSystemTest, RemovesOnlyTheLeftoverTemporariesOfItsTarget) {
     if (e.folder) {
       std::filesystem::create_directory(dir / e.name);
     } else {
-      ASSERT_TRUE(fs->writeFileAtomically(dir / e.name, "partial"));
+      ASSERT_TRUE(fs->writeFileAtomically(dir / e.name, "partial").ok());
     }
   }
   std::filesystem::create_symlink(dir / "Annotations",
@@ -206,7 +206,7 @@ TEST(PdocFileTest, FilesRoundTripAndKeepTheirErrorDomains) {
   TempFolder dir;
   const std::string path = dir / "Info.pdoc";
   Value value{{"BNBundleIdentifier", "org.example.plugin"}, {"count", 2}};
-  ASSERT_TRUE(pdoc::WriteFile(path, value));
+  ASSERT_TRUE(pdoc::WriteFile(path, value).ok());
   EXPECT_EQ(ModeOf(path), 0600u);
   Result<Value> back = pdoc::ReadFile(path);
   ASSERT_TRUE(back);
@@ -217,13 +217,13 @@ TEST(PdocFileTest, FilesRoundTripAndKeepTheirErrorDomains) {
   EXPECT_EQ(missing.error().domain(), kFileErrorDomain);
   EXPECT_EQ(missing.error().code(), kFileReadNoSuchFileError);
 
-  ASSERT_TRUE(FileSystem::Default()->writeFileAtomically(path, "{\"a\": null}"));
+  ASSERT_TRUE(FileSystem::Default()->writeFileAtomically(path, "{\"a\": null}").ok());
   Result<Value> broken = pdoc::ReadFile(path);
   ASSERT_FALSE(broken);
   EXPECT_EQ(broken.error().domain(), kPdocErrorDomain);
   EXPECT_NE(broken.error().localizedDescription().find(path), std::string::npos);
 
-  EXPECT_FALSE(pdoc::WriteFile(path, Value(Uuid::random())));
+  EXPECT_FALSE(pdoc::WriteFile(path, Value(Uuid::random())).ok());
   EXPECT_NE(pdoc::ReadFile(path).error().localizedDescription().find("null"), std::string::npos)
       << "a refused write must leave the file alone";
 }

@@ -118,7 +118,7 @@ TEST_F(EnableTest, SendsTheServiceOverlayWithTheEnvironment) {
     ASSERT_TRUE(plugIn);
     ScopedLogCapture log;
     pid_t pid = ::getpid();  // grants to processes that are gone are dropped
-    EXPECT_EQ(plugIn->enableForPid(pid), std::nullopt);
+    EXPECT_TRUE(plugIn->enableForPid(pid).ok());
     EXPECT_EQ(
         log.lines(),
         (std::vector<std::string>{Format("enabling pid=%d for plug-in com.example.a.ext(2.0) %@ %@",
@@ -141,15 +141,15 @@ TEST_F(EnableTest, RefusalsAreErrorsWithTheirLogLines) {
   const std::string path = *plugIn->url();
   ASSERT_EQ(::chmod((path + "/Contents/Exec/a").c_str(), 0644), 0);
   ScopedLogCapture log;
-  EXPECT_EQ(plugIn->enableForPid(77),
-            Error("Dromon", 4, "unable to enable plug-in " + id + " for pid 77"));
+  EXPECT_EQ(plugIn->enableForPid(77).description(),
+            Error("Dromon", 4, "unable to enable plug-in " + id + " for pid 77").description());
   ASSERT_EQ(log.lines().size(), 2u);
   EXPECT_EQ(log.lines()[1], "ipc error 13 allowing pid 77 to use plug-in com.example.a.ext(2.0) " +
                                 plugIn->uuid()->string() + " at " + path);
   std::filesystem::remove_all(path);
   log.clear();
-  EXPECT_EQ(plugIn->enableForPid(77),
-            Error("Dromon", 4, "cannot obtain executable path for plug-in " + id));
+  EXPECT_EQ(plugIn->enableForPid(77).description(),
+            Error("Dromon", 4, "cannot obtain executable path for plug-in " + id).description());
   EXPECT_EQ(log.lines().size(), 1u);  // "enabling ...", and no service-manager line
   EXPECT_TRUE(manager->externalServiceGrants().empty());
 }

@@ -425,12 +425,14 @@ TEST(DiagnoseTest, NamesWhatIsMissing) {
     ASSERT_NE(p, nullptr);
     ScopedLogCapture log;
     p->resolveSDK(&sm);
-    std::optional<Error> error = p->diagnose();
-    EXPECT_EQ(error ? error->ownDescription() : "", r.error);
-    EXPECT_TRUE(!error || (error->domain() == "Dromon" && error->code() == 12));
+    Status status = p->diagnose();
+    EXPECT_EQ(status.ok() ? "" : status.error().ownDescription(), r.error);
+    EXPECT_TRUE(status.ok() ||
+                (status.error().domain() == "Dromon" && status.error().code() == 12));
   }
-  std::optional<Error> error = DRPlugInCore().diagnose();
-  EXPECT_EQ(error.value_or(Error("", 0)).ownDescription(),
+  Status status = DRPlugInCore().diagnose();
+  ASSERT_FALSE(status.ok());
+  EXPECT_EQ(status.error().ownDescription(),
             "missing identifier (no UXExtensionIdentifier, nor even BNBundleIdentifier)");
 }
 
@@ -445,9 +447,7 @@ TEST(FormTest, ExportAndRebuildGiveAnEqualRecord) {
   p->setLocalizedName("Viewer");
   p->setLocalizedShortName("View");
   p->setLocalizedContainingName("Host");
-  std::optional<Error> error;
-  Value form = p->exportForm(&error);
-  EXPECT_FALSE(error.has_value());
+  Value form = p->exportForm();
   EXPECT_EQ(form["version"], Value("4.1"));
   EXPECT_EQ(form["annotations"], Value::EmptyDictionary());  // never absent
   EXPECT_FALSE(form["bundleInfo"].has("BNBundleInfoPdocURL"));
