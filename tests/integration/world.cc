@@ -6,11 +6,15 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <thread>
 
 #include <gtest/gtest.h>
+
+#include "platform/preferences.h"
+#include "wire/drm1.h"
 
 namespace dr::testing {
 namespace {
@@ -42,6 +46,59 @@ Value Request(const std::string& name, Dictionary fields) {
 
 uint64_t ErrorCode(const Value& reply) { return reply["errorcode"].uintValue(); }
 std::string ErrorText(const Value& reply) { return reply["error"].stringValue(); }
+Value Uuids(Array list) { return Value(std::move(list)); }
+size_t Occurrences(const std::string& text, const std::string& what) {
+  size_t n = 0;
+  for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+  return n;
+}
+
+std::string RawU32(uint32_t n) {
+  std::string out;
+  for (int i = 0; i < 4; ++i) out.push_back(static_cast<char>((n >> (8 * i)) & 0xFF));
+  return out;
+}
+std::string RawKey(const std::string& key) {
+  return RawU32(static_cast<uint32_t>(key.size())) + key;
+}
+std::string RawRequest(const std::string& body) {
+  return "DRM1" + RawU32(static_cast<uint32_t>(body.size())) + RawU32(1) + RawU32(0) + RawU32(0) +
+         RawU32(0) + RawU32(drm1::kFlagWantsReply) + RawU32(0) + body;
+}
+std::string NestedBody(int depth) {
+  std::string body = "\x0B" + RawU32(1) + RawKey("a");
+  for (int level = 2; level <= depth; ++level) body += "\x0A" + RawU32(level < depth ? 1 : 0);
+  return body;
+}
+
+std::vector<std::pair<std::string, std::string>> BrokenFrames() {
+  const std::string good = *drm1::EncodeFrame(1, 0, drm1::kFlagWantsReply, Request("match"));
+  auto with = [&](size_t at, const std::string& bytes) {
+    return good.substr(0, at) + bytes + good.substr(at + bytes.size());
+  };
+  const std::string over = RawU32(drm1::kMaxBodySize + 1);
+  return {
+      {"bad magic", with(0, "X")},
+      {"unknown flag", with(24, "\x05")},
+      {"reply flag from a client", with(24, "\x03")},
+      {"body length 16 MiB + 1, header only", with(4, over)},
+      {"body length 16 MiB + 1, body sent",
+       with(4, over) + std::string(drm1::kMaxBodySize + 1 - (good.size() - drm1::kHeaderSize), 0)},
+      {"string not UTF-8",
+       RawRequest("\x0B" + RawU32(1) + RawKey("request") + "\x07" + RawU32(2) + "\xC3\x28")},
+      {"key not UTF-8", RawRequest("\x0B" + RawU32(1) + RawKey("\xFF") + "\x02")},
+      {"duplicate key",
+       RawRequest("\x0B" + RawU32(2) + RawKey("request") + "\x02" + RawKey("request") + "\x01")},
+      {"nesting depth 65", RawRequest(NestedBody(65))},
+      {"count larger than the body", RawRequest("\x0B" + RawU32(1000))},
+      {"unknown tag", with(drm1::kHeaderSize, "\x0C")},
+      {"top level not a dictionary", with(drm1::kHeaderSize, "\x0A")},
+      {"trailing bytes",
+       with(4, RawU32(static_cast<uint32_t>(good.size() - drm1::kHeaderSize + 1))) +
+           std::string(1, '\0')},
+      {"serial zero", with(8, std::string(1, '\0'))},
+  };
+}
 
 HostApp::HostApp(const std::string& appPath, const std::string& executable,
                  const std::string& drdSocket, const std::string& relayFolder,
@@ -73,8 +130,6 @@ HostApp::HostApp(const std::string& appPath, const std::string& executable,
   if (c) connection_ = std::move(*c);
 }
 
-HostApp::~HostApp() { kill(); }
-
 void HostApp::kill() {
   connection_.reset();
   if (pid_ > 0) {
@@ -96,6 +151,15 @@ bool World::stop() {
   manager_.reset();
   drd_->signal(SIGTERM);
   return drd_->waitForExit() == 0;
+}
+
+std::string World::prefsFile() const {
+  const std::string config = path("config");
+  return CurrentHostPreferencesFile(
+      PreferencesOptionsFromEnvironment([&](const char* name) -> const char* {
+        return std::string_view(name) == "XDG_CONFIG_HOME" ? config.c_str() : ::getenv(name);
+      }),
+      "com.corvel.dromon.userprefs");
 }
 
 bool World::restart() { return stop() && start(environment_); }
@@ -140,14 +204,14 @@ std::string World::makeApp(const std::string& path, const std::string& id,
 std::string World::makePlugIn(const std::string& path, const std::string& id,
                               const std::string& version, const Dictionary& extra,
                               const Value& entitlements) const {
-  // Plug-ins must run sandboxed to be admitted.
   Dictionary granted = entitlements.dictionary();
   granted["com.corvel.security.app-sandbox"] = Value(true);
   Dictionary plugIn = extra;
-  plugIn["UXExtensionPointIdentifier"] = Value("com.example.point");
+  Value& point = plugIn["UXExtensionPointIdentifier"];
+  if (!point.isPresent()) point = Value("com.example.point");
   Dictionary attributes = plugIn["UXExtensionAttributes"].dictionary();
   attributes["UXExtensionIdentifier"] = Value(id);
-  attributes["UXExtensionPointName"] = Value("com.example.point");
+  attributes["UXExtensionPointName"] = plugIn["UXExtensionPointIdentifier"];
   plugIn["UXExtensionAttributes"] = Value(std::move(attributes));
   const std::string bundle =
       registry_test::MakeBundle(root_ / path,
@@ -176,11 +240,11 @@ Value World::match(const Value& rules, uint64_t flags, client::Connection* conne
 }
 
 std::string World::Identifiers(const Value& matches) {
+  std::vector<std::string> ids;
+  for (const Value& form : matches.array()) ids.push_back(form["identifier"].stringValue());
+  std::sort(ids.begin(), ids.end());
   std::string text;
-  for (const Value& form : matches.array()) {
-    if (!text.empty()) text += ' ';
-    text += form["identifier"].stringValue();
-  }
+  for (const std::string& id : ids) text += (text.empty() ? "" : " ") + id;
   return text;
 }
 
@@ -197,7 +261,7 @@ Value World::uuidOf(const std::string& id) const {
   const Value forms = everything();
   for (const Value& form : forms.array()) {
     if (form["identifier"].stringValue() == id) {
-      return Value(Uuid::parse(form["uuid"].stringValue()));  // forms carry the text
+      return Value(Uuid::parse(form["uuid"].stringValue()));
     }
   }
   ADD_FAILURE() << "no plug-in " << id << " registered";
