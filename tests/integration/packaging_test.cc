@@ -1,7 +1,6 @@
 // drd as it is installed and first met: the example application's plug-ins
-// register and are usable (through the registry and through a running drd),
-// and drd started the way its systemd units start it serves the socket it is
-// handed and reports itself ready.
+// register and are usable through a running drd, and drd started the way its systemd units start it
+// serves the socket it is handed and reports itself ready.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -14,21 +13,17 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <map>
 #include <optional>
 #include <set>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "platform/service_manager.h"
-#include "plugin/plugin.h"
-#include "registry/registry.h"
-#include "registry/service_manager_linux.h"
 #include "tests/integration/world.h"
 #include "tests/support/process_fixtures.h"
 
@@ -50,106 +45,76 @@ std::string ExamplesDir() {
 }
 std::string GalleryApp() { return ExamplesDir() + "/Gallery.app"; }
 
-// What each example bundle must register as, and what drd's record of each
-// of its plug-ins says once its SDK is merged in: identifier, protocol,
-// point name, hub protocol version, version, and the SDK's CleanTimeout
-// where the SDK reaches the plug-in's dictionary.
+// What each example plug-in must register as once its SDK is merged in:
+// bundle, identifier, protocol, point name, hub protocol version, version,
+// and the SDK's CleanTimeout where the SDK reaches the plug-in's dictionary.
 struct ExamplePlugIn {
-  std::string identifier, protocol, pointName;
+  std::string bundle, identifier, protocol, pointName;
   uint64_t hubProtocolVersion;
   std::string version;
-  std::optional<int64_t> sdkCleanTimeout;
+  Value cleanTimeout;
 };
-const std::pair<std::string, std::vector<ExamplePlugIn>> kExamples[] = {
+const ExamplePlugIn kExamples[] = {
     // One multiple bundle: each plug-in states its own protocol and point,
     // since the SDK completes the bundle's top dictionary only.
-    {"Adjust.appex",
-     {{"org.example.gallery.filter.brightness", kFilterProtocol, kFilterPoint, 2, "2.0", {}},
-      {"org.example.gallery.filter.contrast", kFilterProtocol, kFilterPoint, 2, "2.0", {}}}},
-    {"Presets.appex",
-     {{"org.example.gallery.presets", "#Data", "org.example.gallery.presets", 2, "1.0", {}}}},
+    {"Adjust.appex", "org.example.gallery.filter.brightness", kFilterProtocol, kFilterPoint, 2,
+     "2.0", Value()},
+    {"Adjust.appex", "org.example.gallery.filter.contrast", kFilterProtocol, kFilterPoint, 2, "2.0",
+     Value()},
+    {"Presets.appex", "org.example.gallery.presets", "#Data", "org.example.gallery.presets", 2,
+     "1.0", Value()},
     // New style: protocol and point name come from the SDK.
-    {"Sepia.appex",
-     {{"org.example.gallery.filter.sepia", kFilterProtocol, kFilterPoint, 2, "1.2", 30}}},
+    {"Sepia.appex", "org.example.gallery.filter.sepia", kFilterProtocol, kFilterPoint, 2, "1.2",
+     Value(30)},
     // Old style ("Dromon"): converted, then completed from the same SDK.
-    {"Vignette.appex",
-     {{"org.example.gallery.filter.vignette", kFilterProtocol, kFilterPoint, 1, "0.9", 30}}},
+    {"Vignette.appex", "org.example.gallery.filter.vignette", kFilterProtocol, kFilterPoint, 1,
+     "0.9", Value(30)},
 };
 
-// Offline, with the registry and drd's plug-in records themselves: every
-// bundle in Gallery.app is in the table (an example added without its row
-// fails), registers with the expected plug-ins, and each plug-in passes the
-// checks that decide whether drd offers it at all.
-TEST(ExamplesTest, EveryPlugInRegistersAndIsAdmitted) {
+// What ./dev examples does, through a real drd with the examples' SDK folder
+// on DR_SDK_PATH: install Gallery by copying it into the install folder
+// while drd runs (no "add"); every plug-in of every bundle registers as the
+// table says (an example added without its row fails), is found by the
+// rules a host would send, and readies.
+TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
   std::set<std::string> onDisk, listed;
   for (const auto& e : std::filesystem::directory_iterator(GalleryApp() + "/Contents/PlugIns")) {
     onDisk.insert(e.path().filename().string());
   }
-  for (const auto& [name, plugIns] : kExamples) listed.insert(name);
+  for (const ExamplePlugIn& e : kExamples) listed.insert(e.bundle);
   EXPECT_EQ(onDisk, listed);
 
-  TempFolder home;
-  ASSERT_EQ(::setenv("DR_SDK_PATH", (ExamplesDir() + "/SDKs").c_str(), 1), 0);
-  RegistryOptions options;
-  options.databasePath = home / "registry.sqlite3";
-  Result<std::unique_ptr<Registry>> registry = Registry::Open(options);
-  ASSERT_TRUE(registry) << registry.error().description();
-  std::unique_ptr<ServiceManager> serviceManager = NewServiceManager({registry->get()});
-  PlugInServices services;
-  services.serviceManager = serviceManager.get();
-  services.getenv = [](const char*) -> const char* { return nullptr; };
-  // The application holds plug-ins but is none itself.
-  Status app = (*registry)->registerBundle(GalleryApp());
-  ASSERT_FALSE(app.ok());
-  EXPECT_EQ(app.error().code(), kRegistryRefused) << app.description();
-
-  for (const auto& [name, plugIns] : kExamples) {
-    SCOPED_TRACE(name);
-    const std::string path = GalleryApp() + "/Contents/PlugIns/" + name;
-    Status registered = (*registry)->registerBundle(path);
-    ASSERT_TRUE(registered.ok()) << registered.error().description();
-    RegistryEntries entries = (*registry)->entriesForUrl(path);
-    ASSERT_EQ(entries.size(), plugIns.size());
-    for (size_t i = 0; i < entries.size(); ++i) {
-      const ExamplePlugIn& want = plugIns[i];
-      SCOPED_TRACE(want.identifier);
-      EXPECT_EQ(entries[i]->plugInIdentifier(), want.identifier);
-      ASSERT_TRUE(entries[i]->containingApplication());
-      EXPECT_EQ(entries[i]->containingApplication()->url, GalleryApp());
-      EXPECT_EQ(entries[i]->containingApplication()->displayName, "Gallery");
-      std::shared_ptr<DRDPlugIn> plugIn = DRDPlugIn::initWithRGData(entries[i], services);
-      ASSERT_TRUE(plugIn) << "drd would ignore this plug-in (see its log line)";
-      EXPECT_EQ(plugIn->protocolSpec(), Value(want.protocol));
-      EXPECT_EQ(plugIn->attributes()["UXExtensionPointName"], Value(want.pointName));
-      EXPECT_EQ(plugIn->hubProtocolVersion(), want.hubProtocolVersion);
-      EXPECT_EQ(plugIn->version(), want.version);
-      if (want.sdkCleanTimeout) {
-        EXPECT_EQ(plugIn->plugInDictionary()["CleanTimeout"], Value(*want.sdkCleanTimeout));
-      }
-      // Everything but data needs an executable for drd to hand to hosts.
-      if (!plugIn->isData()) {
-        const std::string exe = path + "/Contents/Exec/" +
-                                plugIn->bundleInfoDictionary()["BNBundleExecutable"].stringValue();
-        EXPECT_EQ(::access(exe.c_str(), X_OK), 0) << exe;
-      }
-    }
-  }
-}
-
-// What ./dev examples does, through a real drd with the examples' SDK folder
-// on DR_SDK_PATH: install Gallery by copying it into the install folder
-// while drd runs (no "add"), find the plug-ins by the rules a host would
-// send, ready them.
-TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
   testing::World w;
   ASSERT_TRUE(w.start({"DR_SDK_PATH=" + ExamplesDir() + "/SDKs"})) << w.log();
+  const std::string gallery = w.path("installed/Gallery.app");
   std::filesystem::create_directories(w.path("installed"));
-  std::filesystem::copy(GalleryApp(), w.path("installed/Gallery.app"),
-                        std::filesystem::copy_options::recursive);
-  // Its four bundles hold five plug-ins.
-  for (auto deadline = std::chrono::steady_clock::now() + 10s; w.match().size() < 5;) {
+  std::filesystem::copy(GalleryApp(), gallery, std::filesystem::copy_options::recursive);
+  for (auto deadline = std::chrono::steady_clock::now() + 10s;
+       w.match().size() < std::size(kExamples);) {
     ASSERT_LT(std::chrono::steady_clock::now(), deadline) << w.log();
     std::this_thread::sleep_for(100ms);
+  }
+  // The application holds plug-ins but is none itself.
+  EXPECT_EQ(testing::ErrorCode(w.add({gallery})), 2u);
+  Array all;
+  for (const Value forms = w.match(); const Value& form : forms.array()) {
+    SCOPED_TRACE(form["identifier"].stringValue());
+    auto want = std::find_if(std::begin(kExamples), std::end(kExamples), [&](const auto& e) {
+      return e.identifier == form["identifier"].stringValue();
+    });
+    ASSERT_NE(want, std::end(kExamples));
+    const Value& info = form["info"];
+    EXPECT_EQ(form["path"], Value(gallery + "/Contents/PlugIns/" + want->bundle));
+    EXPECT_EQ(form["containingPath"], Value(gallery));
+    EXPECT_EQ(form["localizedContainingDisplayName"], Value("Gallery"));
+    EXPECT_EQ(info["UXExtensionProtocol"], Value(want->protocol));
+    EXPECT_EQ(info["UXExtensionAttributes"]["UXExtensionPointName"], Value(want->pointName));
+    EXPECT_EQ(form["hubProtocolVersion"].uintValue(), want->hubProtocolVersion);
+    EXPECT_EQ(form["version"], Value(want->version));
+    if (want->cleanTimeout.isPresent()) {
+      EXPECT_EQ(info["CleanTimeout"], want->cleanTimeout);
+    }
+    all.push_back(Value(Uuid::parse(form["uuid"].stringValue())));
   }
   const std::string brightness = "org.example.gallery.filter.brightness",
                     contrast = "org.example.gallery.filter.contrast",
@@ -172,10 +137,6 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
   // Readying hands each filter's executable to the service manager, so a
   // missing or non-executable Exec/ file fails here; the data plug-in needs
   // none.
-  Array all;
-  for (const Value forms = w.match(); const Value& form : forms.array())
-    all.push_back(Value(Uuid::parse(form["uuid"].stringValue())));
-  ASSERT_EQ(all.size(), 5u);
   Value readied = w.call(testing::Request("ready", {{"uuids", Value(all)}}));
   EXPECT_EQ(testing::ErrorCode(readied), 0u) << readied.description() << w.log();
 }

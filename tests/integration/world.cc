@@ -20,21 +20,6 @@ namespace dr::testing {
 namespace {
 
 constexpr const char* kServiceName = "com.corvel.dromon.drd";
-constexpr uint64_t kCallFailed = 99999;
-constexpr uint64_t kDiscoverAll = 0x200;
-
-std::string RelayBinary() {
-  std::string tests = DrdProcess::BinaryPath();
-  tests = tests.substr(0, tests.rfind('/'));      // build/<dir>/daemon
-  tests = tests.substr(0, tests.rfind('/') + 1);  // build/<dir>/
-  return tests + "tests/drd_relay_host";
-}
-
-void CopyExecutable(const std::string& from, const std::string& to) {
-  std::filesystem::create_directories(std::filesystem::path(to).parent_path());
-  std::filesystem::copy_file(from, to, std::filesystem::copy_options::overwrite_existing);
-  ::chmod(to.c_str(), 0755);
-}
 
 }  // namespace
 
@@ -100,43 +85,22 @@ std::vector<std::pair<std::string, std::string>> BrokenFrames() {
   };
 }
 
-HostApp::HostApp(const std::string& appPath, const std::string& executable,
-                 const std::string& drdSocket, const std::string& relayFolder,
-                 std::vector<std::string> launcher) {
-  const std::string program = appPath + "/Contents/Exec/" + executable;
-  CopyExecutable(RelayBinary(), program);
+HostApp::HostApp(const std::string& appPath, const std::string& drdSocket,
+                 const std::string& relayFolder, std::vector<std::string> launcher) {
+  const std::string drd = DrdProcess::BinaryPath();  // <build>/daemon/drd
+  const std::string program = appPath + "/Contents/Exec/host";
+  std::filesystem::create_directories(appPath + "/Contents/Exec");
   std::filesystem::create_directories(relayFolder);
-  const std::string relaySocket = relayFolder + "/" + kServiceName;
-  int out[2];
-  if (::pipe2(out, O_CLOEXEC) != 0) return;
-  pid_ = ::fork();
-  if (pid_ == 0) {
-    ::dup2(out[1], STDOUT_FILENO);
-    std::vector<std::string> args = std::move(launcher);
-    args.insert(args.end(), {program, drdSocket, relaySocket});
-    std::vector<char*> argv;
-    for (std::string& a : args) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    ::execv(argv[0], argv.data());
-    ::_exit(127);
-  }
-  ::close(out[1]);
-  char line[16] = {};
-  ssize_t n = ::read(out[0], line, sizeof line - 1);  // "ready" once it listens
-  ::close(out[0]);
-  if (n <= 0) return;
+  std::filesystem::copy_file(drd.substr(0, drd.rfind("/daemon/")) + "/tests/drd_relay_host",
+                             program, std::filesystem::copy_options::overwrite_existing);
+  launcher.insert(launcher.end(), {program, drdSocket, relayFolder + "/" + kServiceName});
+  child_ = std::make_unique<Child>(launcher[0],
+                                   std::vector<std::string>(launcher.begin() + 1, launcher.end()),
+                                   std::vector<std::string>{});
+  if (child_->readLine() != "ready") return;
   Result<std::unique_ptr<client::Connection>> c =
       client::Connection::Open(kServiceName, relayFolder);
   if (c) connection_ = std::move(*c);
-}
-
-void HostApp::kill() {
-  connection_.reset();
-  if (pid_ > 0) {
-    ::kill(pid_, SIGKILL);
-    ::waitpid(pid_, nullptr, 0);
-    pid_ = -1;
-  }
 }
 
 World::World() { std::filesystem::create_directories(root_ / "system"); }
@@ -183,12 +147,10 @@ Value World::call(const Value& request, client::Connection* connection) const {
     own = connect();
     connection = own.get();
   }
-  if (!connection) return Value{{"errorcode", Value(kCallFailed)}, {"error", "no connection"}};
+  const Value failed{{"errorcode", Value(uint64_t{99999})}};
+  if (!connection) return failed;
   Result<Value> reply = connection->request(request, std::chrono::seconds(20));
-  if (!reply) {
-    return Value{{"errorcode", Value(kCallFailed)}, {"error", reply.error().description()}};
-  }
-  return *reply;
+  return reply ? *reply : failed;
 }
 
 std::string World::makeApp(const std::string& path, const std::string& id,
@@ -220,8 +182,7 @@ std::string World::makePlugIn(const std::string& path, const std::string& id,
                                       {"BNBundleExecutable", "run"},
                                       {"UXExtension", Value(std::move(plugIn))}},
                                 Value(std::move(granted)));
-  registry_test::WriteBytes(bundle + "/Contents/Exec/run", "#!/bin/sh\nexec sleep 60\n");
-  ::chmod((bundle + "/Contents/Exec/run").c_str(), 0755);
+  WriteTestFile(bundle + "/Contents/Exec/run", "#!/bin/sh\nexec sleep 60\n", 0755);
   return bundle;
 }
 
@@ -254,7 +215,7 @@ Value World::everything() const {
             Value{{"com.corvel.private.dromon.manager", true}});
     manager_ = host("Manager.app");
   }
-  return match(Value(), kDiscoverAll, manager_->connection());
+  return match(Value(), 0x200, manager_->connection());  // all plug-ins
 }
 
 Value World::uuidOf(const std::string& id) const {
@@ -272,7 +233,7 @@ std::unique_ptr<HostApp> World::host(const std::string& app,
                                      std::vector<std::string> launcher) const {
   static int count = 0;
   auto h =
-      std::make_unique<HostApp>(root_ / app, "host", drd_->socketPath(),
+      std::make_unique<HostApp>(root_ / app, drd_->socketPath(),
                                 root_ / ("relays/" + std::to_string(++count)), std::move(launcher));
   EXPECT_NE(h->connection(), nullptr) << "host " << app << " did not connect";
   return h;

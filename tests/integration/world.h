@@ -14,6 +14,7 @@
 
 #include "client/include/drd/connection.h"
 #include "core/value.h"
+#include "tests/integration/drkit_runner.h"
 #include "tests/support/drm1_peer.h"
 #include "tests/support/registry_bundles.h"
 
@@ -45,23 +46,22 @@ std::string RawRequest(const std::string& body);
 std::string NestedBody(int depth);
 std::vector<std::pair<std::string, std::string>> BrokenFrames();
 
-// A copy of the relay program at <app>/Contents/Exec/<executable>, connected
-// to drd, so drd judges it by that bundle; the test talks through it.
-// `launcher`: a command the host is started through (a sandbox, say).
+// A copy of the relay program at <app>/Contents/Exec/host, connected to drd,
+// so drd judges it by that bundle; the test talks through it. `launcher`:
+// a command the host is started through (a sandbox, say).
 class HostApp {
  public:
-  HostApp(const std::string& appPath, const std::string& executable, const std::string& drdSocket,
-          const std::string& relayFolder, std::vector<std::string> launcher = {});
-  ~HostApp() { kill(); }
-  HostApp(const HostApp&) = delete;
-  HostApp& operator=(const HostApp&) = delete;
-
-  pid_t pid() const { return pid_; }
+  HostApp(const std::string& appPath, const std::string& drdSocket, const std::string& relayFolder,
+          std::vector<std::string> launcher);
+  pid_t pid() const { return child_->pid(); }
   client::Connection* connection() const { return connection_.get(); }
-  void kill();
+  void kill() {
+    connection_.reset();
+    child_.reset();
+  }
 
  private:
-  pid_t pid_ = -1;
+  std::unique_ptr<Child> child_;
   std::unique_ptr<client::Connection> connection_;
 };
 
