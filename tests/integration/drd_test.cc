@@ -62,7 +62,9 @@ TEST_F(DrdTest, CommandLines) {
 }
 
 // drd says where it serves and which registry it opened, and that it
-// stopped; the socket file it made goes with it.
+// stopped; the socket file it made goes with it, and a client library
+// connection sees it close. A message wanting no reply leaves no reply
+// behind to be taken for the next request's.
 TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
   Start();
   const std::string socket = drd_->socketPath();
@@ -78,12 +80,25 @@ TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
   }
   EXPECT_EQ(log, "drd 0.1.0 listening on " + socket + " (registry " + root_.path() +
                      "/registry/r.sqlite3)\n");
+  Result<std::unique_ptr<client::Connection>> c =
+      client::Connection::Open("com.corvel.dromon.drd", root_ / "sockets");
+  ASSERT_TRUE(c) << c.error().description();
+  ASSERT_TRUE((*c)->send(Request("frobnicate")).ok());
+  Result<Value> reply = (*c)->request(Request("bulk"), 10s);
+  ASSERT_TRUE(reply) << reply.error().description();
+  EXPECT_EQ(ErrorText(*reply), "");
   ASSERT_TRUE(drd_->signal(SIGTERM));
   EXPECT_EQ(drd_->waitForExit(), 0);
   log = drd_->standardError();
   EXPECT_EQ(log.substr(log.rfind('\n', log.size() - 2) + 1), "drd stopped\n");
   EXPECT_NE(::access(socket.c_str(), F_OK), 0) << "the socket file is left behind";
   drd_.reset();
+  reply = (*c)->request(Request("bulk"), 10s);
+  ASSERT_FALSE(reply);
+  EXPECT_EQ(reply.error().domain(), client::kClientErrorDomain);
+  EXPECT_EQ(reply.error().code(), client::kConnectionClosed) << reply.error().description();
+  EXPECT_FALSE((*c)->isOpen());
+  EXPECT_FALSE(client::Connection::Open("com.corvel.dromon.drd", root_ / "sockets"));
 }
 
 // The last -S counts. Lines carry their priority only when JOURNAL_STREAM

@@ -24,16 +24,14 @@
 #include <thread>
 #include <vector>
 
+#include "tests/integration/drkit_runner.h"
 #include "tests/integration/world.h"
 #include "tests/support/process_fixtures.h"
 
-namespace dr {
+namespace dr::testing {
 namespace {
 
 using namespace std::chrono_literals;
-using testing::DrdProcess;
-using testing::Drm1Peer;
-using testing::TempFolder;
 
 constexpr char kFilterPoint[] = "org.example.gallery.filter";
 constexpr char kFilterProtocol[] = "org.example.gallery.FilterProtocol";
@@ -84,7 +82,7 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
   for (const ExamplePlugIn& e : kExamples) listed.insert(e.bundle);
   EXPECT_EQ(onDisk, listed);
 
-  testing::World w;
+  World w;
   ASSERT_TRUE(w.start({"DR_SDK_PATH=" + ExamplesDir() + "/SDKs"})) << w.log();
   const std::string gallery = w.path("installed/Gallery.app");
   std::filesystem::create_directories(w.path("installed"));
@@ -95,7 +93,7 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
     std::this_thread::sleep_for(100ms);
   }
   // The application holds plug-ins but is none itself.
-  EXPECT_EQ(testing::ErrorCode(w.add({gallery})), 2u);
+  EXPECT_EQ(ErrorCode(w.add({gallery})), 2u);
   Array all;
   for (const Value forms = w.match(); const Value& form : forms.array()) {
     SCOPED_TRACE(form["identifier"].stringValue());
@@ -132,13 +130,13 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
       {Value{{"AcceptedTypes", Value{{"image/jpeg", 2}}}}, sepia},
   };
   for (const auto& [rules, identifiers] : rows) {
-    EXPECT_EQ(testing::World::Identifiers(w.match(rules)), identifiers) << rules.description();
+    EXPECT_EQ(World::Identifiers(w.match(rules)), identifiers) << rules.description();
   }
   // Readying hands each filter's executable to the service manager, so a
   // missing or non-executable Exec/ file fails here; the data plug-in needs
   // none.
-  Value readied = w.call(testing::Request("ready", {{"uuids", Value(all)}}));
-  EXPECT_EQ(testing::ErrorCode(readied), 0u) << readied.description() << w.log();
+  Value readied = w.call(Request("ready", {{"uuids", Value(all)}}));
+  EXPECT_EQ(ErrorCode(readied), 0u) << readied.description() << w.log();
 }
 
 // ---- Socket activation, as drd.socket and drd.service run it -----------------
@@ -149,7 +147,9 @@ int BoundSocket(const std::string& path, int type) {
   const std::string folder = std::filesystem::path(path).parent_path();
   std::filesystem::create_directories(folder);
   ::chmod(folder.c_str(), 0700);
-  int fd = ::socket(AF_UNIX, type, 0);
+  // Above the descriptors the shell moves them to.
+  int fd = type == SOCK_STREAM ? ::fcntl(::socket(AF_UNIX, type, 0), F_DUPFD, 64)
+                               : ::socket(AF_UNIX, type, 0);
   sockaddr_un addr{};
   addr.sun_family = AF_UNIX;
   std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
@@ -172,76 +172,27 @@ TEST_P(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehi
   const std::string runtime = root / "run/dromon";  // %t/dromon
   const std::string socketPath = runtime + "/" + kService;
   const int listenFd = BoundSocket(socketPath, SOCK_STREAM);
-  const int decoyFd = decoyFirst ? BoundSocket(root / "run/other.sock", SOCK_STREAM) : -1;
+  const int decoyFd = decoyFirst ? BoundSocket(root / "run/other.sock", SOCK_STREAM) : listenFd;
   const int notifyFd = BoundSocket(root / "notify.sock", SOCK_DGRAM | SOCK_CLOEXEC);
-  ASSERT_TRUE(listenFd >= 0 && notifyFd >= 0 && (decoyFd >= 0 || !decoyFirst));
+  ASSERT_TRUE(listenFd >= 0 && decoyFd >= 0 && notifyFd >= 0);
   struct stat before {};
   ASSERT_EQ(::lstat(socketPath.c_str(), &before), 0);
-
-  const std::string binary = DrdProcess::BinaryPath();
-  const std::string errorFile = root / "drd.stderr";
-  // Everything the child needs is made before fork; it only fills in its
-  // own pid before exec.
-  char listenPid[32] = "LISTEN_PID=";
-  std::vector<std::string> env = {
-      decoyFirst ? "LISTEN_FDS=2" : "LISTEN_FDS=1",
-      "NOTIFY_SOCKET=" + root / "notify.sock",
-      "DR_SOCKET_DIR=" + runtime,  // as drd.service sets it
-      "DR_REGISTRY=" + root / "registry.sqlite3",
-      "XDG_STATE_HOME=" + root / "state",
-      "XDG_CONFIG_HOME=" + root / "config",
-      "XDG_DATA_HOME=" + root / "data",
-      "HOME=" + root.path(),
-  };
-  std::vector<char*> envp{listenPid};
-  for (std::string& e : env) envp.push_back(e.data());
-  envp.push_back(nullptr);
-  char* argv[] = {const_cast<char*>(binary.c_str()), nullptr};
-  const pid_t pid = ::fork();
-  ASSERT_GE(pid, 0);
-  if (pid == 0) {
-    // What systemd execs: the sockets as the first passed descriptors, moved
-    // out of the way first so that neither overwrites the other, and only
-    // they stay open (a socket drd closes must stop listening).
-    int err = ::open(errorFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (err >= 0) ::dup2(err, STDERR_FILENO);
-    const int listenHigh = ::fcntl(listenFd, F_DUPFD, 64);
-    const int decoyHigh = decoyFirst ? ::fcntl(decoyFd, F_DUPFD, 64) : -1;
-    if (decoyFirst && ::dup2(decoyHigh, SD_LISTEN_FDS_START) < 0) ::_exit(126);
-    if (::dup2(listenHigh, SD_LISTEN_FDS_START + (decoyFirst ? 1 : 0)) < 0) ::_exit(126);
-    for (int fd : {listenFd, decoyFd, listenHigh, decoyHigh}) {
-      if (fd > SD_LISTEN_FDS_START + 1) ::close(fd);
-    }
-    std::snprintf(listenPid, sizeof listenPid, "LISTEN_PID=%d", static_cast<int>(::getpid()));
-    ::execve(binary.c_str(), argv, envp.data());
-    ::_exit(127);
-  }
-  ::close(listenFd);  // from here on only drd holds it, as under systemd
-  if (decoyFirst) ::close(decoyFd);
-  auto standardError = [&] {
-    std::ifstream in(errorFile);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  };
-  // drd must not outlive the test, even after a failed assertion (it would
-  // hold the test runner's output open): SIGKILL when it does not exit.
-  std::optional<int> status;
-  auto reap = [&](std::chrono::milliseconds timeout) {
-    int raw = 0;
-    for (auto deadline = std::chrono::steady_clock::now() + timeout; !status;) {
-      if (::waitpid(pid, &raw, WNOHANG) == pid) {
-        status = WIFEXITED(raw) ? WEXITSTATUS(raw) : -1;
-      } else if (std::chrono::steady_clock::now() >= deadline) {
-        ::kill(pid, SIGKILL);
-        ::waitpid(pid, &raw, 0);
-        status = -1;
-      } else {
-        std::this_thread::sleep_for(10ms);
-      }
-    }
-    return *status;
-  };
-  std::shared_ptr<void> reapOnReturn(nullptr, [&](void*) { reap(0ms); });
-
+  // What systemd execs: the sockets as the first passed descriptors, and
+  // only they open (a socket drd closes must stop listening); the shell's
+  // pid is drd's.
+  const std::string l = std::to_string(listenFd), d = std::to_string(decoyFd);
+  const std::string fds =
+      decoyFirst ? "3<&" + d + " 4<&" + l + " LISTEN_FDS=2" : "3<&" + l + " LISTEN_FDS=1";
+  Child drd("/bin/bash",
+            {"-c",
+             "exec " + fds.substr(0, fds.find(" LISTEN")) + " " + l + "<&- " + d +
+                 "<&-; LISTEN_PID=$$" + fds.substr(fds.find(" LISTEN")) + " exec \"$0\"",
+             DrdProcess::BinaryPath()},
+            {"NOTIFY_SOCKET=" + root / "notify.sock", "DR_SOCKET_DIR=" + runtime,
+             "DR_REGISTRY=" + root / "registry.sqlite3", "XDG_STATE_HOME=" + root / "state",
+             "XDG_CONFIG_HOME=" + root / "config", "XDG_DATA_HOME=" + root / "data",
+             "HOME=" + root.path()});
+  for (int fd : {listenFd, decoyFd}) ::close(fd);  // only drd holds them, as under systemd
   std::string seen;  // the notify messages, until READY=1 or 10 s pass
   for (auto deadline = std::chrono::steady_clock::now() + 10s;
        ("\n" + seen).find("\nREADY=1\n") == std::string::npos &&
@@ -252,18 +203,13 @@ TEST_P(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehi
     if (n > 0) seen += std::string(buf, static_cast<size_t>(n)) + "\n";
   }
   ::close(notifyFd);
-  ASSERT_NE(("\n" + seen).find("\nREADY=1\n"), std::string::npos)
-      << "no READY=1 (got " << seen << "): " << standardError();
-  {
-    Drm1Peer peer(socketPath);
-    ASSERT_TRUE(peer.send(7, testing::Request("bulk")));
-    std::optional<drm1::Frame> reply = peer.receive();
-    ASSERT_TRUE(reply) << standardError();
-    EXPECT_EQ(reply->header.replyTo, 7u);
-    EXPECT_FALSE(reply->body.has("error")) << reply->body.description();
-  }
-  ASSERT_EQ(::kill(pid, SIGTERM), 0);
-  EXPECT_EQ(reap(10s), 0) << standardError();
+  EXPECT_NE(("\n" + seen).find("\nREADY=1\n"), std::string::npos) << "got " << seen;
+  Drm1Peer peer(socketPath);
+  ASSERT_TRUE(peer.send(7, Request("bulk")));
+  std::optional<drm1::Frame> reply = peer.receive();
+  EXPECT_TRUE(reply && reply->header.replyTo == 7u && !reply->body.has("error"));
+  drd.signal(SIGTERM);
+  EXPECT_EQ(drd.wait(), 0) << drd.err();
   // The socket is systemd's: still the same file after drd is gone, so the
   // next client starts drd again.
   struct stat after {};
@@ -273,4 +219,4 @@ TEST_P(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehi
 }
 
 }  // namespace
-}  // namespace dr
+}  // namespace dr::testing
