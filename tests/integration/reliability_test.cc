@@ -96,8 +96,6 @@ Value Annotate(const Value& annotations, const Value& uuid) {
   return Request("annotate", {{"annotations", annotations}, {"uuids", Value(Array{uuid})}});
 }
 
-// ---------------------------------------------------------------- crashes
-
 // Acknowledged "annotate" and "add" requests survive a SIGKILL at a random
 // moment. One writer sets "extension" = {"n": k} on plug-in k % count with
 // increasing k, another registers new bundles; after each crash every
@@ -187,25 +185,15 @@ TEST(ReliabilityTest, AcknowledgedChangesSurviveKill9) {
   std::sort(names.begin(), names.end());
   std::erase(names, "sandbox.key");
   EXPECT_EQ(names, (std::vector<std::string>{"Annotations", "Annotations.tmp-keep"}));
-  std::cout << kKills << " kills; " << next << " annotations and " << registered.size()
-            << " registrations acknowledged\n";
-}
-
-// ---------------------------------------------------------------- faults
-
-TEST(ReliabilityTest, PrivateFilesAreOwnerOnly) {
-  World w;
-  ASSERT_TRUE(w.start()) << w.log();
-  const PlugIns p = RegisterPlugIns(w, "perm", 1);
-  ASSERT_EQ(ErrorCode(w.call(Annotate(Value{{"election", 1}}, p.uuids[0]))), 0u);
+  // drd's private files are its user's only.
   ASSERT_EQ(ErrorCode(w.call(Request("access", {{"uuids", Value(Array{p.uuids[0]})}}))), 0u);
-  const std::pair<std::string, mode_t> rows[] = {
+  const std::pair<std::string, mode_t> modes[] = {
       {w.path("sockets"), 0700},
-      {w.path("state/com.corvel.dromon"), 0700},
+      {folder, 0700},
       {AnnotationFile(w), 0600},
-      {w.path("state/com.corvel.dromon/sandbox.key"), 0600},
+      {folder + "/sandbox.key", 0600},
   };
-  for (const auto& [path, mode] : rows) {
+  for (const auto& [path, mode] : modes) {
     struct stat st {};
     EXPECT_EQ(::stat(path.c_str(), &st) == 0 ? (st.st_mode & 07777) : 0, mode) << path;
   }
@@ -369,8 +357,6 @@ TEST(ReliabilityTest, PlugInThatCannotTravelNeverBreaksDiscovery) {
   EXPECT_TRUE(IsValidUtf8(w.log())) << w.log();
 }
 
-// ---------------------------------------------------------------- load
-
 // One client: `count` requests in pipelined batches of 8, mixing "match",
 // "annotate", "lock" and its release, "access" and "ready"; the number of
 // replies, each matched to its request (0 after a lost or stray one).
@@ -459,8 +445,6 @@ TEST(ReliabilityTest, ConcurrentClientsGetEveryReplyWithoutLeaking) {
   // A leak guard, not a measurement.
   EXPECT_LE(after, 2 * warm + (16u << 20)) << "warm " << warm << ", after " << after;
 }
-
-// ---------------------------------------------------------------- hostile connections
 
 // Peers of the user's own uid that try to stop drd for everyone else, while
 // another client must be answered within two seconds throughout:
