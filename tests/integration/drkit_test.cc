@@ -135,6 +135,11 @@ TEST_F(DrkitTest, AccessTokensGrantTheBundleAndReadyChecksThePlugIn) {
   const std::string token = tokens.substr(0, tokens.find('\n'));
   EXPECT_EQ(tokens, token + "\n" + token + "\n");
   EXPECT_EQ(ok({"extension", "consume", token}), a + "\n");
+  EXPECT_EQ(ok({"extension", "open", token, "Contents/Info.pdoc"}),
+            registry_test::ReadBytes(a + "/Contents/Info.pdoc"));
+  Ran missing = drkit({"extension", "open", token, "Contents/none"});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_EQ(missing.err.rfind("drkit: Contents/none: ", 0), 0u) << missing.err;
   std::string altered = token;
   altered.back() = altered.back() == '0' ? '1' : '0';
   for (const std::string& bad : {altered, std::string("garbage")}) {
@@ -278,6 +283,7 @@ TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
       {{"annotate", "-i", "com.example.a", "--json"}, {}, Value{{"color", "red"}}},
       {{"access", uuid, "--json"}, {}, Value(Array{Value{{"uuid", uuid}, {"token", token}}})},
       {{"extension", "consume", token, "--json"}, {}, Value{{"path", a}}},
+      {{"extension", "open", token, "--json"}, {"names", "0"}, Value("Contents")},
       {{"exclude", "list", "--json"},
        {},
        Value(Array{Value{{"UXExtensionIdentifier", "com.example.b"}}})},

@@ -101,15 +101,19 @@ HostApp::HostApp(const std::string& appPath, const std::string& drdSocket,
 }
 
 World::World() { std::filesystem::create_directories(root_ / "system"); }
+World::~World() {
+  if (serving_) stop();
+}
 
 bool World::start(std::vector<std::string> environment) {
   environment_ = std::move(environment);
   drd_ = std::make_unique<DrdProcess>(root_.path(), std::vector<std::string>{"-v"}, environment_);
-  return drd_->waitUntilServing();
+  return serving_ = drd_->waitUntilServing();
 }
 
 bool World::stop() {
   manager_.reset();
+  serving_ = false;
   drd_->signal(SIGTERM);
   return drd_->waitForExit() == 0;
 }

@@ -68,6 +68,7 @@ class HostApp {
 class World {
  public:
   World();
+  ~World();  // stops drd with SIGTERM, as the service manager would
   // Starts drd -v with `environment` entries; false when it did not come up.
   bool start(std::vector<std::string> environment = {});
   bool stop();     // SIGTERM; true on a clean exit
@@ -112,6 +113,7 @@ class World {
   registry_test::TempFolder root_;
   std::vector<std::string> environment_;
   std::unique_ptr<DrdProcess> drd_;
+  bool serving_ = false;
   mutable std::unique_ptr<HostApp> manager_;
 };
 
