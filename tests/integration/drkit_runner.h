@@ -1,8 +1,5 @@
-// Running the built drkit (and the host example) as real processes in the
-// environment of a DrdProcess started under the same root folder: same
-// socket folder, registry, state, preferences and notification folders.
-// For the integration tests only; header-only so that it joins the test
-// binary through the tests that include it.
+// The built drkit (and any other program) as a real process in the
+// environment DrdProcess gives drd under the same root folder.
 #pragma once
 
 #include <fcntl.h>
@@ -20,63 +17,54 @@
 
 namespace dr::testing {
 
-// The environment DrdProcess gives drd under `root`, plus `extra` entries.
-inline std::vector<std::string> DrkitEnvironment(const std::string& root,
-                                                 const std::vector<std::string>& extra = {}) {
-  std::vector<std::string> env = {
-      "DR_SOCKET_DIR=" + root + "/sockets",
-      "DR_REGISTRY=" + root + "/registry/r.sqlite3",
-      "XDG_STATE_HOME=" + root + "/state",
-      "XDG_CONFIG_HOME=" + root + "/config",
-      "XDG_DATA_HOME=" + root + "/data",
-      "DR_NOTIFY_DIR=" + root + "/notify",
-      "HOME=" + root,
-      "DR_POLICY=" + root + "/policy.pdoc",
-      "DR_SYSTEM_ROOTS=" + root + "/system",
-      "DR_PLUGIN_PATH=" + root + "/installed",
-      "PATH=/usr/bin:/bin",
-  };
-  env.insert(env.end(), extra.begin(), extra.end());
-  return env;
+inline std::vector<std::string> DrkitEnvironment(const std::string& root) {
+  return {"DR_SOCKET_DIR=" + root + "/sockets",
+          "DR_REGISTRY=" + root + "/registry/r.sqlite3",
+          "XDG_STATE_HOME=" + root + "/state",
+          "XDG_CONFIG_HOME=" + root + "/config",
+          "XDG_DATA_HOME=" + root + "/data",
+          "DR_NOTIFY_DIR=" + root + "/notify",
+          "HOME=" + root,
+          "DR_POLICY=" + root + "/policy.pdoc",
+          "DR_SYSTEM_ROOTS=" + root + "/system",
+          "DR_PLUGIN_PATH=" + root + "/installed",
+          "PATH=/usr/bin:/bin"};
 }
 
 // <build>/client/<name>, beside <build>/daemon/drd.
 inline std::string ClientBinaryPath(const std::string& name) {
-  std::string drd = DrdProcess::BinaryPath();                   // <build>/daemon/drd
-  std::string build = drd.substr(0, drd.rfind("/daemon/drd"));  // <build>
-  return build + "/client/" + name;
+  const std::string drd = DrdProcess::BinaryPath();
+  return drd.substr(0, drd.rfind("/daemon/drd")) + "/client/" + name;
 }
 
-// A child process with pipes on its standard input, output and error.
+// A child process with pipes on its standard input, output and error;
+// killed when destroyed while still running.
 class Child {
  public:
   Child(const std::string& binary, const std::vector<std::string>& args,
         std::vector<std::string> env, const std::string& cwd = "") {
-    int in[2], out[2], err[2];
-    if (::pipe2(in, O_CLOEXEC) || ::pipe2(out, O_CLOEXEC) || ::pipe2(err, O_CLOEXEC)) return;
+    int pipes[3][2];
+    for (auto& p : pipes) {
+      if (::pipe2(p, O_CLOEXEC) != 0) return;
+    }
+    std::vector<std::string> argvStrings{binary};
+    argvStrings.insert(argvStrings.end(), args.begin(), args.end());
+    std::vector<char*> argv, envp;
+    for (std::string& a : argvStrings) argv.push_back(a.data());
+    for (std::string& e : env) envp.push_back(e.data());
+    argv.push_back(nullptr);
+    envp.push_back(nullptr);
     pid_ = ::fork();
     if (pid_ == 0) {
-      ::dup2(in[0], 0);
-      ::dup2(out[1], 1);
-      ::dup2(err[1], 2);
+      for (int fd = 0; fd < 3; ++fd) ::dup2(pipes[fd][fd == 0 ? 0 : 1], fd);
       if (!cwd.empty() && ::chdir(cwd.c_str()) != 0) ::_exit(126);
-      std::vector<std::string> argvStrings{binary};
-      argvStrings.insert(argvStrings.end(), args.begin(), args.end());
-      std::vector<char*> argv;
-      for (std::string& a : argvStrings) argv.push_back(a.data());
-      argv.push_back(nullptr);
-      std::vector<char*> envp;
-      for (std::string& e : env) envp.push_back(e.data());
-      envp.push_back(nullptr);
       ::execve(binary.c_str(), argv.data(), envp.data());
       ::_exit(127);
     }
-    ::close(in[0]);
-    ::close(out[1]);
-    ::close(err[1]);
-    in_ = in[1];
-    out_ = out[0];
-    err_ = err[0];
+    for (int fd = 0; fd < 3; ++fd) {
+      ::close(pipes[fd][fd == 0 ? 0 : 1]);
+      fds_[fd] = pipes[fd][fd == 0 ? 1 : 0];
+    }
   }
   ~Child() {
     closeInput();
@@ -84,82 +72,68 @@ class Child {
       ::kill(pid_, SIGKILL);
       wait();
     }
-    if (out_ >= 0) ::close(out_);
-    if (err_ >= 0) ::close(err_);
+    for (int fd : {fds_[1], fds_[2]}) ::close(fd);
   }
   Child(const Child&) = delete;
   Child& operator=(const Child&) = delete;
 
   pid_t pid() const { return pid_; }
   void write(const std::string& bytes) {
-    if (in_ >= 0 && ::write(in_, bytes.data(), bytes.size()) < 0) closeInput();
+    if (::write(fds_[0], bytes.data(), bytes.size()) < 0) closeInput();
   }
   void closeInput() {
-    if (in_ >= 0) ::close(in_);
-    in_ = -1;
+    if (fds_[0] >= 0) ::close(fds_[0]);
+    fds_[0] = -1;
   }
   bool signal(int number) { return ::kill(pid_, number) == 0; }
-
-  // The next line of standard output (without its newline); "" when the
-  // output ended or nothing came in time.
-  std::string readLine(std::chrono::milliseconds limit = std::chrono::seconds(20)) {
-    return readLineFrom(out_, outBuffer_, limit);
-  }
-  std::string readErrorLine(std::chrono::milliseconds limit = std::chrono::seconds(20)) {
-    return readLineFrom(err_, errBuffer_, limit);
-  }
-
-  // Waits for the exit and collects what is left of both outputs. The exit
+  // The next line of standard output or error, without its newline; "" when
+  // the output ended or nothing came within 20 s.
+  std::string readLine() { return readLineFrom(1); }
+  std::string readErrorLine() { return readLineFrom(2); }
+  // Waits for the exit and collects what is left of both outputs; the exit
   // status, or -1 after a signal.
   int wait() {
-    drain(out_, outBuffer_);
-    drain(err_, errBuffer_);
+    for (int fd : {1, 2}) {
+      char chunk[4096];
+      for (ssize_t n; (n = ::read(fds_[fd], chunk, sizeof chunk)) > 0;)
+        buffers_[fd].append(chunk, static_cast<size_t>(n));
+    }
     int status = 0;
     if (!status_ && ::waitpid(pid_, &status, 0) == pid_) status_ = status;
-    if (!status_ || !WIFEXITED(*status_)) return -1;
-    return WEXITSTATUS(*status_);
+    return status_ && WIFEXITED(*status_) ? WEXITSTATUS(*status_) : -1;
   }
-  const std::string& out() const { return outBuffer_; }
-  const std::string& err() const { return errBuffer_; }
+  const std::string& out() const { return buffers_[1]; }
+  const std::string& err() const { return buffers_[2]; }
 
  private:
-  static std::string readLineFrom(int fd, std::string& buffer, std::chrono::milliseconds limit) {
-    const auto deadline = std::chrono::steady_clock::now() + limit;
-    for (;;) {
-      if (size_t nl = buffer.find('\n'); nl != std::string::npos) {
-        std::string line = buffer.substr(0, nl);
-        buffer.erase(0, nl + 1);
-        return line;
-      }
-      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+  std::string readLineFrom(int fd) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+    for (size_t nl; (nl = buffers_[fd].find('\n')) == std::string::npos;) {
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
           deadline - std::chrono::steady_clock::now());
-      struct pollfd p = {fd, POLLIN, 0};
-      if (fd < 0 || left.count() <= 0 || ::poll(&p, 1, static_cast<int>(left.count())) <= 0) {
-        return "";
-      }
+      pollfd p = {fds_[fd], POLLIN, 0};
       char chunk[4096];
-      ssize_t n = ::read(fd, chunk, sizeof chunk);
+      ssize_t n = left.count() > 0 && ::poll(&p, 1, static_cast<int>(left.count())) > 0
+                      ? ::read(fds_[fd], chunk, sizeof chunk)
+                      : 0;
       if (n <= 0) return "";
-      buffer.append(chunk, static_cast<size_t>(n));
+      buffers_[fd].append(chunk, static_cast<size_t>(n));
     }
-  }
-  static void drain(int fd, std::string& buffer) {
-    char chunk[4096];
-    for (ssize_t n; fd >= 0 && (n = ::read(fd, chunk, sizeof chunk)) > 0;) {
-      buffer.append(chunk, static_cast<size_t>(n));
-    }
+    const size_t nl = buffers_[fd].find('\n');
+    std::string line = buffers_[fd].substr(0, nl);
+    buffers_[fd].erase(0, nl + 1);
+    return line;
   }
 
   pid_t pid_ = -1;
-  int in_ = -1, out_ = -1, err_ = -1;
-  std::string outBuffer_, errBuffer_;
+  int fds_[3] = {-1, -1, -1};
+  std::string buffers_[3];
   std::optional<int> status_;
 };
 
 struct Ran {
   int status;
-  std::string out;
-  std::string err;
+  std::string out, err;
 };
 
 // Runs drkit with `args` to its end, with `input` on its standard input.
@@ -168,7 +142,7 @@ inline Ran RunDrkit(const std::string& root, const std::vector<std::string>& arg
   Child child(ClientBinaryPath("drkit"), args, DrkitEnvironment(root), cwd);
   child.write(input);
   child.closeInput();
-  int status = child.wait();
+  const int status = child.wait();
   return {status, child.out(), child.err()};
 }
 

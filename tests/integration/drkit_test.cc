@@ -1,6 +1,6 @@
-// drkit end to end: the real drkit binary against the real drd, each in a
-// fresh temporary environment with real bundles on disk. Checks what a user
-// sees: standard output, standard error and exit status.
+// drkit end to end: the real drkit binary against the real drd, with real
+// bundles on disk. Checks what a user sees: standard output, standard error
+// and exit status.
 #include <gtest/gtest.h>
 #include <signal.h>
 
@@ -8,80 +8,54 @@
 #include <string>
 #include <vector>
 
-#include "platform/file_system.h"
 #include "platform/pdoc_file.h"
-#include "platform/preferences.h"
-#include "store/user_prefs.h"
 #include "tests/integration/drkit_runner.h"
-#include "tests/support/process_fixtures.h"
-#include "tests/support/registry_bundles.h"
+#include "tests/integration/world.h"
 
-namespace dr {
+namespace dr::testing {
 namespace {
-
-using testing::Child;
-using testing::ClientBinaryPath;
-using testing::DrdProcess;
-using testing::DrkitEnvironment;
-using testing::Ran;
-using testing::RunDrkit;
-using testing::TempFolder;
 
 constexpr char kPoint[] = "com.example.point";
 
 class DrkitTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    drd_ = std::make_unique<DrdProcess>(root(), std::vector<std::string>{"-v"});
-    ASSERT_TRUE(drd_->waitUntilServing()) << drd_->standardError();
-  }
-  void TearDown() override {
-    ASSERT_TRUE(drd_->signal(SIGTERM));
-    EXPECT_EQ(drd_->waitForExit(), 0) << drd_->standardError();
-  }
+  void SetUp() override { ASSERT_TRUE(w.start()) << w.log(); }
 
-  const std::string& root() const { return root_.path(); }
-
-  // A plug-in bundle <root>/Apps/Host.app/Contents/PlugIns/<name>.appex with
-  // identifier com.example.<name>, inside an application so that discovery
-  // offers it to any host. Answers its path.
+  const std::string& root() const { return w.root(); }
+  // Plug-in com.example.<name> inside an application, so that discovery
+  // offers it to any host; its path.
   std::string makePlugIn(const std::string& name, const std::string& version = "1.0",
                          const std::string& point = kPoint,
                          const std::string& app = "Apps/Host.app") {
-    const std::string appPath = root_ / app;
-    testing::WriteTestFile(appPath + "/Contents/Info.pdoc",
-                           R"({"BNBundleIdentifier": "com.example.host"})");
-    const std::string path = appPath + "/Contents/PlugIns/" + name + ".appex";
-    registry_test::MakeBundle(
-        path,
-        Value{{"BNBundleIdentifier", "com.example.bundle." + name},
-              {"BNBundleVersion", version},
-              {"BNBundleExecutable", "run"},
-              {"UXExtension", Value{{"UXExtensionPointIdentifier", point},
-                                    {"UXExtensionAttributes",
-                                     Value{{"UXExtensionIdentifier", "com.example." + name},
-                                           {"UXExtensionPointName", point}}}}}},
-        Value{{"com.corvel.security.app-sandbox", true}});
-    testing::WriteTestFile(path + "/Contents/Exec/run", "#!/bin/sh\nexec sleep 60\n", 0755);
-    return path;
+    w.makeApp(app, "com.example.host");
+    return w.makePlugIn(app + "/Contents/PlugIns/" + name + ".appex", "com.example." + name,
+                        version, {{"UXExtensionPointIdentifier", Value(point)}});
   }
-
-  Ran drkit(const std::vector<std::string>& args, const std::string& input = "") {
-    return RunDrkit(root(), args, input);
-  }
+  Ran drkit(const std::vector<std::string>& args) { return RunDrkit(root(), args); }
   // drkit that must succeed; its standard output.
   std::string ok(const std::vector<std::string>& args, const std::string& input = "") {
-    Ran r = drkit(args, input);
+    Ran r = RunDrkit(root(), args, input);
     EXPECT_EQ(r.status, 0) << args[0] << ": " << r.err;
     return r.out;
   }
-  std::string uuidOf(const std::string& identifier) {
-    Result<Value> forms = pdoc::Parse(ok({"match", "-i", identifier, "--json"}));
-    return forms ? (*forms).at(0)["uuid"].stringValue() : "";
+  // A refusal: status 1, nothing on standard output, `err` on standard error.
+  void refused(const std::vector<std::string>& args, const std::string& err) {
+    Ran r = drkit(args);
+    EXPECT_EQ(r.status, 1) << args[0];
+    EXPECT_EQ(r.out, "") << args[0];
+    EXPECT_EQ(r.err, err);
+  }
+  std::unique_ptr<Child> hold(const std::vector<std::string>& args) {
+    auto holder =
+        std::make_unique<Child>(ClientBinaryPath("drkit"), args, DrkitEnvironment(root()));
+    const std::string token = holder->readLine();
+    EXPECT_TRUE(Uuid::parse(token)) << token << holder->err();
+    last = token;
+    return holder;
   }
 
-  TempFolder root_;
-  std::unique_ptr<DrdProcess> drd_;
+  World w;
+  std::string last;  // the token of the last hold
 };
 
 TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
@@ -95,13 +69,10 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
                        "", root());
   ASSERT_EQ(added.status, 0) << added.err;
   EXPECT_EQ(added.out, "");
-
-  struct Row {
-    std::vector<std::string> args;
-    std::string out;
-  };
-  const std::vector<Row> rows = {
-      {{"match"}, "  com.example.a (1.0)\n  com.example.b (2.0)\n  com.example.other (3.0)\n"},
+  const std::string all =
+      "  com.example.a (1.0)\n  com.example.b (2.0)\n  com.example.other (3.0)\n";
+  const std::pair<std::vector<std::string>, std::string> rows[] = {
+      {{"match"}, all},
       {{"match", "-p", kPoint}, "  com.example.a (1.0)\n  com.example.b (2.0)\n"},
       {{"match", "-i", "com.example.b"}, "  com.example.b (2.0)\n"},
       {{"match", "--rule", "UXExtensionIdentifier=com.example.a", "--rule",
@@ -110,49 +81,33 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
       {{"match", "--rule", "BNBundleVersion=>=2"},
        "  com.example.b (2.0)\n  com.example.other (3.0)\n"},
       {{"match", "-p", "com.example.nowhere"}, ""},
-      // Typed patterns: true asks for a key that is present (and not 0),
-      // false for one that is absent; the text "true" is a version text.
-      {{"match", "--rule", "UXExtensionPointName:=true"},
-       "  com.example.a (1.0)\n  com.example.b (2.0)\n  com.example.other (3.0)\n"},
+      // Typed patterns: true asks for a key that is present, false for one
+      // that is absent; the text "true" is a version text.
+      {{"match", "--rule", "UXExtensionPointName:=true"}, all},
       {{"match", "--rule", "UXExtensionPointName=true"}, ""},
       {{"match", "--rule", "NoSuchKey:=false", "-i", "com.example.a"}, "  com.example.a (1.0)\n"},
       {{"match", "--rule", "BNBundleVersion:=[\"1.0\", \"3.0\"]"},
        "  com.example.a (1.0)\n  com.example.other (3.0)\n"},
   };
-  for (const Row& row : rows) EXPECT_EQ(ok(row.args), row.out) << row.args.back();
-
+  for (const auto& [args, out] : rows) EXPECT_EQ(ok(args), out) << args.back();
   const std::string verbose = ok({"match", "-v", "-i", "com.example.a"});
   EXPECT_EQ(verbose.rfind("  com.example.a (1.0)\n    uuid: ", 0), 0u) << verbose;
   EXPECT_NE(verbose.find("\n    path: " + a + "\n    registered: 20"), std::string::npos)
       << verbose;
-  Result<Value> json = pdoc::Parse(ok({"match", "--json", "-p", kPoint}));
-  ASSERT_TRUE(json) << json.error().description();
-  ASSERT_EQ(json->size(), 2u);
-  EXPECT_TRUE((*json).at(0)["annotations"].isDictionary());
-  EXPECT_EQ(Uuid::parse((*json).at(0)["uuid"].stringValue()).has_value(), true);
 
   EXPECT_EQ(ok({"remove", a}), "");
   EXPECT_EQ(ok({"match", "-p", kPoint}), "  com.example.b (2.0)\n");
-
-  // drd's refusals: message and code on standard error, status 1.
-  const std::vector<std::pair<std::vector<std::string>, std::string>> failures = {
-      {{"remove", a}, "drkit: no plugin at " + a + " (bad path, code 9)\n"},
-      {{"add", root() + "/missing.appex"},
-       "drkit: invalid plugin path: " + root() + "/missing.appex (bad path, code 9)\n"},
-      {{"match", "--all"},
-       "drkit: unauthorized discovery flag (DRDiscoverAll) (not permitted, code 11)\n"},
-  };
-  for (const auto& [args, err] : failures) {
-    Ran r = drkit(args);
-    EXPECT_EQ(r.status, 1) << args[0];
-    EXPECT_EQ(r.err, err);
-    EXPECT_EQ(r.out, "");
-  }
+  // drd's refusals: message and code on standard error.
+  refused({"remove", a}, "drkit: no plugin at " + a + " (bad path, code 9)\n");
+  refused({"add", root() + "/missing.appex"},
+          "drkit: invalid plugin path: " + root() + "/missing.appex (bad path, code 9)\n");
+  refused({"match", "--all"},
+          "drkit: unauthorized discovery flag (DRDiscoverAll) (not permitted, code 11)\n");
 }
 
 TEST_F(DrkitTest, ElectionsAndSettingsAreRecorded) {
   ok({"add", makePlugIn("a"), makePlugIn("b")});
-  const std::vector<std::pair<std::string, std::string>> rows = {
+  const std::pair<std::string, std::string> rows[] = {
       {"use", "+ com.example.a (1.0)\n  com.example.b (1.0)\n"},
       {"ignore", "- com.example.a (1.0)\n  com.example.b (1.0)\n"},
       {"default", "  com.example.a (1.0)\n  com.example.b (1.0)\n"},
@@ -161,10 +116,8 @@ TEST_F(DrkitTest, ElectionsAndSettingsAreRecorded) {
     EXPECT_EQ(ok({"elect", "-i", "com.example.a", choice}), "");
     EXPECT_EQ(ok({"match"}), listing) << choice;
   }
-  Ran unknown = drkit({"elect", "-i", "com.example.none", "use"});
-  EXPECT_EQ(unknown.status, 1);
-  EXPECT_EQ(unknown.err, "drkit: no plug-in with identifier 'com.example.none'\n");
-
+  refused({"elect", "-i", "com.example.none", "use"},
+          "drkit: no plug-in with identifier 'com.example.none'\n");
   // Settings change key by key; the election stays.
   ok({"elect", "-i", "com.example.b", "use"});
   EXPECT_EQ(ok({"annotate", "-i", "com.example.b", "color=red", "size=3", "note=a=b"}), "");
@@ -177,14 +130,16 @@ TEST_F(DrkitTest, ElectionsAndSettingsAreRecorded) {
 TEST_F(DrkitTest, AccessTokensGrantTheBundleAndReadyChecksThePlugIn) {
   const std::string a = makePlugIn("a");
   ok({"add", a});
-  const std::string uuid = uuidOf("com.example.a");
-  ASSERT_FALSE(uuid.empty());
-
+  const std::string uuid = w.uuidOf("com.example.a").description();
   const std::string tokens = ok({"access", uuid, uuid});
   const std::string token = tokens.substr(0, tokens.find('\n'));
   EXPECT_EQ(tokens, token + "\n" + token + "\n");
   EXPECT_EQ(ok({"extension", "consume", token}), a + "\n");
-
+  EXPECT_EQ(ok({"extension", "open", token, "Contents/Info.pdoc"}),
+            registry_test::ReadBytes(a + "/Contents/Info.pdoc"));
+  Ran missing = drkit({"extension", "open", token, "Contents/none"});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_EQ(missing.err.rfind("drkit: Contents/none: ", 0), 0u) << missing.err;
   std::string altered = token;
   altered.back() = altered.back() == '0' ? '1' : '0';
   for (const std::string& bad : {altered, std::string("garbage")}) {
@@ -193,90 +148,60 @@ TEST_F(DrkitTest, AccessTokensGrantTheBundleAndReadyChecksThePlugIn) {
     EXPECT_EQ(r.out, "");
     EXPECT_EQ(r.err.rfind("drkit: ", 0), 0u) << r.err;
   }
-
   EXPECT_EQ(ok({"ready", uuid}), "");
-  const std::string unknown = Uuid::random().string();
   for (const char* verb : {"ready", "access"}) {
-    Ran r = drkit({verb, uuid, unknown});
-    EXPECT_EQ(r.status, 1) << verb;
-    EXPECT_EQ(r.err, "drkit: no such plugin (uuid not found) (bad request, code 4)\n") << verb;
+    refused({verb, uuid, Uuid::random().string()},
+            "drkit: no such plugin (uuid not found) (bad request, code 4)\n");
   }
 }
 
+// A hold lasts until drkit's input ends, a signal, a release by its token
+// from any process, or drd's end (then drkit says the hold is gone).
 TEST_F(DrkitTest, HoldLastsUntilInputEndsOrASignalOrARelease) {
   const std::string a = makePlugIn("a");
   ok({"add", a});
   const std::string listed = "  com.example.a (1.0)\n";
-  ASSERT_EQ(ok({"match"}), listed);
-  const std::string uuid = uuidOf("com.example.a");
-
-  {
-    Child holder(ClientBinaryPath("drkit"), {"hold", "--plugin", a}, DrkitEnvironment(root()));
-    const std::string token = holder.readLine();
-    ASSERT_TRUE(Uuid::parse(token)) << token << holder.err();
+  const std::string uuid = w.uuidOf("com.example.a").description();
+  const struct {
+    std::vector<std::string> args;
+    std::function<void(Child&)> end;
+  } rows[] = {
+      {{"hold", "--plugin", a}, [](Child& c) { c.closeInput(); }},
+      {{"hold", "--app", root() + "/Apps/Host.app"}, [](Child& c) { c.signal(SIGTERM); }},
+      {{"hold", "--plugin", a},
+       [&](Child& c) {
+         EXPECT_EQ(ok({"release", last}), "");
+         EXPECT_EQ(ok({"match"}), listed);
+         c.signal(SIGINT);
+       }},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.args[1]);
+    std::unique_ptr<Child> holder = hold(row.args);
     EXPECT_EQ(ok({"match"}), "");
-    Ran refused = drkit({"ready", uuid});
-    EXPECT_EQ(refused.status, 1);
-    EXPECT_EQ(refused.err,
-              "drkit: access to plugin com.example.a denied: the plug-in is on hold "
-              "(not permitted, code 11)\n");
-    holder.closeInput();
-    EXPECT_EQ(holder.wait(), 0) << holder.err();
+    refused({"ready", uuid},
+            "drkit: access to plugin com.example.a denied: the plug-in is on hold "
+            "(not permitted, code 11)\n");
+    row.end(*holder);
+    EXPECT_EQ(holder->wait(), 0) << holder->err();
     EXPECT_EQ(ok({"match"}), listed);
   }
-  {
-    Child holder(ClientBinaryPath("drkit"), {"hold", "--app", root() + "/Apps/Host.app"},
-                 DrkitEnvironment(root()));
-    ASSERT_TRUE(Uuid::parse(holder.readLine())) << holder.err();
-    EXPECT_EQ(ok({"match"}), "");
-    ASSERT_TRUE(holder.signal(SIGTERM));
-    EXPECT_EQ(holder.wait(), 0) << holder.err();
-    EXPECT_EQ(ok({"match"}), listed);
-  }
-  {
-    // Any process may release a hold by its token.
-    Child holder(ClientBinaryPath("drkit"), {"hold", "--plugin", a}, DrkitEnvironment(root()));
-    const std::string token = holder.readLine();
-    ASSERT_TRUE(Uuid::parse(token)) << holder.err();
-    EXPECT_EQ(ok({"release", token}), "");
-    EXPECT_EQ(ok({"match"}), listed);
-    ASSERT_TRUE(holder.signal(SIGINT));
-    EXPECT_EQ(holder.wait(), 0) << holder.err();
-  }
-  Ran nothing = drkit({"hold", "--plugin", root() + "/Apps/Host.app"});
-  EXPECT_EQ(nothing.status, 1);
-  EXPECT_EQ(nothing.err,
-            "drkit: no plug-in at path:" + root() + "/Apps/Host.app (bad path, code 9)\n");
-  {
-    // The hold dies with drd; a drkit that kept waiting would claim a hold
-    // nobody keeps.
-    Child holder(ClientBinaryPath("drkit"), {"hold", "--plugin", a}, DrkitEnvironment(root()));
-    ASSERT_TRUE(Uuid::parse(holder.readLine())) << holder.err();
-    ASSERT_TRUE(drd_->signal(SIGKILL));
-    drd_->waitForExit();
-    EXPECT_EQ(holder.wait(), 1);
-    EXPECT_EQ(holder.err(), "drkit: drd closed the connection; the hold is gone\n");
-    drd_ = std::make_unique<DrdProcess>(root(), std::vector<std::string>{"-v"});
-    ASSERT_TRUE(drd_->waitUntilServing()) << drd_->standardError();
-    EXPECT_EQ(ok({"match"}), listed);
-  }
+  refused({"hold", "--plugin", root() + "/Apps/Host.app"},
+          "drkit: no plug-in at path:" + root() + "/Apps/Host.app (bad path, code 9)\n");
+  std::unique_ptr<Child> holder = hold({"hold", "--plugin", a});
+  ASSERT_TRUE(w.kill9()) << w.log();
+  EXPECT_EQ(holder->wait(), 1);
+  EXPECT_EQ(holder->err(), "drkit: drd closed the connection; the hold is gone\n");
+  EXPECT_EQ(ok({"match"}), listed);
 }
 
 TEST_F(DrkitTest, ExclusionsHidePlugInsAndKeepTheRestOfTheFile) {
   ok({"add", makePlugIn("a"), makePlugIn("b")});
-  // Another setting of the same preferences domain survives drkit's edits.
-  const std::string configHome = root() + "/config";
-  const std::string file = CurrentHostPreferencesFile(
-      PreferencesOptionsFromEnvironment([&](const char* name) -> const char* {
-        return std::string_view(name) == "XDG_CONFIG_HOME" ? configHome.c_str() : nullptr;
-      }),
-      DRDUserPrefs::kDomain);
-  ASSERT_TRUE(FileSystem::Default()->makeDirectories(file.substr(0, file.rfind('/'))).ok());
-  ASSERT_TRUE(pdoc::WriteFile(file, Value{{"other", "kept"}}).ok());
+  // Another setting of the same preferences file survives drkit's edits.
+  registry_test::WriteBytes(w.prefsFile(), "{\"other\": \"kept\"}");
   ok({"exclude", "add", "-i", "com.example.a"});
   EXPECT_EQ(ok({"exclude", "list"}), "1: {\"UXExtensionIdentifier\":\"com.example.a\"}\n");
   EXPECT_EQ(ok({"match"}), "  com.example.b (1.0)\n");
-
   ok({"exclude", "add", "-p", kPoint, "--rule", "BNBundleVersion=1.0"});
   EXPECT_EQ(ok({"match"}), "");
   EXPECT_EQ(ok({"exclude", "remove", "1"}), "");
@@ -285,11 +210,9 @@ TEST_F(DrkitTest, ExclusionsHidePlugInsAndKeepTheRestOfTheFile) {
   EXPECT_EQ(ok({"exclude", "remove", "--rule", "BNBundleVersion=1.0", "-p", kPoint}), "");
   EXPECT_EQ(ok({"exclude", "list"}), "");
   EXPECT_EQ(ok({"match"}), "  com.example.a (1.0)\n  com.example.b (1.0)\n");
-
-  Result<Value> stored = pdoc::ReadFile(file);
+  Result<Value> stored = pdoc::ReadFile(w.prefsFile());
   ASSERT_TRUE(stored) << stored.error().description();
   EXPECT_EQ(*stored, (Value{{"other", "kept"}, {"exclusions", Value::EmptyArray()}}));
-
   for (const std::vector<std::string>& args :
        {std::vector<std::string>{"exclude", "remove", "1"},
         std::vector<std::string>{"exclude", "remove", "-i", "com.example.a"}}) {
@@ -320,139 +243,106 @@ TEST_F(DrkitTest, RawSendsAnyRequestAndStatusTellsWhetherDrdAnswers) {
                            Uuid::random().string() + "\"}]}"}),
             "{}\n");
   EXPECT_EQ(ok({"raw"}, R"({"request": "match", "version": 2, "flags": 1})"), "{\"matches\":[]}\n");
-  Ran refused = drkit({"raw", R"({"request": "frobnicate", "version": 2})"});
-  EXPECT_EQ(refused.status, 1);
-  EXPECT_EQ(refused.out, "{\"error\":\"unrecognized request\",\"errorcode\":4}\n");
-  EXPECT_EQ(refused.err, "drkit: unrecognized request (bad request, code 4)\n");
+  Ran r = drkit({"raw", R"({"request": "frobnicate", "version": 2})"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, "{\"error\":\"unrecognized request\",\"errorcode\":4}\n");
+  EXPECT_EQ(r.err, "drkit: unrecognized request (bad request, code 4)\n");
   for (const char* bad : {"{", "[1]", R"({"a": null})", R"({"u": {"$uuid": "nope"}})"}) {
     EXPECT_EQ(drkit({"raw", bad}).status, 2) << bad;
   }
-
   const std::string socket = root() + "/sockets/";
   EXPECT_EQ(ok({"status"}), "service: com.corvel.dromon.drd\nsocket: " + socket +
                                 "com.corvel.dromon.drd\nstate: answering\n");
-  Ran absent = drkit({"-S", "com.example.none", "status"});
-  EXPECT_EQ(absent.status, 1);
-  EXPECT_EQ(absent.out, "service: com.example.none\nsocket: " + socket +
-                            "com.example.none\nstate: not answering\n");
-  EXPECT_NE(absent.err.find("No such file or directory\ndrkit: drd is not running; start it with "
-                            "'systemctl --user start drd.socket'"),
+  r = drkit({"-S", "com.example.none", "status"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, "service: com.example.none\nsocket: " + socket +
+                       "com.example.none\nstate: not answering\n");
+  EXPECT_NE(r.err.find("No such file or directory\ndrkit: drd is not running; start it with "
+                       "'systemctl --user start drd.socket'"),
             std::string::npos)
-      << absent.err;
+      << r.err;
 }
 
-// --json on every verb that prints: one line of JSON when piped, with the
-// fields the text shows.
+// --json on every verb that prints: one line of JSON, with the fields the
+// text shows.
 TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
   const std::string a = makePlugIn("a");
   ok({"add", a, makePlugIn("b")});
-  const std::string uuid = uuidOf("com.example.a");
+  const std::string uuid = w.uuidOf("com.example.a").description();
   ok({"annotate", "-i", "com.example.a", "color=red"});
   ok({"exclude", "add", "-i", "com.example.b"});
   const std::string access = ok({"access", uuid});
   const std::string token = access.substr(0, access.find('\n'));
-
-  struct Row {
-    std::vector<std::string> args;
-    std::function<void(const Value&)> check;
-  };
-  const std::vector<Row> rows = {
-      {{"match", "--json"},
-       [&](const Value& v) {
-         ASSERT_EQ(v.size(), 1u);
-         EXPECT_EQ(v.at(0)["identifier"], Value("com.example.a"));
-         EXPECT_EQ(v.at(0)["uuid"], Value(uuid));
-       }},
-      {{"annotate", "-i", "com.example.a", "--json"},
-       [](const Value& v) {
-         EXPECT_EQ(v, (Value{{"color", "red"}}));
-       }},
-      {{"access", uuid, "--json"},
-       [&](const Value& v) {
-         EXPECT_EQ(v, Value(Array{Value{{"uuid", uuid}, {"token", token}}}));
-       }},
-      {{"extension", "consume", token, "--json"},
-       [&](const Value& v) {
-         EXPECT_EQ(v, (Value{{"path", a}}));
-       }},
+  // The value at `path` (keys, or indexes of arrays) of the output; any
+  // value there when `expected` is absent.
+  const struct {
+    std::vector<std::string> args, path;
+    Value expected;
+  } rows[] = {
+      {{"match", "--json"}, {"0", "uuid"}, Value(uuid)},
+      {{"annotate", "-i", "com.example.a", "--json"}, {}, Value{{"color", "red"}}},
+      {{"access", uuid, "--json"}, {}, Value(Array{Value{{"uuid", uuid}, {"token", token}}})},
+      {{"extension", "consume", token, "--json"}, {}, Value{{"path", a}}},
+      {{"extension", "open", token, "--json"}, {"names", "0"}, Value("Contents")},
       {{"exclude", "list", "--json"},
-       [](const Value& v) {
-         EXPECT_EQ(v, Value(Array{Value{{"UXExtensionIdentifier", "com.example.b"}}}));
-       }},
+       {},
+       Value(Array{Value{{"UXExtensionIdentifier", "com.example.b"}}})},
       {{"status", "--json"},
-       [&](const Value& v) {
-         EXPECT_EQ(v, (Value{{"service", "com.corvel.dromon.drd"},
-                             {"socket", root() + "/sockets/com.corvel.dromon.drd"},
-                             {"answering", true}}));
-       }},
-      {{"explain", "com.example.a", "--json"},
-       [&](const Value& v) {
-         EXPECT_EQ(v["registered"], Value(true));
-         ASSERT_EQ(v["plugins"].size(), 1u);
-         EXPECT_EQ(v["plugins"].at(0)["path"], Value(a));
-         EXPECT_EQ(v["plugins"].at(0)["discovery"], Value("returned"));
-         EXPECT_EQ(v["plugins"].at(0)["election"], Value("not chosen"));
-       }},
+       {},
+       Value{{"service", "com.corvel.dromon.drd"},
+             {"socket", root() + "/sockets/com.corvel.dromon.drd"},
+             {"answering", true}}},
+      {{"explain", "com.example.a", "--json"}, {"plugins", "0", "discovery"}, Value("returned")},
       {{"raw", "--json", R"({"request": "match", "version": 2})"},
-       [](const Value& v) { EXPECT_EQ(v["matches"].size(), 1u); }},
+       {"matches", "0", "identifier"},
+       Value("com.example.a")},
       // Standard input ends at once: the hold is placed, printed, released.
-      {{"hold", "--plugin", a, "--json"},
-       [](const Value& v) { EXPECT_TRUE(Uuid::parse(v["token"].stringValue())); }},
+      {{"hold", "--plugin", a, "--json"}, {"token"}, Value()},
   };
-  for (const Row& row : rows) {
+  for (const auto& row : rows) {
     SCOPED_TRACE(row.args[0]);
     const std::string out = ok(row.args);
     EXPECT_EQ(out.find('\n'), out.size() - 1) << "not one line: " << out;
     Result<Value> parsed = pdoc::Parse(out);
     ASSERT_TRUE(parsed) << out;
-    row.check(*parsed);
+    Value at = *parsed;
+    for (const std::string& step : row.path) {
+      at = at.isArray() ? at.at(std::stoul(step)) : Value(at[step]);
+    }
+    EXPECT_TRUE(row.expected.isPresent() ? at == row.expected : at.isPresent()) << out;
   }
 }
 
 TEST_F(DrkitTest, ExplainTellsTheFateOfEveryCopy) {
   ok({"add", makePlugIn("a", "1.0"), makePlugIn("b", "1.0")});
-  // A second copy of com.example.a: same identifier, newer version, in
-  // another application.
+  // A second copy of com.example.a, newer, in another application.
   const std::string newer = makePlugIn("a", "2.0", kPoint, "Apps/Other.app");
   ok({"add", newer});
   const std::string older = root() + "/Apps/Host.app/Contents/PlugIns/a.appex";
-
-  Ran r = drkit({"explain", "com.example.a"});
-  ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_NE(r.out.find("    path: " + newer + "\n    registered: "), std::string::npos) << r.out;
-  EXPECT_NE(r.out.find("    version: 2.0\n    election: not chosen\n    discovery: returned\n"),
-            std::string::npos)
-      << r.out;
-  EXPECT_NE(r.out.find("    path: " + older), std::string::npos) << r.out;
-  EXPECT_NE(r.out.find("    discovery: superseded by another copy by com.example.a (2.0) "),
-            std::string::npos)
-      << r.out;
-
+  auto explains = [&](const std::vector<std::string>& args, const std::string& text) {
+    Ran r = drkit(args);
+    EXPECT_NE(r.out.find(text), std::string::npos) << r.out;
+    return r.status;
+  };
+  EXPECT_EQ(explains({"explain", "com.example.a"}, "    path: " + newer + "\n    registered: "), 0);
+  explains({"explain", "com.example.a"},
+           "    version: 2.0\n    election: not chosen\n    discovery: returned\n");
+  explains({"explain", "com.example.a"}, "    path: " + older);
+  explains({"explain", "com.example.a"},
+           "    discovery: superseded by another copy by com.example.a (2.0) ");
   ok({"exclude", "add", "-i", "com.example.a"});
-  Ran excluded = drkit({"explain", newer, "--host", root() + "/Apps/Host.app"});
-  ASSERT_EQ(excluded.status, 0) << excluded.err;
-  EXPECT_EQ(excluded.out.rfind("host: " + root() + "/Apps/Host.app (com.example.host)\n", 0), 0u)
-      << excluded.out;
-  EXPECT_NE(excluded.out.find("    discovery: excluded by the user: "
-                              "{ \"UXExtensionIdentifier\": \"com.example.a\" }\n"),
-            std::string::npos)
-      << excluded.out;
-  Ran mismatch = drkit({"explain", newer, "-p", "com.example.elsewhere"});
-  EXPECT_NE(mismatch.out.find("    discovery: does not match the host's rules\n"),
-            std::string::npos)
-      << mismatch.out;
-
+  const std::vector<std::string> inHost = {"explain", newer, "--host", root() + "/Apps/Host.app"};
+  explains(inHost, "host: " + root() + "/Apps/Host.app (com.example.host)\n");
+  explains(
+      inHost,
+      "    discovery: excluded by the user: { \"UXExtensionIdentifier\": \"com.example.a\" }\n");
+  explains({"explain", newer, "-p", "com.example.elsewhere"},
+           "    discovery: does not match the host's rules\n");
   // The administrator's policy is read as drd reads it.
-  testing::WriteTestFile(root() + "/policy.pdoc", R"({"DeniedPlugIns": ["com.example.b"]})");
+  registry_test::WriteBytes(root() + "/policy.pdoc", R"({"DeniedPlugIns": ["com.example.b"]})");
   EXPECT_EQ(ok({"match", "-i", "com.example.b"}), "");
-  Ran vetoed = drkit({"explain", "com.example.b"});
-  EXPECT_NE(vetoed.out.find("    discovery: denied by the administrator's policy\n"),
-            std::string::npos)
-      << vetoed.out;
-
-  Ran missing = drkit({"explain", "com.example.none"});
-  EXPECT_EQ(missing.status, 1);
-  EXPECT_NE(missing.out.find("com.example.none: not registered\n"), std::string::npos);
+  explains({"explain", "com.example.b"}, "    discovery: denied by the administrator's policy\n");
+  EXPECT_EQ(explains({"explain", "com.example.none"}, "com.example.none: not registered\n"), 1);
 }
 
 TEST_F(DrkitTest, HostExampleDiscoversAndReadiesAPlugIn) {
@@ -460,43 +350,46 @@ TEST_F(DrkitTest, HostExampleDiscoversAndReadiesAPlugIn) {
   ok({"elect", "-i", "com.example.b", "use"});
   Child host(ClientBinaryPath("host_example"), {kPoint}, DrkitEnvironment(root()));
   EXPECT_EQ(host.wait(), 0) << host.err();
-  EXPECT_NE(host.out().find("com.example.a 1.0 "), std::string::npos) << host.out();
-  EXPECT_NE(host.out().find("\nreadied com.example.b\nread "), std::string::npos) << host.out();
-  EXPECT_NE(host.out().find(" bytes of Contents/Info.pdoc\n"), std::string::npos) << host.out();
-
+  for (const char* text :
+       {"com.example.a 1.0 ", "\nreadied com.example.b\nread ", " bytes of Contents/Info.pdoc\n"}) {
+    EXPECT_NE(host.out().find(text), std::string::npos) << host.out();
+  }
   Child nothing(ClientBinaryPath("host_example"), {"com.example.nowhere"},
                 DrkitEnvironment(root()));
   EXPECT_EQ(nothing.wait(), 1);
   EXPECT_EQ(nothing.err(), "no plug-in to ready\n");
 }
 
-// The command line is checked before anything is sent (the cases are in
-// the unit tests); here: what the process prints and its exit status.
+// What the process prints and its exit status for a bad command line (the
+// cases are in the unit tests) and for help.
 TEST(DrkitProcessTest, UsageErrorsExit2AndHelpExits0) {
   TempFolder root;
-  const std::vector<std::pair<std::vector<std::string>, std::string>> errors = {
-      {{}, "drkit: missing verb\nTry 'drkit help'.\n"},
-      {{"-S", "x", "match", "-x"}, "drkit: match: unknown option '-x'\nTry 'drkit help match'.\n"},
-      {{"nothing"}, "drkit: unknown verb 'nothing'\nTry 'drkit help'.\n"},
+  const struct {
+    std::vector<std::string> args;
+    int status;
+    std::string out, err;  // out: its start
+  } rows[] = {
+      {{}, 2, "", "drkit: missing verb\nTry 'drkit help'.\n"},
+      {{"-S", "x", "match", "-x"},
+       2,
+       "",
+       "drkit: match: unknown option '-x'\nTry 'drkit help match'.\n"},
+      {{"nothing"}, 2, "", "drkit: unknown verb 'nothing'\nTry 'drkit help'.\n"},
+      {{"--help"}, 0, "Usage: drkit [-S SERVICE] VERB", ""},
+      {{"help", "hold"}, 0, "Usage: drkit hold ", ""},
+      {{"hold", "--help"}, 0, "Usage: drkit hold ", ""},
+      {{"help", "--help"}, 0, "Usage: drkit help ", ""},
   };
-  for (const auto& [args, err] : errors) {
-    Ran r = RunDrkit(root.path(), args);
-    EXPECT_EQ(r.status, 2) << err;
-    EXPECT_EQ(r.err, err);
-    EXPECT_EQ(r.out, "");
-  }
-  const std::vector<std::pair<std::vector<std::string>, std::string>> helps = {
-      {{"--help"}, "Usage: drkit [-S SERVICE] VERB"},
-      {{"help", "hold"}, "Usage: drkit hold "},
-      {{"hold", "--help"}, "Usage: drkit hold "},
-      {{"help", "--help"}, "Usage: drkit help "},
-  };
-  for (const auto& [args, start] : helps) {
-    Ran r = RunDrkit(root.path(), args);
-    EXPECT_EQ(r.status, 0) << start;
-    EXPECT_EQ(r.out.rfind(start, 0), 0u) << r.out;
+  for (const auto& row : rows) {
+    Ran r = RunDrkit(root.path(), row.args);
+    EXPECT_EQ(r.status, row.status) << row.err << row.out;
+    EXPECT_EQ(r.out.rfind(row.out, 0), 0u) << r.out;
+    EXPECT_EQ(r.err, row.err);
+    if (row.out.empty()) {
+      EXPECT_EQ(r.out, "");
+    }
   }
 }
 
 }  // namespace
-}  // namespace dr
+}  // namespace dr::testing

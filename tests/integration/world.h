@@ -1,20 +1,20 @@
-// A private world for end-to-end tests of the requests: a temporary folder
-// with drd's socket, registry, state, preferences, policy and "system volume"
-// (root/system), a drd started in it, plug-in bundles and applications on
-// disk, and host applications that talk to drd from inside their bundle.
+// A private world for end-to-end tests: a temporary folder with drd's socket,
+// registry, state, preferences, policy and "system volume" (root/system), a
+// drd started in it, bundles on disk, and host applications that talk to drd
+// from inside their bundle.
 #pragma once
 
 #include <sys/types.h>
 
 #include <chrono>
 #include <memory>
-#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "client/include/drd/connection.h"
 #include "core/value.h"
+#include "tests/integration/drkit_runner.h"
 #include "tests/support/drm1_peer.h"
 #include "tests/support/registry_bundles.h"
 
@@ -30,86 +30,82 @@ bool Eventually(P predicate) {
   return false;
 }
 
-// A request message of `name` with the protocol version and `fields`.
 Value Request(const std::string& name, Dictionary fields = {});
-// The "errorcode" of a reply (0 for a success) and its "error".
-uint64_t ErrorCode(const Value& reply);
+uint64_t ErrorCode(const Value& reply);  // 0 for a success
 std::string ErrorText(const Value& reply);
+Value Uuids(Array list);
+size_t Occurrences(const std::string& text, const std::string& what);
 
-// A host application process: a copy of the relay program at
-// <app>/Contents/Exec/<executable>, connected to drd, so drd judges it by
-// that application's bundle and entitlements. The test talks through it.
+// Hand-made frames, for bytes the encoder refuses to make: a little-endian
+// 32-bit number, a key, a request frame with serial 1 around a `body`, a top
+// dictionary {"a": [[...]]} whose innermost array is at `depth`, and frames
+// that each break the protocol in their own way.
+std::string RawU32(uint32_t n);
+std::string RawKey(const std::string& key);
+std::string RawRequest(const std::string& body);
+std::string NestedBody(int depth);
+std::vector<std::pair<std::string, std::string>> BrokenFrames();
+
+// A copy of the relay program at <app>/Contents/Exec/host, connected to drd,
+// so drd judges it by that bundle; the test talks through it. `launcher`:
+// a command the host is started through (a sandbox, say).
 class HostApp {
  public:
-  // `launcher`: a command the host is started through (a sandbox, say).
-  HostApp(const std::string& appPath, const std::string& executable, const std::string& drdSocket,
-          const std::string& relayFolder, std::vector<std::string> launcher = {});
-  ~HostApp();
-  HostApp(const HostApp&) = delete;
-  HostApp& operator=(const HostApp&) = delete;
-
-  pid_t pid() const { return pid_; }
+  HostApp(const std::string& appPath, const std::string& drdSocket, const std::string& relayFolder,
+          std::vector<std::string> launcher);
+  pid_t pid() const { return child_->pid(); }
   client::Connection* connection() const { return connection_.get(); }
-  // Ends the host process (and so its connection to drd).
-  void kill();
+  void kill() {
+    connection_.reset();
+    child_.reset();
+  }
 
  private:
-  pid_t pid_ = -1;
+  std::unique_ptr<Child> child_;
   std::unique_ptr<client::Connection> connection_;
 };
 
 class World {
  public:
   World();
-  // Starts drd (-v, plus `environment` entries); false when it did not come up.
+  ~World();  // stops drd with SIGTERM, as the service manager would
+  // Starts drd -v with `environment` entries; false when it did not come up.
   bool start(std::vector<std::string> environment = {});
-  // SIGTERM and wait; true when drd exited cleanly.
-  bool stop();
-  // SIGTERM, wait, start again with the same environment.
-  bool restart();
-  // SIGKILL (a crash: no clean-up runs), reap, start again with the same
-  // environment.
-  bool kill9();
+  bool stop();     // SIGTERM; true on a clean exit
+  bool restart();  // stop, then start with the same environment
+  bool kill9();    // SIGKILL (no clean-up runs), then start again
 
   const std::string& root() const { return root_.path(); }
   std::string path(const std::string& relative) const { return root_ / relative; }
   DrdProcess& drd() { return *drd_; }
   std::string log() const { return drd_->standardError(); }
+  // The per-host user preferences file drd reads.
+  std::string prefsFile() const;
 
-  // A connection of the test process itself (a free-standing program).
   std::unique_ptr<client::Connection> connect() const;
-  // One request on `connection` (a fresh free-standing one when null); the
-  // reply, or a reply with errorcode 99999 when the call failed.
+  // One request on `connection` (null: a fresh one); a failed call gives
+  // errorcode 99999.
   Value call(const Value& request, client::Connection* connection = nullptr) const;
 
-  // An application folder at `path` (relative to root) with identifier `id`.
   std::string makeApp(const std::string& path, const std::string& id,
                       const Value& entitlements = Value()) const;
-  // A plug-in bundle at `path` (relative to root) with identifier `id`, for
-  // extension point "com.example.point", version `version`, an executable
-  // named "run", `extra` entries merged into its plug-in dictionary (and
-  // extra "UXExtensionAttributes" into its attributes), and
-  // `entitlements` besides the sandbox entitlement every plug-in needs.
+  // A plug-in bundle at `path` with identifier `id`, for "com.example.point"
+  // unless `extra` (merged into its plug-in dictionary) names another, an
+  // executable "run", and the sandbox entitlement besides `entitlements`.
   std::string makePlugIn(const std::string& path, const std::string& id,
                          const std::string& version = "1.0", const Dictionary& extra = {},
                          const Value& entitlements = Value()) const;
-  // Registers `paths` with "add"; the reply.
   Value add(const std::vector<std::string>& paths) const;
-  // The "matches" of a "match" with `rules` (absent: none) and `flags`,
-  // asked on `connection` (null: a free-standing connection).
+  // The "matches" of a "match" (expected to succeed).
   Value match(const Value& rules = Value(), uint64_t flags = 0,
               client::Connection* connection = nullptr) const;
-  // The identifiers of `matches`, in order, as one text "a b c".
+  // The identifiers of `matches`, sorted, as one text "a b c".
   static std::string Identifiers(const Value& matches);
-  // Every registered plug-in's form as a manager host sees it (all
-  // visibility filters off), and the UUID (a UUID value) of the first one
-  // of `id`.
+  // Every registered plug-in as a manager host sees it, and the UUID value
+  // of the first of `id`.
   Value everything() const;
   Value uuidOf(const std::string& id) const;
 
-  // A host application process running from `app` (made with makeApp),
-  // started through `launcher` when given; it relays through a socket in
-  // path("relays").
   std::unique_ptr<HostApp> host(const std::string& app,
                                 std::vector<std::string> launcher = {}) const;
 
@@ -117,6 +113,7 @@ class World {
   registry_test::TempFolder root_;
   std::vector<std::string> environment_;
   std::unique_ptr<DrdProcess> drd_;
+  bool serving_ = false;
   mutable std::unique_ptr<HostApp> manager_;
 };
 
