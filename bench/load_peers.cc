@@ -17,6 +17,7 @@
 #include <algorithm>
 #include <cstring>
 #include <filesystem>
+#include <functional>
 #include <map>
 
 #include "bench/load.h"
@@ -56,55 +57,70 @@ void EchoServer::setReply(const dr::Value& body) {
   reply_ = body;
 }
 
-void EchoServer::run() {
-  struct Peer {
-    dr::drm1::FrameDecoder decoder{dr::drm1::kFromDaemon};
-    uint64_t serial = 1;
-  };
+// Serves the peers of `listenFd` on the calling thread until `stop`: accepts
+// new ones and hands each one's received bytes to `take` with that peer's
+// state; a peer that hangs up is closed. `wakeFd` ends a wait for `stop`.
+namespace {
+
+template <typename Peer>
+void ServePeers(int listenFd, int wakeFd, const std::atomic<bool>& stop, const char* what,
+                const std::function<void(int, Peer&, std::string_view)>& take) {
   std::map<int, Peer> peers;
   std::vector<struct pollfd> fds;
   char buffer[65536];
-  while (!stop_) {
+  while (!stop) {
     fds.clear();
-    fds.push_back({listenFd_, POLLIN, 0});
-    fds.push_back({wakeFd_, POLLIN, 0});
+    fds.push_back({listenFd, POLLIN, 0});
+    fds.push_back({wakeFd, POLLIN, 0});
     for (const auto& [fd, peer] : peers) fds.push_back({fd, POLLIN, 0});
-    if (::poll(fds.data(), fds.size(), -1) < 0 && errno != EINTR) Die("echo server poll");
+    if (::poll(fds.data(), fds.size(), -1) < 0 && errno != EINTR) Die(std::string(what) + " poll");
     if (fds[0].revents & POLLIN) {
       int fd;
-      while ((fd = ::accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC)) >= 0) peers[fd];
+      while ((fd = ::accept4(listenFd, nullptr, nullptr, SOCK_CLOEXEC)) >= 0) peers[fd];
     }
     for (size_t i = 2; i < fds.size(); ++i) {
       if (fds[i].revents == 0) continue;
       const int fd = fds[i].fd;
-      Peer& peer = peers[fd];
       ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
       if (n <= 0) {
         ::close(fd);
         peers.erase(fd);
         continue;
       }
-      peer.decoder.feed(std::string_view(buffer, static_cast<size_t>(n)));
-      for (;;) {
-        auto frame = peer.decoder.next();
-        if (!frame || !frame->has_value()) break;
-        dr::Value reply;
-        {
-          std::lock_guard<std::mutex> lock(mu_);
-          reply = reply_;
-        }
-        auto bytes = dr::drm1::EncodeFrame(peer.serial++, (**frame).header.serial,
-                                           dr::drm1::kFlagIsReply, reply);
-        size_t sent = 0;
-        while (bytes && sent < bytes->size()) {
-          ssize_t w = ::send(fd, bytes->data() + sent, bytes->size() - sent, MSG_NOSIGNAL);
-          if (w <= 0) break;
-          sent += static_cast<size_t>(w);
-        }
-      }
+      take(fd, peers[fd], std::string_view(buffer, static_cast<size_t>(n)));
     }
   }
   for (const auto& [fd, peer] : peers) ::close(fd);
+}
+
+}  // namespace
+
+void EchoServer::run() {
+  struct Peer {
+    dr::drm1::FrameDecoder decoder{dr::drm1::kFromDaemon};
+    uint64_t serial = 1;
+  };
+  auto take = [this](int fd, Peer& peer, std::string_view bytes) {
+    peer.decoder.feed(bytes);
+    for (;;) {
+      auto frame = peer.decoder.next();
+      if (!frame || !frame->has_value()) break;
+      dr::Value reply;
+      {
+        std::lock_guard<std::mutex> lock(mu_);
+        reply = reply_;
+      }
+      auto encoded = dr::drm1::EncodeFrame(peer.serial++, (**frame).header.serial,
+                                           dr::drm1::kFlagIsReply, reply);
+      size_t sent = 0;
+      while (encoded && sent < encoded->size()) {
+        ssize_t w = ::send(fd, encoded->data() + sent, encoded->size() - sent, MSG_NOSIGNAL);
+        if (w <= 0) break;
+        sent += static_cast<size_t>(w);
+      }
+    }
+  };
+  ServePeers<Peer>(listenFd_, wakeFd_, stop_, "echo server", take);
 }
 
 // ---- Canned floor --------------------------------------------------------------
@@ -180,53 +196,30 @@ void CannedServer::run() {
     std::string in;  // bytes received and not yet answered
     uint64_t serial = 0;
   };
-  std::map<int, Peer> peers;
-  std::vector<struct pollfd> fds;
-  char buffer[65536];
-  while (!stop_) {
-    fds.clear();
-    fds.push_back({listenFd_, POLLIN, 0});
-    fds.push_back({wakeFd_, POLLIN, 0});
-    for (const auto& [fd, peer] : peers) fds.push_back({fd, POLLIN, 0});
-    if (::poll(fds.data(), fds.size(), -1) < 0 && errno != EINTR) Die("canned floor poll");
-    if (fds[0].revents & POLLIN) {
-      int fd;
-      while ((fd = ::accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC)) >= 0) peers[fd];
+  auto take = [this](int fd, Peer& peer, std::string_view bytes) {
+    peer.in.append(bytes);
+    size_t at = 0;
+    while (peer.in.size() - at >= dr::drm1::kHeaderSize) {
+      const std::string_view rest = std::string_view(peer.in).substr(at);
+      auto header = dr::drm1::DecodeHeader(rest);
+      if (!header) Die("canned floor: " + header.error().description());
+      if (rest.size() < dr::drm1::kHeaderSize + header->bodyLength) break;
+      const std::string_view body = rest.substr(dr::drm1::kHeaderSize, header->bodyLength);
+      std::lock_guard<std::mutex> lock(mu_);
+      auto reply = replies_.find(body);
+      if (reply == replies_.end()) Die("canned floor: a request with no recorded reply");
+      char head[dr::drm1::kHeaderSize] = {};
+      std::memcpy(head, dr::drm1::kMagic, 4);
+      PutU32(head + 4, static_cast<uint32_t>(reply->second.size()));
+      PutU64(head + 8, ++peer.serial);
+      PutU64(head + 16, header->serial);
+      PutU32(head + 24, dr::drm1::kFlagIsReply);
+      if (!SendBoth(fd, std::string_view(head, sizeof head), reply->second)) break;
+      at += dr::drm1::kHeaderSize + header->bodyLength;
     }
-    for (size_t i = 2; i < fds.size(); ++i) {
-      if (fds[i].revents == 0) continue;
-      const int fd = fds[i].fd;
-      Peer& peer = peers[fd];
-      ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
-      if (n <= 0) {
-        ::close(fd);
-        peers.erase(fd);
-        continue;
-      }
-      peer.in.append(buffer, static_cast<size_t>(n));
-      size_t at = 0;
-      while (peer.in.size() - at >= dr::drm1::kHeaderSize) {
-        const std::string_view rest = std::string_view(peer.in).substr(at);
-        auto header = dr::drm1::DecodeHeader(rest);
-        if (!header) Die("canned floor: " + header.error().description());
-        if (rest.size() < dr::drm1::kHeaderSize + header->bodyLength) break;
-        const std::string_view body = rest.substr(dr::drm1::kHeaderSize, header->bodyLength);
-        std::lock_guard<std::mutex> lock(mu_);
-        auto reply = replies_.find(body);
-        if (reply == replies_.end()) Die("canned floor: a request with no recorded reply");
-        char head[dr::drm1::kHeaderSize] = {};
-        std::memcpy(head, dr::drm1::kMagic, 4);
-        PutU32(head + 4, static_cast<uint32_t>(reply->second.size()));
-        PutU64(head + 8, ++peer.serial);
-        PutU64(head + 16, header->serial);
-        PutU32(head + 24, dr::drm1::kFlagIsReply);
-        if (!SendBoth(fd, std::string_view(head, sizeof head), reply->second)) break;
-        at += dr::drm1::kHeaderSize + header->bodyLength;
-      }
-      peer.in.erase(0, at);
-    }
-  }
-  for (const auto& [fd, peer] : peers) ::close(fd);
+    peer.in.erase(0, at);
+  };
+  ServePeers<Peer>(listenFd_, wakeFd_, stop_, "canned floor", take);
 }
 
 // ---- Raw client ------------------------------------------------------------------
