@@ -8,6 +8,8 @@ namespace dr {
 
 Result<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path,
                                              const std::string& bundle) {
+  // Without a sandbox there is no key to sign with.
+  if (!sandbox) return PosixError(ENOKEY, "no sandbox to issue a token for " + path);
   Result<std::string> resolved = CanonicalPathWithin(path, bundle);
   Result<std::string> token =
       resolved.ok() ? sandbox->issueFileExtension(kReadOnlyFileExtensionClass, *resolved,

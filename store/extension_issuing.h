@@ -17,8 +17,8 @@ namespace dr {
 // as registered) or lie inside it; or a POSIX error: ENOENT for a path that
 // does not exist, EACCES for one that resolves outside the bundle, as every
 // path of a bundle does once its folder is swapped for a symbolic link, and
-// EINVAL for a failure that has no system error number. The token names the
-// path that was checked, resolved once.
+// EINVAL for a failure that has no system error number, ENOKEY without a
+// sandbox (null). The token names the path that was checked, resolved once.
 Result<std::string> issueReadExtensionForURL(Sandbox* sandbox, const std::string& path,
                                              const std::string& bundle);
 

@@ -43,6 +43,7 @@ TEST(ExtensionIssuingTest, IssuesReadTokensWithinTheRegisteredBundleOnly) {
     ASSERT_FALSE(refusal.ok()) << path;
     EXPECT_EQ(refusal.error().code(), errnum) << path;
   }
+  EXPECT_EQ(issueReadExtensionForURL(nullptr, bundle, bundle).error().code(), ENOKEY);
 }
 
 }  // namespace
