@@ -118,9 +118,12 @@ struct VerbSpec : VerbGrammar {
   std::string details;
 };
 
-constexpr const char* kDiscoveryOptionsHelp =
-    "  -p, --extension-point POINT  plug-ins of this extension point\n"
-    "  -i, --identifier ID          plug-ins with this identifier\n"
+constexpr const char* kPointOptionHelp =
+    "  -p, --extension-point POINT  plug-ins of this extension point\n";
+// explain names its plug-ins by an operand instead.
+constexpr const char* kIdentifierOptionHelp =
+    "  -i, --identifier ID          plug-ins with this identifier\n";
+constexpr const char* kRuleOptionsHelp =
     "      --rule KEY=PATTERN       any rule, PATTERN a string; a KEY given again\n"
     "                               adds an alternative\n"
     "      --rule KEY:=JSON         a rule whose pattern is a number, boolean,\n"
@@ -210,7 +213,7 @@ const std::vector<VerbSpec>& Verbs() {
        std::string("Prints one line per plug-in, by identifier: its election mark ('+' elected,\n"
                    "'-' ignored, ' ' not chosen), identifier and version.\n\n"
                    "Options:\n") +
-           kDiscoveryOptionsHelp +
+           kPointOptionHelp + kIdentifierOptionHelp + kRuleOptionsHelp +
            "  -v, --verbose                also print UUID, path and registration time\n"
            "      --json                   print the plug-ins' forms as JSON\n\n"
            "Rules: each names a key of the plug-ins' attributes (then of their\n"
@@ -335,7 +338,7 @@ const std::vector<VerbSpec>& Verbs() {
                    "Options:\n"
                    "      --host APP               the host application's bundle (default: a\n"
                    "                               host outside any bundle)\n") +
-           kDiscoveryOptionsHelp +
+           kPointOptionHelp + kRuleOptionsHelp +
            "  -v, --verbose                also print what drd would log\n"
            "      --json                   print the same as one JSON object\n"},
       {{"help", {}, 0, 1, CheckHelp, RunHelp},
