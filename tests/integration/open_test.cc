@@ -15,12 +15,12 @@
 #include "tests/integration/drkit_runner.h"
 #include "tests/integration/world.h"
 #include "wire/drm1.h"
+#include "wire/protocol.h"
 
 namespace dr::testing {
 namespace {
 
 constexpr const char* kBwrap = "/usr/bin/bwrap";
-constexpr uint64_t kDiscoverAll = 0x200;
 
 // bwrap's arguments for a process that sees the system's programs and
 // libraries, the build tree, and the folders in `binds` (read-write), and
@@ -192,7 +192,8 @@ TEST_F(OpenTest, AHostInsideAFlatpakIsSandboxed) {
     launcher.push_back("--");
     std::unique_ptr<HostApp> host = w.host(app, launcher);
     ASSERT_NE(host->connection(), nullptr);
-    Value reply = w.call(Request("match", {{"flags", Value(kDiscoverAll)}}), host->connection());
+    Value reply =
+        w.call(Request("match", {{"flags", Value(message::kDiscoverAll)}}), host->connection());
     EXPECT_EQ(ErrorCode(reply), flatpak ? 11u : 0u) << ErrorText(reply);
   }
 }

@@ -10,6 +10,7 @@
 #include "platform/sandbox.h"
 #include "tests/integration/world.h"
 #include "tests/support/process_fixtures.h"
+#include "wire/protocol.h"
 
 namespace dr::testing {
 namespace {
@@ -17,10 +18,9 @@ namespace {
 using registry_test::ReadBytes;
 using registry_test::WriteBytes;
 
-constexpr uint64_t kAllVersions = 0x1;
-constexpr uint64_t kSystemOnly = 0x8;
-constexpr uint64_t kHybrid = 0x100;
-constexpr uint64_t kAll = 0x200;
+using message::kDiscoverAllVersions;
+using message::kDiscoverHybrid;
+using message::kDiscoverSystemOnly;
 
 class RequestsTest : public ::testing::Test {
  protected:
@@ -155,11 +155,11 @@ TEST_F(RequestsTest, WhatEachHostIsOffered) {
       {"free-standing program", nullptr, 0, "com.example.inapp com.example.p com.example.sys"},
       {"application sees its dedicated plug-in", host->connection(), 0,
        "com.example.inapp com.example.own com.example.p com.example.sys"},
-      {"hybrids on request", nullptr, kHybrid,
+      {"hybrids on request", nullptr, kDiscoverHybrid,
        "com.example.hy com.example.inapp com.example.p com.example.sys"},
-      {"every version", nullptr, kAllVersions,
+      {"every version", nullptr, kDiscoverAllVersions,
        "com.example.inapp com.example.p com.example.p com.example.sys"},
-      {"system volume only", host->connection(), kSystemOnly, "com.example.sys"},
+      {"system volume only", host->connection(), kDiscoverSystemOnly, "com.example.sys"},
   };
   for (const auto& row : rows) {
     EXPECT_EQ(World::Identifiers(w.match(Value(), row.flags, row.from)), row.expected) << row.what;
@@ -168,7 +168,8 @@ TEST_F(RequestsTest, WhatEachHostIsOffered) {
   ASSERT_EQ(p.size(), 1u);
   EXPECT_EQ(p.at(0)["version"].stringValue(), "1.10");
   // The privileged view needs the manager entitlement.
-  Value reply = w.call(Request("match", {{"flags", Value(kAll)}}), host->connection());
+  Value reply =
+      w.call(Request("match", {{"flags", Value(message::kDiscoverAll)}}), host->connection());
   EXPECT_EQ(ErrorCode(reply), 11u);
   EXPECT_EQ(ErrorText(reply), "unauthorized discovery flag (DRDiscoverAll)");
   EXPECT_EQ(w.everything().size(), 7u);  // one copy of com.example.p

@@ -15,6 +15,7 @@
 
 #include "platform/preferences.h"
 #include "wire/drm1.h"
+#include "wire/protocol.h"
 
 namespace dr::testing {
 namespace {
@@ -216,7 +217,7 @@ Value World::everything() const {
             Value{{"com.corvel.private.dromon.manager", true}});
     manager_ = host("Manager.app");
   }
-  return match(Value(), 0x200, manager_->connection());  // all plug-ins
+  return match(Value(), message::kDiscoverAll, manager_->connection());
 }
 
 Value World::uuidOf(const std::string& id) const {
