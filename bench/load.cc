@@ -62,6 +62,7 @@
 #include "bench/load.h"
 #include "client/include/drd/connection.h"
 #include "wire/drm1.h"
+#include "wire/protocol.h"
 
 namespace drbench {
 namespace {
@@ -124,7 +125,8 @@ std::string Verdict(bool judged, bool met) {
 std::string Mib(long kib) { return Fixed(static_cast<double>(kib) / 1024, 1) + " MiB"; }
 
 Value Envelope(const char* request) {
-  return Value{{"request", request}, {"version", uint64_t{2}}};
+  return Value{{dr::message::kRequestKey, request},
+               {dr::message::kVersionKey, dr::message::kProtocolVersion}};
 }
 
 // One request that must succeed.
@@ -397,7 +399,7 @@ void DurableReplace(const std::string& target, const std::string& bytes) {
 
 // ---- W7: many clients, then the same beside hostile peers -------------------
 
-constexpr uint64_t kHoldPlugIn = 2;  // "lock" flags: hold the plug-in at a path
+using dr::message::kHoldPlugIn;  // "lock" flags: hold the plug-in at a path
 
 // The plug-ins a W7 client works on: their UUIDs and bundle paths.
 struct Targets {
