@@ -115,56 +115,64 @@ class Drd {
 
 // ---- Peers (load_peers.cc) ---------------------------------------------------
 
+// A one-thread DRM1 server on a Unix socket at <folder>/<name> that polls
+// every connection; the subclass's run() serves them. A subclass calls
+// start() when it is ready and stop() first thing in its destructor.
+class FloorServer {
+ public:
+  virtual ~FloorServer();
+  const std::string& folder() const { return folder_; }
+  const std::string& name() const { return name_; }
+
+ protected:
+  FloorServer(std::string folder, std::string name);
+  void start();
+  void stop();
+  virtual void run() = 0;
+
+  const std::string folder_;
+  const std::string name_;
+  int listenFd_ = -1;
+  int wakeFd_ = -1;
+  std::atomic<bool> stop_{false};
+
+ private:
+  std::thread thread_;
+};
+
 // The floor: a DRM1 echo server on a Unix socket at <folder>/<name>, one
 // thread polling every connection. Each request frame is decoded and answered
 // with a reply frame whose body is the one set with setReply (so the bytes
 // on the wire have the sizes of drd's own reply).
-class EchoServer {
+class EchoServer : public FloorServer {
  public:
   EchoServer(std::string folder, std::string name);
-  ~EchoServer();
+  ~EchoServer() override { stop(); }
   void setReply(const dr::Value& body);
-  const std::string& folder() const { return folder_; }
-  const std::string& name() const { return name_; }
 
  private:
-  void run();
+  void run() override;
 
-  std::string folder_;
-  std::string name_;
-  int listenFd_ = -1;
-  int wakeFd_ = -1;
   std::mutex mu_;
   dr::Value reply_;  // guarded by mu_
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
 };
 
-// The canned floor: a DRM1 server on a Unix socket at <folder>/<name>, one
-// thread polling every connection, that answers each request with body bytes
+// The canned floor: a FloorServer that answers each request with body bytes
 // recorded from drd's own reply to the same request, under the request's
 // serial. It reads only frame headers and looks the request body up as
 // bytes, so it costs what moving drd's reply bytes costs and nothing else.
-class CannedServer {
+class CannedServer : public FloorServer {
  public:
   CannedServer(std::string folder, std::string name);
-  ~CannedServer();
+  ~CannedServer() override { stop(); }
   // From now on a request whose body is `request` is answered with `reply`.
   void record(std::string request, std::string reply);
-  const std::string& folder() const { return folder_; }
-  const std::string& name() const { return name_; }
 
  private:
-  void run();
+  void run() override;
 
-  std::string folder_;
-  std::string name_;
-  int listenFd_ = -1;
-  int wakeFd_ = -1;
   std::mutex mu_;
   std::map<std::string, std::string, std::less<>> replies_;  // guarded by mu_
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
 };
 
 // A client on the bare DRM1 framing, with no values in its path: it writes

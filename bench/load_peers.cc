@@ -27,29 +27,52 @@ namespace drbench {
 
 // ---- Floor -------------------------------------------------------------------
 
-EchoServer::EchoServer(std::string folder, std::string name)
-    : folder_(std::move(folder)), name_(std::move(name)), reply_(dr::Value::EmptyDictionary()) {
-  std::filesystem::create_directories(folder_);
-  const std::string path = folder_ + "/" + name_;
-  listenFd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+namespace {
+
+// A listening Unix socket at <folder>/<name>; dies when it cannot be made.
+int Listen(const std::string& folder, const std::string& name) {
+  std::filesystem::create_directories(folder);
+  const std::string path = folder + "/" + name;
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
   struct sockaddr_un addr = {};
   addr.sun_family = AF_UNIX;
   std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-  if (::bind(listenFd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0 ||
-      ::listen(listenFd_, 64) != 0) {
-    Die("echo server cannot listen at " + path);
+  if (fd < 0 || ::bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0 ||
+      ::listen(fd, 64) != 0) {
+    Die("cannot listen at " + path);
   }
+  return fd;
+}
+
+}  // namespace
+
+FloorServer::FloorServer(std::string folder, std::string name)
+    : folder_(std::move(folder)), name_(std::move(name)) {
+  listenFd_ = Listen(folder_, name_);
   wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+}
+
+FloorServer::~FloorServer() {
+  ::close(listenFd_);
+  ::close(wakeFd_);
+}
+
+void FloorServer::start() {
   thread_ = std::thread([this] { run(); });
 }
 
-EchoServer::~EchoServer() {
+void FloorServer::stop() {
+  if (!thread_.joinable()) return;
   stop_ = true;
   uint64_t one = 1;
   (void)!::write(wakeFd_, &one, sizeof one);
   thread_.join();
-  ::close(listenFd_);
-  ::close(wakeFd_);
+}
+
+EchoServer::EchoServer(std::string folder, std::string name)
+    : FloorServer(std::move(folder), std::move(name)) {
+  reply_ = dr::Value::EmptyDictionary();
+  start();
 }
 
 void EchoServer::setReply(const dr::Value& body) {
@@ -127,21 +150,6 @@ void EchoServer::run() {
 
 namespace {
 
-// A listening Unix socket at <folder>/<name>; dies when it cannot be made.
-int Listen(const std::string& folder, const std::string& name) {
-  std::filesystem::create_directories(folder);
-  const std::string path = folder + "/" + name;
-  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-  if (fd < 0 || ::bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0 ||
-      ::listen(fd, 64) != 0) {
-    Die("cannot listen at " + path);
-  }
-  return fd;
-}
-
 void PutU32(char* at, uint32_t v) {
   for (int i = 0; i < 4; ++i) at[i] = static_cast<char>(v >> (8 * i));
 }
@@ -171,19 +179,8 @@ bool SendBoth(int fd, std::string_view head, std::string_view body) {
 }  // namespace
 
 CannedServer::CannedServer(std::string folder, std::string name)
-    : folder_(std::move(folder)), name_(std::move(name)) {
-  listenFd_ = Listen(folder_, name_);
-  wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-  thread_ = std::thread([this] { run(); });
-}
-
-CannedServer::~CannedServer() {
-  stop_ = true;
-  uint64_t one = 1;
-  (void)!::write(wakeFd_, &one, sizeof one);
-  thread_.join();
-  ::close(listenFd_);
-  ::close(wakeFd_);
+    : FloorServer(std::move(folder), std::move(name)) {
+  start();
 }
 
 void CannedServer::record(std::string request, std::string reply) {

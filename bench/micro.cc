@@ -212,6 +212,21 @@ BENCHMARK_CAPTURE(BM_Drm1Encode, lock_release, LockRelease());
 BENCHMARK_CAPTURE(BM_Drm1Encode, match_100, MatchReply(100))->Unit(benchmark::kMicrosecond);
 BENCHMARK_CAPTURE(BM_Drm1Encode, match_1000, MatchReply(1000))->Unit(benchmark::kMicrosecond);
 
+// Decodes `frame` under serial `serial` (the serials of a connection rise)
+// through `decoder`, fed in 64 KiB pieces as a socket delivers a large reply.
+std::optional<dr::drm1::Frame> DecodeInPieces(dr::drm1::FrameDecoder& decoder, std::string& frame,
+                                              uint64_t serial, benchmark::State& state) {
+  std::memcpy(frame.data() + 8, &serial, sizeof serial);
+  std::optional<dr::drm1::Frame> got;
+  for (size_t at = 0; at < frame.size() && !got; at += 65536) {
+    decoder.feed(std::string_view(frame).substr(at, 65536));
+    auto next = decoder.next();
+    if (!next) state.SkipWithError("decode failed");
+    if (next && next->has_value()) got = std::move(**next);
+  }
+  return got;
+}
+
 // Decoding through the FrameDecoder, fed in 64 KiB pieces as a socket
 // delivers a large reply.
 void BM_Drm1Decode(benchmark::State& state, Value body) {
@@ -221,15 +236,7 @@ void BM_Drm1Decode(benchmark::State& state, Value body) {
   dr::drm1::FrameDecoder decoder;
   uint64_t serial = 0;
   for (auto _ : state) {
-    ++serial;
-    std::memcpy(frame.data() + 8, &serial, sizeof serial);
-    std::optional<dr::drm1::Frame> got;
-    for (size_t at = 0; at < frame.size() && !got; at += 65536) {
-      decoder.feed(std::string_view(frame).substr(at, 65536));
-      auto next = decoder.next();
-      if (!next) state.SkipWithError("decode failed");
-      if (next && next->has_value()) got = std::move(**next);
-    }
+    std::optional<dr::drm1::Frame> got = DecodeInPieces(decoder, frame, ++serial, state);
     benchmark::DoNotOptimize(got);
   }
   state.SetBytesProcessed(state.iterations() * static_cast<int64_t>(frame.size()));
@@ -296,15 +303,7 @@ void BM_ClientDecodeW3(benchmark::State& state) {
   dr::drm1::FrameDecoder decoder(dr::drm1::kFromDaemon);
   uint64_t serial = 0;
   for (auto _ : state) {
-    ++serial;
-    std::memcpy(frame.data() + 8, &serial, sizeof serial);
-    std::optional<dr::drm1::Frame> got;
-    for (size_t at = 0; at < frame.size() && !got; at += 65536) {
-      decoder.feed(std::string_view(frame).substr(at, 65536));
-      auto next = decoder.next();
-      if (!next) state.SkipWithError("decode failed");
-      if (next && next->has_value()) got = std::move(**next);
-    }
+    std::optional<dr::drm1::Frame> got = DecodeInPieces(decoder, frame, ++serial, state);
     if (!got || got->body["matches"].size() != 1000) state.SkipWithError("not 1,000 forms");
     benchmark::DoNotOptimize(got);
   }
