@@ -157,18 +157,29 @@ void BM_ExportForm(benchmark::State& state) {
 }
 BENCHMARK(BM_ExportForm);
 
+// A temporary folder with a sandbox key in it, and plug-in services that
+// sign tokens with that key; removed when it goes.
+struct SigningFolder {
+  SigningFolder() {
+    char pattern[] = "/tmp/drd-micro.XXXXXX";
+    root = std::filesystem::canonical(::mkdtemp(pattern)).string();
+    signing = dr::MakeLinuxCodeSigning(dr::ProcessInfo::Default(), dr::FileSystem::Default());
+    sandbox =
+        dr::MakeLinuxSandbox(dr::SandboxOptions{.keyPath = root + "/sandbox.key"}, signing.get());
+    services.sandbox = sandbox.get();
+  }
+  ~SigningFolder() { std::filesystem::remove_all(root); }
+  std::string root;
+  std::unique_ptr<dr::CodeSigning> signing;
+  std::unique_ptr<dr::Sandbox> sandbox;
+  dr::PlugInServices services;
+};
+
 // One "extensions" entry of a discovered form: an app extension shares its
 // bundle ("."), which costs a path check and a signed token.
 void BM_AugmentForm(benchmark::State& state) {
-  char pattern[] = "/tmp/drd-micro.XXXXXX";
-  const std::string root = std::filesystem::canonical(::mkdtemp(pattern)).string();
-  std::unique_ptr<dr::CodeSigning> signing =
-      dr::MakeLinuxCodeSigning(dr::ProcessInfo::Default(), dr::FileSystem::Default());
-  std::unique_ptr<dr::Sandbox> sandbox =
-      dr::MakeLinuxSandbox(dr::SandboxOptions{.keyPath = root + "/sandbox.key"}, signing.get());
-  dr::PlugInServices services;
-  services.sandbox = sandbox.get();
-  auto record = MakeRecord(42, 7, root, services);
+  SigningFolder world;
+  auto record = MakeRecord(42, 7, world.root, world.services);
   std::filesystem::create_directories(*record->url());
   for (auto _ : state) {
     Dictionary form;
@@ -176,7 +187,6 @@ void BM_AugmentForm(benchmark::State& state) {
     if (form["extensions"].size() != 1) state.SkipWithError("no token");
     benchmark::DoNotOptimize(form);
   }
-  std::filesystem::remove_all(root);
 }
 BENCHMARK(BM_AugmentForm);
 
@@ -253,25 +263,17 @@ BENCHMARK_CAPTURE(BM_Drm1Decode, match_1000, MatchReply(1000))->Unit(benchmark::
 // (w3-reply.body, written by a full load run), else one built the same way
 // here.
 std::string BuiltW3Reply() {
-  char pattern[] = "/tmp/drd-micro.XXXXXX";
-  const std::string root = std::filesystem::canonical(::mkdtemp(pattern)).string();
-  std::unique_ptr<dr::CodeSigning> signing =
-      dr::MakeLinuxCodeSigning(dr::ProcessInfo::Default(), dr::FileSystem::Default());
-  std::unique_ptr<dr::Sandbox> sandbox =
-      dr::MakeLinuxSandbox(dr::SandboxOptions{.keyPath = root + "/sandbox.key"}, signing.get());
-  dr::PlugInServices services;
-  services.sandbox = sandbox.get();
+  SigningFolder world;
   Array matches;
   for (int p = 0; p < 10; ++p) {
     for (int i = 0; i < 100; ++i) {
-      auto record = MakeRecord(p, i, root, services);
+      auto record = MakeRecord(p, i, world.root, world.services);
       std::filesystem::create_directories(*record->url());
       Dictionary form = record->exportForm().dictionary();
       record->augmentForm(form);
       matches.push_back(Value(std::move(form)));
     }
   }
-  std::filesystem::remove_all(root);
   return *dr::drm1::EncodeFrame(1, 1, dr::drm1::kFlagIsReply,
                                 Value{{"matches", Value(std::move(matches))}});
 }
