@@ -76,7 +76,7 @@ Status ReplyStatus(const Value& reply) {
 Result<std::unique_ptr<Client>> Client::Open(const std::string& serviceName,
                                              const std::string& socketDirectory) {
   Result<std::unique_ptr<Connection>> connection = Connection::Open(serviceName, socketDirectory);
-  if (!connection) return connection.error();
+  if (!connection.ok()) return connection.error();
   return std::make_unique<Client>(std::move(*connection));
 }
 
@@ -96,7 +96,7 @@ Result<Value> Client::exchange(std::string_view name, Dictionary fields) {
 
 Result<Value> Client::call(std::string_view name, Dictionary fields) {
   Result<Value> reply = exchange(name, std::move(fields));
-  if (!reply) return reply;
+  if (!reply.ok()) return reply;
   if (Status status = ReplyStatus(*reply); !status.ok()) return status.error();
   return reply;
 }
@@ -117,7 +117,7 @@ Result<std::vector<PlugIn>> Client::match(const Value& rules, uint64_t flags) {
   Dictionary fields{{kFlagsKey, Value(flags)}};
   if (rules.isPresent()) fields[kRulesKey] = rules;
   Result<Value> reply = call(kRequestMatch, std::move(fields));
-  if (!reply) return reply.error();
+  if (!reply.ok()) return reply.error();
   const Value& matches = (*reply)[kMatchesKey];
   if (!matches.isArray()) return UnexpectedReply(kRequestMatch, *reply);
   std::vector<PlugIn> plugIns;
@@ -136,7 +136,7 @@ Status Client::ready(const std::vector<Uuid>& plugIns) {
 
 Result<std::vector<std::string>> Client::access(const std::vector<Uuid>& plugIns) {
   Result<Value> reply = call(kRequestAccess, {{kUuidsKey, Uuids(plugIns)}});
-  if (!reply) return reply.error();
+  if (!reply.ok()) return reply.error();
   const Value& tokens = (*reply)[kExtensionsKey];
   if (!tokens.isArray() || tokens.size() != plugIns.size()) {
     return UnexpectedReply(kRequestAccess, *reply);
@@ -162,7 +162,7 @@ Result<Uuid> Client::hold(HoldTarget target, const std::vector<std::string>& pat
                           std::vector<Value>* conflicts) {
   Result<Value> reply = exchange(kRequestLock, {{kFlagsKey, Value(static_cast<uint64_t>(target))},
                                                 {kPathsKey, Strings(paths)}});
-  if (!reply) return reply.error();
+  if (!reply.ok()) return reply.error();
   if (Status status = ReplyStatus(*reply); !status.ok()) {
     if (conflicts) {
       const Array& busy = (*reply)[kConflictsKey].array();

@@ -145,7 +145,7 @@ Result<uint64_t> Connection::State::write(const Value& message, uint32_t flags,
   if (fd < 0) return dead;
   const uint64_t serial = nextSerial;
   Result<std::string> frame = drm1::EncodeFrame(serial, 0, flags, message);
-  if (!frame) return frame.error();
+  if (!frame.ok()) return frame.error();
   ++nextSerial;
   const std::string& bytes = *frame;
   size_t sent = 0;
@@ -190,10 +190,10 @@ Result<Value> Connection::request(const Value& message, std::chrono::millisecond
   std::lock_guard<std::mutex> lock(s.mu);
   const Clock::time_point deadline = DeadlineAfter(timeout);
   Result<uint64_t> serial = s.write(message, drm1::kFlagWantsReply, deadline);
-  if (!serial) return serial.error();
+  if (!serial.ok()) return serial.error();
   for (;;) {
     Result<std::optional<drm1::Frame>> frame = s.decoder.next();
-    if (!frame) {
+    if (!frame.ok()) {
       return s.fail(kProtocolError, "protocol error from drd: " + frame.error().description());
     }
     if (frame->has_value()) {

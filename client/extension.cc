@@ -76,7 +76,7 @@ Result<std::string> OpenedExtension::readFile(const std::string& relative, size_
   if (!relative.empty()) {
     // Never blocks on a FIFO placed where a file should be.
     Result<UniqueFd> opened = OpenBeneath(fd_, relative, O_RDONLY | O_NONBLOCK);
-    if (!opened) return opened.error();
+    if (!opened.ok()) return opened.error();
     own = std::move(*opened);
     fd = own.get();
   }
@@ -99,7 +99,7 @@ Result<std::string> OpenedExtension::readFile(const std::string& relative, size_
 
 Result<std::vector<std::string>> OpenedExtension::listFolder(const std::string& relative) const {
   Result<UniqueFd> opened = OpenBeneath(fd_, relative, O_RDONLY | O_DIRECTORY);
-  if (!opened) return opened.error();
+  if (!opened.ok()) return opened.error();
   DIR* dir = ::fdopendir(opened->get());
   if (!dir) return PosixError(errno, "list " + relative);
   opened->release();  // the DIR owns it now
@@ -127,7 +127,7 @@ Result<OpenedExtension> openExtension(Connection& connection, std::string_view t
   // Owned from here on, whatever the reply says.
   std::vector<UniqueFd> owned;
   for (int d : descriptors) owned.emplace_back(d);
-  if (!reply) return reply.error();
+  if (!reply.ok()) return reply.error();
   if (Status status = ReplyStatus(*reply); !status.ok()) return status.error();
   std::optional<std::string_view> path = (*reply)[message::kPathKey].string();
   if (!path || owned.size() != 1) {

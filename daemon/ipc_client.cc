@@ -37,10 +37,10 @@ DRDIpcClient::DRDIpcClient(std::shared_ptr<PeerConnection> connection,
       id_(gNextClientId.fetch_add(1)) {
   const ServerOptions& options = server_->options();
   Result<std::string> executable = options.processInfo->executablePath(token_.pid);
-  if (executable) {
+  if (executable.ok()) {
     bundle_ = DRBundle::initWithExecutablePath(*executable, options.bundleReader);
   }
-  server_->debug("client %d %s", token_.pid, executable ? *executable : std::string());
+  server_->debug("client %d %s", token_.pid, executable.ok() ? *executable : std::string());
   probes::ClientNew(token_.pid);
   task_ = options.codeSigning->taskForPidWithExecutable(token_.pid, executable);
 }
@@ -89,7 +89,7 @@ void DRDIpcClient::dead() {
 Value DRDIpcClient::entitlementValueForKey(std::string_view key) const {
   if (!task_) return Value();
   Result<Value> value = task_->entitlementValue(key);
-  if (!value) {
+  if (!value.ok()) {
     server_->log("error retrieving entitlements for pid %d", pid());
     return Value();
   }

@@ -152,12 +152,12 @@ int main(int argc, char** argv) {
   // The install folders are scanned while the registry opens, and
   // reconciled with it off the service queue once the server follows it.
   dr::InstallFolderOptions installOptions;
-  if (registryOptions) installOptions.folders = registryOptions->installFolders;
+  if (registryOptions.ok()) installOptions.folders = registryOptions->installFolders;
   std::unique_ptr<dr::InstallFolders> installFolders = dr::InstallFolders::Start(installOptions);
   dr::Result<std::unique_ptr<dr::Registry>> registry =
-      registryOptions ? dr::Registry::Open(*registryOptions)
-                      : dr::Result<std::unique_ptr<dr::Registry>>(registryOptions.error());
-  if (!registry) {
+      registryOptions.ok() ? dr::Registry::Open(*registryOptions)
+                           : dr::Result<std::unique_ptr<dr::Registry>>(registryOptions.error());
+  if (!registry.ok()) {
     dr::SystemLogAt(dr::LogPriority::kError, "unable to open the plug-in registry: %@",
                     registry.error());
     return Fail("unable to construct server");

@@ -17,7 +17,7 @@ std::shared_ptr<DRDServer> DRDServer::initForServiceDatabase(
       Listener::Create(ListenerOptions{server->options_.socketDirectory, serviceName,
                                        server->options_.useSocketActivation},
                        &server->ipcQueue_);
-  if (!listener) {
+  if (!listener.ok()) {
     SystemLog("unable to listen as \"%s\": %@", serviceName, listener.error());
     return nullptr;
   }

@@ -86,7 +86,7 @@ DRDAnnotationStore::~DRDAnnotationStore() {
 
 std::string DRDAnnotationStore::defaultDatabaseURL(const AnnotationStoreOptions& options) {
   Result<std::string> user = UserStateDirectory(options.getenv);
-  if (!user) {
+  if (!user.ok()) {
     Fatal(options, Format("unable to locate user directory: errno %d", user.error().code()));
   }
   std::string dir = *user + "/" + kFolderName;
@@ -134,9 +134,9 @@ Status DRDAnnotationStore::loadDb() {
     return Status(error);
   };
   Result<std::string> bytes = options_.fileSystem->readFile(annotationsURL_);
-  if (!bytes) return fail(bytes.error());
+  if (!bytes.ok()) return fail(bytes.error());
   Result<Value> doc = pdoc::Parse(*bytes);
-  if (!doc) return fail(doc.error());
+  if (!doc.ok()) return fail(doc.error());
   int64_t version = (*doc)[kVersionKey].intValue();
   if (version != kDatabaseVersion) {
     return fail(DRMakeErrorWithFormat(message::kErrorVersion,
@@ -168,7 +168,7 @@ void DRDAnnotationStore::updateEntryXml(const std::string& key) {
     return;
   }
   Result<std::string> text = pdoc::WriteXmlEntry(key, entry->second, kDataDepth);
-  if (!text) {
+  if (!text.ok()) {
     entryXml_.clear();
     entryXmlValid_ = false;
     return;
@@ -187,7 +187,7 @@ Status DRDAnnotationStore::save() {
     bool written = true;
     for (const auto& [key, entry] : annotations_) {
       Result<std::string> text = pdoc::WriteXmlEntry(key, entry, kDataDepth);
-      if (!text) {
+      if (!text.ok()) {
         written = false;
         break;
       }

@@ -382,7 +382,7 @@ std::string AddRuleText(Dictionary& rules, std::string_view value) {
   if (key.empty() || key.back() != ':') return AddRule(rules, key, Value(text));
   key.remove_suffix(1);
   Result<Value> typed = FromJson(text);
-  if (!typed) {
+  if (!typed.ok()) {
     return "--rule " + std::string(key) + ":=" + std::string(text) + ": " +
            typed.error().localizedDescription();
   }

@@ -118,14 +118,15 @@ int RunExplain(const Invocation& inv, Io& io) {
   const std::string targetPath = byPath ? Canonical(target) : std::string();
 
   Result<RegistryOptions> registryOptions = RegistryOptionsFromEnvironment();
-  if (!registryOptions) return Fail(io, registryOptions.error().localizedDescription());
+  if (!registryOptions.ok()) return Fail(io, registryOptions.error().localizedDescription());
   struct stat st {};
   if (::stat(registryOptions->databasePath.c_str(), &st) != 0) {
     // Opening would make an empty one; nothing is registered anyway.
     return Fail(io, "no registry at " + registryOptions->databasePath);
   }
   Result<std::unique_ptr<Registry>> registry = Registry::Open(*registryOptions);
-  if (!registry) return Fail(io, "cannot open the registry: " + registry.error().description());
+  if (!registry.ok())
+    return Fail(io, "cannot open the registry: " + registry.error().description());
 
   // The host.
   std::unique_ptr<CodeSigning> signing =
@@ -137,7 +138,7 @@ int RunExplain(const Invocation& inv, Io& io) {
     std::shared_ptr<DRBundle> app = DRBundle::initWithPath(Canonical(inv.host));
     if (!app || !app->path()) return Fail(io, "no application at " + inv.host);
     Result<Value> own = signing->entitlementsForExecutable(app->executablePath().value_or(""));
-    if (!own) return Fail(io, "cannot read the entitlements of " + inv.host);
+    if (!own.ok()) return Fail(io, "cannot read the entitlements of " + inv.host);
     entitlements = *own;
     host.plugInsPath = app->plugInsPath();
     host.bundleIdentifier = app->bundleIdentifier().value_or("");

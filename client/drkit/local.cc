@@ -39,12 +39,12 @@ int RunExtension(const Invocation& inv, Io& io) {
   if (inv.operands[0] == "open") {
     Result<std::unique_ptr<client::Connection>> c =
         client::Connection::Open(inv.service, client::DefaultSocketDirectory());
-    if (!c) return Fail(io, c.error().localizedDescription());
+    if (!c.ok()) return Fail(io, c.error().localizedDescription());
     Result<client::OpenedExtension> opened = client::openExtension(**c, inv.operands[1]);
-    if (!opened) return Fail(io, opened.error().localizedDescription());
+    if (!opened.ok()) return Fail(io, opened.error().localizedDescription());
     const std::string file = inv.operands.size() > 2 ? inv.operands[2] : "";
     // A folder is listed, a file printed.
-    if (Result<std::vector<std::string>> names = opened->listFolder(file)) {
+    if (Result<std::vector<std::string>> names = opened->listFolder(file); names.ok()) {
       if (inv.json) {
         Array list(names->begin(), names->end());
         io.out << Json(io, Value{{"path", opened->path()}, {"names", Value(std::move(list))}})
@@ -55,7 +55,7 @@ int RunExtension(const Invocation& inv, Io& io) {
       return 0;
     }
     Result<std::string> bytes = opened->readFile(file);
-    if (!bytes) {
+    if (!bytes.ok()) {
       return Fail(
           io, (file.empty() ? opened->path() : file) + ": " + bytes.error().localizedDescription());
     }
@@ -63,7 +63,7 @@ int RunExtension(const Invocation& inv, Io& io) {
     return 0;
   }
   Result<std::string> path = client::consumeExtension(inv.operands[1]);
-  if (!path) return Fail(io, path.error().localizedDescription());
+  if (!path.ok()) return Fail(io, path.error().localizedDescription());
   io.out << (inv.json ? Json(io, Value{{"path", *path}}) : *path) << "\n";
   return 0;
 }
@@ -93,7 +93,7 @@ int RunExclude(const Invocation& inv, Io& io) {
   const std::string file = CurrentHostPreferencesFile(options, DRDUserPrefs::kDomain);
   Result<Value> stored = pdoc::ReadFile(file);
   Value document = Value::EmptyDictionary();
-  if (stored) {
+  if (stored.ok()) {
     document = *stored;
   } else if (stored.error().code() != kFileReadNoSuchFileError) {
     return Fail(
@@ -134,7 +134,7 @@ int RunWatch(const Invocation& inv, Io& io) {
   const std::string folder = NotificationOptionsFromEnvironment().directory;
   CatchStopSignals();
   Result<std::unique_ptr<NotificationObserver>> observer = NotificationObserver::Open(folder);
-  if (!observer) return Fail(io, observer.error().localizedDescription());
+  if (!observer.ok()) return Fail(io, observer.error().localizedDescription());
   // Says when posts start to be seen, for people and for scripts that wait.
   io.err << "drkit: watching " << folder << std::endl;
   uint64_t printed = 0;
@@ -142,7 +142,7 @@ int RunWatch(const Invocation& inv, Io& io) {
     // Short waits, so that a signal is noticed soon.
     Result<std::optional<Notification>> post =
         (*observer)->waitForPost(std::chrono::milliseconds(250));
-    if (!post) return Fail(io, post.error().localizedDescription());
+    if (!post.ok()) return Fail(io, post.error().localizedDescription());
     if (!*post) continue;
     if (inv.json) {
       // One object a line, whatever standard output is: a stream of events.

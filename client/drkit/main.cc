@@ -14,7 +14,7 @@ int main(int argc, char** argv) {
   // JSON for people is indented; JSON for a pipe or a file is one line.
   dr::drkit::Io io{std::cout, std::cerr, std::cin, ::isatty(STDOUT_FILENO) == 1};
   dr::Result<dr::drkit::Invocation> invocation = dr::drkit::ParseCommandLine(args);
-  if (!invocation) {
+  if (!invocation.ok()) {
     std::cerr << "drkit: " << invocation.error().localizedDescription() << "\n"
               << "Try '" << dr::drkit::HelpCommandFor(args) << "'.\n";
     return dr::drkit::kExitUsage;

@@ -100,7 +100,7 @@ Result<Value> FromJsonValue(const json& j, int depth) {
       Array out;
       for (const json& e : j) {
         Result<Value> v = FromJsonValue(e, depth + 1);
-        if (!v) return v;
+        if (!v.ok()) return v;
         out.push_back(std::move(*v));
       }
       return Value(std::move(out));
@@ -112,7 +112,7 @@ Result<Value> FromJsonValue(const json& j, int depth) {
       Dictionary out;
       for (const auto& [key, e] : j.items()) {
         Result<Value> v = FromJsonValue(e, depth + 1);
-        if (!v) return v;
+        if (!v.ok()) return v;
         out[key] = std::move(*v);
       }
       return Value(std::move(out));

@@ -39,7 +39,7 @@ std::vector<Uuid> ParseUuids(const std::vector<std::string>& texts) {
 Result<std::vector<PlugIn>> CopiesOf(Client& c, const std::string& identifier) {
   Result<std::vector<PlugIn>> found =
       c.match(Value{{client::kRuleIdentifier, identifier}}, kEveryCopy);
-  if (found && found->empty()) {
+  if (found.ok() && found->empty()) {
     return Error(kUsageErrorDomain, 1, "no plug-in with identifier '" + identifier + "'");
   }
   return found;
@@ -51,7 +51,7 @@ int ChangeBundles(const Invocation& inv, Io& io,
   std::vector<std::string> paths;
   for (const std::string& p : inv.operands) paths.push_back(AbsolutePath(p));
   auto c = Connect(inv);
-  Status s = c ? ((**c).*change)(paths) : c.status();
+  Status s = c.ok() ? ((**c).*change)(paths) : c.status();
   return s.ok() ? 0 : Fail(io, s.error());
 }
 
@@ -87,9 +87,9 @@ int Fail(Io& io, const std::string& message) {
 
 int RunMatch(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
+  if (!c.ok()) return Fail(io, c.error());
   Result<std::vector<PlugIn>> found = (*c)->match(inv.rules, inv.flags);
-  if (!found) return Fail(io, found.error());
+  if (!found.ok()) return Fail(io, found.error());
   if (inv.json) {
     Array forms;
     for (const PlugIn& p : *found) forms.push_back(p.form);
@@ -117,9 +117,9 @@ int RunElect(const Invocation& inv, Io& io) {
                     : choice == "ignore" ? client::kElectionIgnore
                                          : client::kElectionDefault;
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
+  if (!c.ok()) return Fail(io, c.error());
   Result<std::vector<PlugIn>> copies = CopiesOf(**c, inv.identifier);
-  if (!copies) return Fail(io, copies.error());
+  if (!copies.ok()) return Fail(io, copies.error());
   std::vector<Uuid> uuids;
   for (const PlugIn& p : *copies) uuids.push_back(p.uuid);
   Status s = (*c)->annotate(uuids, change);
@@ -128,9 +128,9 @@ int RunElect(const Invocation& inv, Io& io) {
 
 int RunAnnotate(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
+  if (!c.ok()) return Fail(io, c.error());
   Result<std::vector<PlugIn>> copies = CopiesOf(**c, inv.identifier);
-  if (!copies) return Fail(io, copies.error());
+  if (!copies.ok()) return Fail(io, copies.error());
   if (inv.operands.empty() && inv.unset.empty()) {
     const Value& settings = copies->front().settings();
     io.out << Json(io, settings.isDictionary() ? settings : Value::EmptyDictionary()) << "\n";
@@ -167,10 +167,10 @@ int RunHold(const Invocation& inv, Io& io) {
   if (signals < 0) return Fail(io, PosixError(errno, "signalfd"));
 
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
+  if (!c.ok()) return Fail(io, c.error());
   std::vector<Value> conflicts;
   Result<Uuid> token = (*c)->hold(*inv.holdTarget, paths, &conflicts);
-  if (!token) {
+  if (!token.ok()) {
     int status = Fail(io, token.error());
     for (const Value& busy : conflicts) io.err << "drkit: busy: " << busy.description() << "\n";
     ::close(signals);
@@ -216,22 +216,22 @@ int RunHold(const Invocation& inv, Io& io) {
 
 int RunRelease(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
-  Status s = c ? (*c)->release(ParseUuids(inv.operands)) : c.status();
+  Status s = c.ok() ? (*c)->release(ParseUuids(inv.operands)) : c.status();
   return s.ok() ? 0 : Fail(io, s.error());
 }
 
 int RunReady(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
-  Status s = c ? (*c)->ready(ParseUuids(inv.operands)) : c.status();
+  Status s = c.ok() ? (*c)->ready(ParseUuids(inv.operands)) : c.status();
   return s.ok() ? 0 : Fail(io, s.error());
 }
 
 int RunAccess(const Invocation& inv, Io& io) {
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
+  if (!c.ok()) return Fail(io, c.error());
   const std::vector<Uuid> uuids = ParseUuids(inv.operands);
   Result<std::vector<std::string>> tokens = (*c)->access(uuids);
-  if (!tokens) return Fail(io, tokens.error());
+  if (!tokens.ok()) return Fail(io, tokens.error());
   if (inv.json) {
     Array pairs;
     for (size_t i = 0; i < tokens->size() && i < uuids.size(); ++i) {
@@ -252,7 +252,7 @@ int RunRaw(const Invocation& inv, Io& io) {
     text = inv.operands[0];
   }
   Result<Value> message = FromJson(text);
-  if (!message) {
+  if (!message.ok()) {
     io.err << "drkit: raw: " << message.error().localizedDescription() << "\n";
     return kExitUsage;
   }
@@ -261,9 +261,9 @@ int RunRaw(const Invocation& inv, Io& io) {
     return kExitUsage;
   }
   auto c = Connect(inv);
-  if (!c) return Fail(io, c.error());
+  if (!c.ok()) return Fail(io, c.error());
   Result<Value> reply = (*c)->send(*message);
-  if (!reply) return Fail(io, reply.error());
+  if (!reply.ok()) return Fail(io, reply.error());
   io.out << Json(io, *reply) << "\n";
   if (Status status = client::ReplyStatus(*reply); !status.ok()) return Fail(io, status.error());
   return 0;
@@ -274,7 +274,7 @@ int RunStatus(const Invocation& inv, Io& io) {
   auto c = Client::Open(inv.service, directory);
   // An empty annotation changes nothing and is answered at once: a request
   // that proves drd serves, without side effects.
-  Status s = c ? (*c)->annotate({}, client::AnnotationChange{}) : c.status();
+  Status s = c.ok() ? (*c)->annotate({}, client::AnnotationChange{}) : c.status();
   const std::string socket = directory + "/" + inv.service;
   if (inv.json) {
     io.out << Json(io, Value{{"service", inv.service}, {"socket", socket}, {"answering", s.ok()}})

@@ -26,7 +26,7 @@ int main(int argc, char** argv) {
   namespace client = dr::client;
 
   auto host = client::Client::Open();
-  if (!host) {
+  if (!host.ok()) {
     std::cerr << "cannot reach drd: " << host.error().description() << "\n";
     return 1;
   }
@@ -35,7 +35,7 @@ int main(int argc, char** argv) {
   // point.
   dr::Value rules{{client::kRuleExtensionPoint, argv[1]}};
   auto plugIns = (*host)->match(rules);
-  if (!plugIns) {
+  if (!plugIns.ok()) {
     std::cerr << "discovery failed: " << plugIns.error().description() << "\n";
     return 1;
   }
@@ -64,15 +64,15 @@ int main(int argc, char** argv) {
   // A sandboxed host cannot open the bundle's path; it asks for a token and
   // lets drd open what the token grants.
   auto tokens = (*host)->access({chosen->uuid});
-  if (!tokens) {
+  if (!tokens.ok()) {
     std::cerr << "no token for " << chosen->identifier << ": " << tokens.error().description()
               << "\n";
     return 1;
   }
   auto bundle = client::openExtension((*host)->connection(), tokens->front());
-  auto info =
-      bundle ? bundle->readFile("Contents/Info.pdoc") : dr::Result<std::string>(bundle.error());
-  if (!info) {
+  auto info = bundle.ok() ? bundle->readFile("Contents/Info.pdoc")
+                          : dr::Result<std::string>(bundle.error());
+  if (!info.ok()) {
     std::cerr << "cannot read the bundle of " << chosen->identifier << ": "
               << info.error().description() << "\n";
     return 1;

@@ -27,7 +27,7 @@ void annotatePlugIns(Transaction& t, DRDatabase& database) {
   // Values the annotation file cannot hold (a UUID, say) are refused here:
   // kept in memory they would make every later save of the file fail.
   if (const Value& election = annotations[kElectionKey]; election.isPresent()) {
-    if (!IsMessageNumber(election) || !pdoc::WriteXml(election)) {
+    if (!IsMessageNumber(election) || !pdoc::WriteXml(election).ok()) {
       t.failMessage(kErrorMalformed, "invalid request format (annotation election)");
       return;
     }
@@ -38,7 +38,7 @@ void annotatePlugIns(Transaction& t, DRDatabase& database) {
     // then this): deeper ones would make every reply that carries the
     // plug-in's form impossible to send.
     if (!extension.isDictionary() || extension.depth() > kMaxFormDepth - 2 ||
-        !pdoc::WriteXml(extension)) {
+        !pdoc::WriteXml(extension).ok()) {
       t.failMessage(kErrorMalformed, "invalid request format (annotation extension)");
       return;
     }
