@@ -67,7 +67,8 @@ TEST(ServerTest, HoldsLastUntilReleasedEvenOnesOfAClientThatEndedWhileItsRequest
   // A second record of the same plug-in is held too, until the hold's own
   // token is released.
   DRDPlugInPtr twin = DRDPlugIn::initWithRGData(registry->entryForUuid(*held->uuid()));
-  auto hold = DRDPlugInHold::initWithPlugInsForClient({held}, nullptr);
+  auto hold = DRDPlugInHold::initWithPlugInsForClient({held, held}, nullptr);
+  EXPECT_EQ(hold->blocked().size(), 1u);
   const Uuid token = hold->uuid();
   server->addHold(std::move(hold));
   for (const Uuid& released : {Uuid::random(), token}) {

@@ -20,8 +20,8 @@ namespace {
 
 using Child = testing::RunningProgram;
 
-// Registered plug-in bundles A (com.example.a 1.0), B (com.example.b 2.0) and
-// Outer (com.example.outer) holding Inner (com.example.inner); Loose is not.
+// Registered plug-in bundles com.example.A 1.0, com.example.B 2.0 and
+// com.example.Outer holding com.example.Inner; com.example.Loose is not.
 class ServiceManagerTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -88,7 +88,6 @@ TEST_F(ServiceManagerTest, BusyInstancesGrantsAndRemovalFollowTheLiveProcesses) 
       {exe("A") + "-missing", ENOENT},
       {bundle("A") + "/Contents/Info.pdoc", EACCES},  // mode 0644
       {bundle("A") + "/Contents/Exec", EACCES},       // a folder
-      {bundle("A") + "/Contents/Info.pdoc/run", ENOENT},
       {"", ENOENT},
       {exe("A"), 0},
       {root_ + "/Loose.appex/Contents/Exec/../Exec/run", 0},
