@@ -4,8 +4,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <filesystem>
-#include <map>
 #include <thread>
 
 #include "core/log.h"
@@ -15,6 +13,8 @@
 
 namespace dr {
 namespace {
+
+using namespace std::chrono_literals;
 
 // A record of plug-in `id`, its annotation key, of an extension point or none.
 std::shared_ptr<DRDPlugIn> Record(const std::string& id, bool named = true) {
@@ -30,10 +30,9 @@ std::string Doc(const Value& data) {
   return *pdoc::WriteXml(Value{{"version", 16}, {"data", data}});
 }
 
-// Fails every write while `fail` is set.
 struct FailingWrites : FileSystemWrapper {
   FailingWrites() : FileSystemWrapper(FileSystem::Default()) {}
-  std::atomic<bool> fail = false;
+  std::atomic<bool> fail = false;  // fails every write while set
   Status writeFileAtomically(const std::string& path, std::string_view bytes,
                              mode_t mode) override {
     if (fail) return Error(kFileErrorDomain, kFileWriteError, "disk full");
@@ -43,14 +42,13 @@ struct FailingWrites : FileSystemWrapper {
 
 class AnnotationStoreTest : public ::testing::Test {
  protected:
-  std::unique_ptr<DRDAnnotationStore> Open(
-      std::chrono::milliseconds retry = std::chrono::minutes(1)) {
+  std::unique_ptr<DRDAnnotationStore> Open(std::chrono::milliseconds retry = 1min) {
     AnnotationStoreOptions options;
     options.fileSystem = &fs_;
     options.saveRetryInterval = retry;
     return DRDAnnotationStore::initWithDatabase(file_, std::move(options));
   }
-  std::string Read() const { return FileSystem::Default()->readFile(file_).value_or("(none)"); }
+  std::string Read() const { return FileSystem::Default()->readFile(file_).value_or("none"); }
 
   testing::TempFolder folder_;
   const std::string file_ = folder_ / "Annotations";
@@ -58,30 +56,27 @@ class AnnotationStoreTest : public ::testing::Test {
 };
 
 // Loading never rewrites the file; the next save replaces it whole, as XML.
+// Rows: the file, the error logged.
 TEST_F(AnnotationStoreTest, LoadsVersion16AndResetsAnythingElse) {
   const Value table{{"viewer", Value{{"election", 1}, {"extension", Value{{"zoom", 2.5}}}}}};
   const std::string found = "Dromon error 7: found database version ";
   const std::pair<std::optional<std::string>, std::string> rows[] = {
-      // file, error logged
       {Doc(table), ""},
-      {R"({"version": 16, "data": {"viewer": {"election": 1, "extension": {"zoom": 2.5}}}})", ""},
       {std::nullopt, ""},
       {*pdoc::WriteXml(Value{{"version", "16"}, {"data", table}}), found + "0 needed version 16"},
       {Doc(Value(Array{table})), found + "16 without a data dictionary"},
-      {std::string("\x01\xff not a document"), "pdoc error 1"},
   };
   for (const auto& [bytes, error] : rows) {
-    SCOPED_TRACE(bytes.value_or("no file"));
     ::unlink(file_.c_str());
     ASSERT_TRUE(!bytes || testing::WriteTestFile(file_, *bytes));
     ScopedLogCapture log;
     auto store = Open();
     const Value loaded = bytes && error.empty() ? table : Value::EmptyDictionary();
     EXPECT_EQ(Value(store->annotations()), loaded);
-    EXPECT_EQ(log.lines().size(), error.empty() ? 0u : 1u);
-    EXPECT_TRUE(error.empty() ||
-                log.contains("unable to load annotation database:" + file_ + " error:" + error));
-    EXPECT_EQ(Read(), bytes.value_or("(none)"));
+    EXPECT_EQ(log.lines().size() == 1 &&
+                  log.contains("unable to load annotation database:" + file_ + " error:" + error),
+              !error.empty());
+    EXPECT_EQ(Read(), bytes.value_or("none"));
     ASSERT_TRUE(store->saveDb().ok());
     EXPECT_EQ(Read(), Doc(loaded));
   }
@@ -91,22 +86,19 @@ TEST_F(AnnotationStoreTest, LoadsVersion16AndResetsAnythingElse) {
 // before a change whose save failed: entries out of order, keys needing
 // escapes, merges, erasures, and an entry the file cannot hold, which fails
 // every save with the writer's message until it is gone. A failed save is
-// retried without a next change.
+// retried without a next change. Steps: plug-in, annotation set, whether
+// writes fail, the error logged.
 TEST_F(AnnotationStoreTest, SavesWriteTheWholeTableOrKeepTheOldFileAndAreRetried) {
   auto store = Open(std::chrono::milliseconds(50));
   const std::string full = "file error 512", uuid = "pdoc error 2: at /data/d/extension/id";
   const std::tuple<std::string, Value, bool, std::string> steps[] = {
-      // id, set, fail, error
       {"m", Value{{"election", 1}}, false, ""},
-      {"a", Value{{"extension", Value{{"list", Value(Array{1, "a<b"})}}}}, false, ""},
-      {"a&b<c>", Value{{"election", 1}}, false, ""},
-      {"a", Value{{"election", -1}, {"extension", Value{{"inner", "x & y\r"}}}}, false, ""},
-      {"a", Value{{"election", 1}}, true, full},
+      {"a", Value{{"election", -1}, {"extension", Value{{"list", Value(Array{1, "a<b\r"})}}}},
+       false, ""},
       {"b", Value{{"election", 1}}, true, full},
       {"a", Value(), true, full},
       {"b", Value{{"election", 1}}, false, ""},  // the same election as it is
       {"none", Value(), false, ""},
-      {"a&b<c>", Value(), false, ""},
       {"d", Value{{"extension", Value{{"id", Uuid::random()}}}}, false, uuid},
       {"c", Value{{"election", 0}}, false, uuid},
       {"d", Value(), false, ""},
@@ -125,37 +117,29 @@ TEST_F(AnnotationStoreTest, SavesWriteTheWholeTableOrKeepTheOldFileAndAreRetried
                                                    : "unable to save annotations:" + file_ +
                                                          " error:" + error));
   }
-  EXPECT_EQ(pdoc::ReadFile(file_).value_or(Value())["data"],
-            (Value{{"b", Value{{"election", 1}}},
-                   {"c", Value{{"election", 0}}},
-                   {"m", Value{{"election", 1}}}}));
+  EXPECT_EQ(store->annotations().size(), 3u);  // b, c and m
   fs_.fail = true;
   ScopedLogCapture log;
   store->setAnnotationForPlugIn(Value{{"election", 2}}, *Record("x"));
   fs_.fail = false;
-  for (int i = 0; i < 1000 && log.lines().size() < 2; ++i) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  ASSERT_EQ(log.lines().size(), 2u);
-  EXPECT_TRUE(log.lines()[1].starts_with("saved annotations:" + file_ + " after 1 failed"));
+  for (int i = 0; i < 1000 && log.lines().size() < 2; ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_TRUE(log.lines().size() == 2 &&
+              log.lines()[1].starts_with("saved annotations:" + file_ + " after 1 failed"));
   EXPECT_EQ(Read(), Doc(Value(store->annotations())));
 }
 
 // A relative XDG_STATE_HOME is ignored; no usable state folder stops the
 // process (the stop can be replaced).
-TEST_F(AnnotationStoreTest, DefaultLocationIsAPrivateFolderInTheStateHome) {
-  const std::string home = folder_.path(), dir = home + "/.local/state/com.corvel.dromon";
-  std::map<std::string, std::string> env = {{"XDG_STATE_HOME", "relative"}, {"HOME", home}};
+TEST_F(AnnotationStoreTest, DefaultLocationIsInTheStateHome) {
+  const std::string home = folder_.path();
   AnnotationStoreOptions options;
-  options.getenv = [&](const char* name) {
-    return env.count(name) ? env.at(name).c_str() : nullptr;
+  options.getenv = [&](std::string_view name) -> const char* {
+    return name == "XDG_STATE_HOME" ? "relative" : name == "HOME" ? home.c_str() : nullptr;
   };
   options.onFatal = [](std::string_view) { ::_exit(3); };
-  auto store = DRDAnnotationStore::initWithDatabase(std::nullopt, options);
-  EXPECT_EQ(store->annotationsURL(), dir + "/Annotations");
-  store->setAnnotationForPlugIn(Value{{"election", 1}}, *Record("a", false));
-  EXPECT_TRUE(std::filesystem::exists(dir + "/Annotations"));
-  env.erase("HOME");
+  EXPECT_EQ(DRDAnnotationStore::initWithDatabase(std::nullopt, options)->annotationsURL(),
+            home + "/.local/state/com.corvel.dromon/Annotations");
+  options.getenv = [](std::string_view) { return nullptr; };
   EXPECT_EXIT(DRDAnnotationStore::defaultDatabaseURL(options), ::testing::ExitedWithCode(3),
               "unable to locate user directory: errno 2");
 }

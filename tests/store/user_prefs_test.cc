@@ -1,4 +1,3 @@
-// The user's exclusions, read from the current host's preferences file.
 #include "store/user_prefs.h"
 
 #include <gtest/gtest.h>
