@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <limits>
-#include <map>
 
 #include "registry/registry.h"
 #include "registry/types_linux.h"
@@ -93,21 +92,6 @@ TEST(TypeServiceTest, ConformanceAndActivationRulesFollowMimeDataAndDeclarations
   }
   ASSERT_TRUE(registry->unregisterBundle(dir.path("P.appex")).ok());
   EXPECT_FALSE(types->conformsTo("org.example.photo", "org.example.picture"));
-}
-
-TEST(TypeDataFoldersTest, ComeFromTheEnvironment) {
-  const std::vector<std::string> usr = {"/usr/local/share", "/usr/share"};
-  const std::pair<std::map<std::string, std::string>, std::vector<std::string>> rows[] = {
-      {{{"HOME", "/h"}, {"XDG_DATA_HOME", ""}}, {"/h/.local/share", usr[0], usr[1]}},
-      {{{"XDG_DATA_HOME", "/d"}, {"XDG_DATA_DIRS", "/a::rel:/b"}}, {"/d", "/a", "/b"}},
-      {{{"XDG_DATA_HOME", "relative"}}, usr},
-  };
-  for (const auto& [env, expected] : rows) {
-    EXPECT_EQ(DataFoldersFromEnvironment([&](const char* name) {
-                return env.count(name) ? env.at(name).c_str() : nullptr;
-              }),
-              expected);
-  }
 }
 
 }  // namespace
