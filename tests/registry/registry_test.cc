@@ -109,7 +109,10 @@ class RegistryTest : public ::testing::Test {
   const std::string db_ = dir_ / "data/dromon/registry.sqlite3";
 };
 
-TEST_F(RegistryTest, RegistersOneEntryPerPlugInOrRefusesTheBundleAndStoresNothing) {
+// Each plug-in of a bundle gets an entry, else the bundle is refused and
+// nothing stored; registered again, it is replaced only when its files
+// changed; unregistered, all its entries go.
+TEST_F(RegistryTest, RegistersReRegistersAndUnregistersTellingObserversInCommitOrder) {
   const Value ent{{"com.corvel.security.app-sandbox", true}};
   auto bundle = [&](const char* name, const Value& v) { return MakeBundle(dir_ / name, v, ent); };
   const Value attr{{"UXExtensionAttributes", Value{{"UXExtensionIdentifier", "com.x.attr"}}}};
@@ -159,9 +162,24 @@ TEST_F(RegistryTest, RegistersOneEntryPerPlugInOrRefusesTheBundleAndStoresNothin
       {bundle("b5.appex", dr(Value{{"Multiple", Value{{"m.one", a}}}})), "", {{"m.one", a}}, true},
       {bundle("b6.appex", ux(attr).changing("Dromon", old)), "", {{"com.x.attr", attr}}},
   };
+  const Value info = PlugInInfo("r"), e{{"a", 1}};
+  const struct {
+    const char* name;
+    Value info, entitlements;  // the files written anew; none when `info` is absent
+    bool replaced;
+  } again[] = {
+      {"same files", Value(), Value(), false},
+      {"same bytes written again", info, e, false},
+      {"information changed", info.changing("BNBundleVersion", "2.0"), e, true},
+      {"entitlements changed", info, Value{{"b", 1}}, true},
+      {"entitlements removed", info, Value(), true},
+  };
   auto registry = Open();
-  auto recorder = std::make_shared<Recorder>();
+  auto recorder = std::make_shared<Recorder>(), removed = std::make_shared<Recorder>();
   registry->addObserver(recorder);
+  registry->addObserver(removed);
+  registry->removeObserver(removed.get());
+  registry->addObserver(std::make_shared<Recorder>());  // destroyed: never called
   Events installed;
   for (const auto& row : rows) {
     SCOPED_TRACE(row.url);
@@ -187,39 +205,14 @@ TEST_F(RegistryTest, RegistersOneEntryPerPlugInOrRefusesTheBundleAndStoresNothin
           << e.description();
     }
   }
-  ExpectKeptAcrossReopening(registry);
-  EXPECT_EQ(recorder->events, installed);  // in commit order: a refused bundle's would come first
-  EXPECT_EQ(std::tuple(ModeOf(db_), ModeOf(dir_ / "data/dromon"), ModeOf(dir_ / "data")),
-            std::tuple(0600u, 0700u, 0700u));
-}
-
-TEST_F(RegistryTest, ReRegisteringReplacesOnlyChangedBundlesAndUnregisteringRemovesThemInOrder) {
-  const Value info = PlugInInfo("r"), a{{"a", 1}};
-  const struct {
-    const char* name;
-    Value info, entitlements;  // the files written anew; none when `info` is absent
-    bool replaced;
-  } rows[] = {
-      {"same files", Value(), Value(), false},
-      {"same bytes written again", info, a, false},
-      {"information changed", info.changing("BNBundleVersion", "2.0"), a, true},
-      {"entitlements changed", info, Value{{"b", 1}}, true},
-      {"entitlements removed", info, Value(), true},
-  };
-  auto registry = Open();
-  auto recorder = std::make_shared<Recorder>(), removed = std::make_shared<Recorder>();
-  registry->addObserver(recorder);
-  registry->addObserver(removed);
-  registry->removeObserver(removed.get());
-  registry->addObserver(std::make_shared<Recorder>());  // destroyed: never called
-  Events expected;
+  // Registered again: replaced only when the files changed.
   int n = 0;
-  for (const auto& row : rows) {
+  for (const auto& row : again) {
     SCOPED_TRACE(row.name);
-    const std::string path = MakeBundle(dir_ / Format("r%d.appex", n++), info, a);
+    const std::string path = MakeBundle(dir_ / Format("r%d.appex", n++), info, e);
     ASSERT_TRUE(registry->registerBundle(path).ok());
     const RegistryEntries before = registry->entriesForUrl(path);
-    expected.push_back({true, UuidsOf(before)});
+    installed.push_back({true, UuidsOf(before)});
     if (row.info.isPresent()) {
       std::filesystem::remove_all(path);
       MakeBundle(path, row.info, row.entitlements);
@@ -230,7 +223,7 @@ TEST_F(RegistryTest, ReRegisteringReplacesOnlyChangedBundlesAndUnregisteringRemo
     EXPECT_EQ(after[0] == before[0], !row.replaced);  // the very entry, date and all
     if (row.replaced) {
       EXPECT_EQ(registry->entryForUuid(before[0]->uuid()), nullptr);
-      expected.insert(expected.end(), {{false, UuidsOf(before)}, {true, UuidsOf(after)}});
+      installed.insert(installed.end(), {{false, UuidsOf(before)}, {true, UuidsOf(after)}});
     }
   }
   EXPECT_EQ(registry->entryForUrl(dir_ / "no/../r2.appex")->bundleVersion(), "2.0");
@@ -242,17 +235,19 @@ TEST_F(RegistryTest, ReRegisteringReplacesOnlyChangedBundlesAndUnregisteringRemo
   const std::vector<Uuid> manyUuids = UuidsOf(registry->entriesForUrl(many));
   std::filesystem::create_directory_symlink(many, dir_ / "link.appex");
   EXPECT_TRUE(registry->unregisterBundle(dir_ / "link.appex").ok());
-  expected.insert(expected.end(), {{true, manyUuids}, {false, manyUuids}});
-  Status again = registry->unregisterBundle(many);
-  EXPECT_EQ(again.ok() ? "" : again.error().localizedDescription(),
+  installed.insert(installed.end(), {{true, manyUuids}, {false, manyUuids}});
+  Status gone = registry->unregisterBundle(many);
+  EXPECT_EQ(gone.ok() ? "" : gone.error().localizedDescription(),
             "cannot unregister \"" + many + "\": no plug-in is registered there");
-  registry.reset();
-  // Events leave in commit order, on one thread of the registry's own.
-  EXPECT_EQ(recorder->events, expected);
+  ExpectKeptAcrossReopening(registry);
+  // Events leave in commit order (a refused bundle's would come first), on
+  // one thread of the registry's own.
+  EXPECT_EQ(recorder->events, installed);
   EXPECT_EQ(recorder->threads.size(), 1u);
   EXPECT_EQ(recorder->threads.count(std::this_thread::get_id()), 0u);
   EXPECT_TRUE(removed->events.empty());
-  EXPECT_EQ(Open()->allEntries().size(), 5u);
+  EXPECT_EQ(std::tuple(ModeOf(db_), ModeOf(dir_ / "data/dromon"), ModeOf(dir_ / "data")),
+            std::tuple(0600u, 0700u, 0700u));
 }
 
 TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
