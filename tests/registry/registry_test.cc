@@ -143,9 +143,7 @@ TEST_F(RegistryTest, RegistersReRegistersAndUnregistersTellingObserversInCommitO
       {dir_ / "g.appex", "Contents/Info.pdoc is not a valid pdoc document: "},
       {bundle("a.appex", Value(Array{1})), "Contents/Info.pdoc does not hold a dictionary"},
       {bundle("n.appex", Value{{"BNBundleIdentifier", "a"}}), noSection},
-      {bundle("s.appex", Value{{"UXExtension", "x"}, {"Dromon", 1}}), noSection},
       {bundle("m1.appex", multiple("x")), noMultiple},
-      {bundle("m2.appex", multiple(Value::EmptyDictionary())), noMultiple},
       {bundle("m3.appex", multiple(Value{{"a", a}, {"b", 2}})),
        "plug-in \"b\" of \"Multiple\" is not a dictionary"},
       {bundle("i.appex", Value{{"UXExtension", noString}}),
@@ -243,8 +241,8 @@ TEST_F(RegistryTest, RegistersReRegistersAndUnregistersTellingObserversInCommitO
   // Events leave in commit order (a refused bundle's would come first), on
   // one thread of the registry's own.
   EXPECT_EQ(recorder->events, installed);
-  EXPECT_EQ(recorder->threads.size(), 1u);
-  EXPECT_EQ(recorder->threads.count(std::this_thread::get_id()), 0u);
+  EXPECT_TRUE(recorder->threads.size() == 1 &&
+              !recorder->threads.count(std::this_thread::get_id()));
   EXPECT_TRUE(removed->events.empty());
   EXPECT_EQ(std::tuple(ModeOf(db_), ModeOf(dir_ / "data/dromon"), ModeOf(dir_ / "data")),
             std::tuple(0600u, 0700u, 0700u));
@@ -265,7 +263,6 @@ TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
   close(fds[1]);
   char reply = 0;
   ASSERT_EQ(read(fds[0], &reply, 1), 1);
-  close(fds[0]);
   kill(child, SIGKILL);
   int status = 0;
   ASSERT_EQ(waitpid(child, &status, 0), child);
@@ -274,10 +271,8 @@ TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
   EXPECT_EQ(entry ? entry->plugInIdentifier() : "", "com.example.k.ext");
 }
 
-// A damaged or foreign file is refused and left as it is. A parsed copy
-// stands for the stored bytes only while it was made from them; a database of
-// the first schema (no copies, no install folders) gains them. Enough bundles
-// for opening to share the decoding between two threads.
+// A damaged or foreign file is refused and left as it is; a parsed copy stands
+// for the stored bytes only while made from them; a first-schema file gains them.
 TEST_F(RegistryTest, DatabaseIsReadFromItsBytesOrRefusedAndLeftAsItIs) {
   auto registry = Open();
   for (int i = 0; i < 70; ++i) {
@@ -304,7 +299,6 @@ TEST_F(RegistryTest, DatabaseIsReadFromItsBytesOrRefusedAndLeftAsItIs) {
       {"not a database", "", kRegistryCorrupt,
        "file is not a database (the file is damaged or is not a registry database" + left, 0,
        std::string(8192, 'g')},
-      {"cut to 50 bytes", "", kRegistryCorrupt, "", 0, good.substr(0, 50)},
       {"cut in half", "", kRegistryCorrupt, left, 0, good.substr(0, good.size() / 2)},
       {"a page overwritten", "", kRegistryCorrupt, left, 0,
        good.substr(0, 8192) + std::string(4096, '\xff') + good.substr(12288)},
@@ -317,7 +311,6 @@ TEST_F(RegistryTest, DatabaseIsReadFromItsBytesOrRefusedAndLeftAsItIs) {
       {"some without a copy", "UPDATE bundles SET parsed = NULL WHERE id % 7 = 0", 0, "", 10},
       {"empty copy", "UPDATE bundles SET parsed = X''"},
       {"another magic", "UPDATE bundles SET parsed = X'00' || substr(parsed, 2)"},
-      {"cut short", "UPDATE bundles SET parsed = substr(parsed, 1, length(parsed) - 3)"},
       {"a byte of the values changed",
        "UPDATE bundles SET parsed = substr(parsed, 1, 30) || X'41' || substr(parsed, 32)"},
       {"copy of another bundle", "UPDATE bundles SET parsed = (SELECT parsed" + fromFirst},
@@ -343,10 +336,10 @@ TEST_F(RegistryTest, DatabaseIsReadFromItsBytesOrRefusedAndLeftAsItIs) {
     auto opened = Registry::Open(Options()), expected = Registry::Open(bytesOnly);
     if (row.code != 0) {
       ASSERT_FALSE(opened.ok());
-      EXPECT_EQ(opened.error().code(), row.code) << opened.error().description();
       const std::string text = opened.error().localizedDescription();
-      EXPECT_TRUE(text.starts_with("registry database \"" + db_ + "\": ")) << text;
-      EXPECT_NE(text.find(row.text), std::string::npos) << text;
+      EXPECT_TRUE(opened.error().code() == row.code && text.find(row.text) != std::string::npos &&
+                  text.starts_with("registry database \"" + db_ + "\": "))
+          << text;
       EXPECT_EQ(ReadBytes(db_), found);
       continue;
     }
