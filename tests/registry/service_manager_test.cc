@@ -20,33 +20,25 @@ namespace {
 
 using Child = testing::RunningProgram;
 
-// Registered plug-in bundles com.example.A 1.0, com.example.B 2.0 and
-// com.example.Outer holding com.example.Inner; com.example.Loose is not.
-class ServiceManagerTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    for (const char* name : {"A", "B", "Outer", "Outer.appex/Contents/PlugIns/Inner", "Loose"}) {
-      const std::string id = std::filesystem::path(name).filename().string();
-      dir_.makeBundle(name + std::string(".appex"),
-                      test::PlugInBundleInfo("com.example." + id, id == "B" ? "2.0" : "1.0", "run"),
-                      "run");
-      ASSERT_TRUE(id == "Loose" || registry_->registerBundle(bundle(name)).ok()) << name;
-    }
-    sm_ = NewServiceManager({.registry = registry_.get()});
-  }
-  std::string bundle(const std::string& name) const { return root_ + "/" + name + ".appex"; }
-  std::string exe(const std::string& name) const { return bundle(name) + "/Contents/Exec/run"; }
-
-  test::BundleFixture dir_;
-  const std::string root_ = std::filesystem::canonical(dir_.root()).string();
-  std::unique_ptr<Registry> registry_ = test::OpenTestRegistry(root_ + "/data");
-  std::unique_ptr<ServiceManager> sm_;
-};
-
 // Busy: the live processes of the asked bundles (not a zombie's, not a nested
 // bundle's). Granted: a checked executable, named by the registry or its own
-// Info.pdoc. Stopped: that version's instances, even once unregistered.
-TEST_F(ServiceManagerTest, BusyInstancesGrantsSdksAndRemovalFollowTheLiveProcesses) {
+// Info.pdoc. Stopped: that version's instances, even once unregistered. The
+// bundles: com.example.A 1.0, com.example.B 2.0 and com.example.Outer holding
+// com.example.Inner, registered; com.example.Loose, not.
+TEST(ServiceManagerTest, BusyInstancesGrantsSdksAndRemovalFollowTheLiveProcesses) {
+  test::BundleFixture dir;
+  const std::string root = std::filesystem::canonical(dir.root()).string();
+  auto bundle = [&](const std::string& name) { return root + "/" + name + ".appex"; };
+  auto exe = [&](const std::string& name) { return bundle(name) + "/Contents/Exec/run"; };
+  std::unique_ptr<Registry> registry = test::OpenTestRegistry(root + "/data");
+  for (const char* name : {"A", "B", "Outer", "Outer.appex/Contents/PlugIns/Inner", "Loose"}) {
+    const std::string id = std::filesystem::path(name).filename().string();
+    dir.makeBundle(name + std::string(".appex"),
+                   test::PlugInBundleInfo("com.example." + id, id == "B" ? "2.0" : "1.0", "run"),
+                   "run");
+    ASSERT_TRUE(id == "Loose" || registry->registerBundle(bundle(name)).ok()) << name;
+  }
+  std::unique_ptr<ServiceManager> sm = NewServiceManager({.registry = registry.get()});
   ScopedLogCapture log;
   const std::string inner = "Outer.appex/Contents/PlugIns/Inner";
   Child a(exe("A")), b(exe("B")), in(exe(inner)), loose(exe("Loose")), zombie(exe("A"));
@@ -55,7 +47,7 @@ TEST_F(ServiceManagerTest, BusyInstancesGrantsSdksAndRemovalFollowTheLiveProcess
   ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(zombie.pid()), &info, WEXITED | WNOWAIT), 0);
   auto busy = [&](const std::string& name, const char* id, pid_t pid) {
     return BusyExtensionInstance{pid, bundle(name), id,
-                                 registry_->entryForUrl(bundle(name))->uuid()};
+                                 registry->entryForUrl(bundle(name))->uuid()};
   };
   const std::pair<std::vector<std::string>, std::vector<BusyExtensionInstance>> queries[] = {
       {{"com.example.A"}, {busy("A", "com.example.A", a.pid())}},
@@ -65,7 +57,7 @@ TEST_F(ServiceManagerTest, BusyInstancesGrantsSdksAndRemovalFollowTheLiveProcess
   };
   for (const auto& [identifiers, expected] : queries) {
     EXPECT_EQ(
-        sm_->busyExtensionInstances(identifiers).value_or(std::vector<BusyExtensionInstance>{}),
+        sm->busyExtensionInstances(identifiers).value_or(std::vector<BusyExtensionInstance>{}),
         expected);
   }
   const Value overlay{{"BNBundlePackageType", "IPC!"}};
@@ -75,35 +67,35 @@ TEST_F(ServiceManagerTest, BusyInstancesGrantsSdksAndRemovalFollowTheLiveProcess
       {bundle("A") + "/Contents/Exec", EACCES},       // a folder
       {"", ENOENT},
       {exe("A"), 0},
-      {root_ + "/Loose.appex/Contents/Exec/../Exec/run", 0},
+      {root + "/Loose.appex/Contents/Exec/../Exec/run", 0},
       {exe("A"), 0},  // the same again replaces it
   };
   for (const auto& [path, expected] : grants) {
-    EXPECT_EQ(sm_->addExternalService(::getpid(), path, overlay), expected) << path;
+    EXPECT_EQ(sm->addExternalService(::getpid(), path, overlay), expected) << path;
   }
-  EXPECT_EQ(sm_->addExternalService(0, exe("A"), overlay), ESRCH);
-  EXPECT_EQ(sm_->externalServiceGrants(),
+  EXPECT_EQ(sm->addExternalService(0, exe("A"), overlay), ESRCH);
+  EXPECT_EQ(sm->externalServiceGrants(),
             (std::vector<ExternalServiceGrant>{
                 {::getpid(), bundle("Loose"), "com.example.Loose", "1.0", exe("Loose"), overlay},
                 {::getpid(), bundle("A"), "com.example.A", "1.0", exe("A"), overlay}}));
   // An SDK registration is the first folder's file, even one holding no
   // dictionary; an identifier names no path.
-  dir_.writePdoc("sdk/com.example.list.pdoc", Value(Array{1}));
-  test::ScopedEnv path("DR_SDK_PATH", dir_.path("sdk"));
-  EXPECT_FALSE(sm_->sdkDictionary("com.example.list").ok());
-  EXPECT_EQ(sm_->sdkDictionary("../sdk/com.example.list").value_or(Value(1)), Value());
+  dir.writePdoc("sdk/com.example.list.pdoc", Value(Array{1}));
+  test::ScopedEnv path("DR_SDK_PATH", dir.path("sdk"));
+  EXPECT_FALSE(sm->sdkDictionary("com.example.list").ok());
+  EXPECT_EQ(sm->sdkDictionary("../sdk/com.example.list").value_or(Value(1)), Value());
 
-  EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.A", "2.0"), kNoInstanceRunning);
-  EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.A", "1.0"), 0);
+  EXPECT_EQ(sm->removeExternalServiceInstance("com.example.A", "2.0"), kNoInstanceRunning);
+  EXPECT_EQ(sm->removeExternalServiceInstance("com.example.A", "1.0"), 0);
   EXPECT_EQ(a.wait(), SIGTERM);
   EXPECT_TRUE(log.contains("stopped pid " + std::to_string(a.pid()) +
                            ", an instance of com.example.A 1.0 at " + bundle("A")));
-  ASSERT_TRUE(registry_->unregisterBundle(bundle("B")).ok());
-  EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.B", "2.0"), 0);
+  ASSERT_TRUE(registry->unregisterBundle(bundle("B")).ok());
+  EXPECT_EQ(sm->removeExternalServiceInstance("com.example.B", "2.0"), 0);
   EXPECT_EQ(b.wait(), SIGTERM);
-  EXPECT_EQ(sm_->removeExternalServiceInstance("com.example.Loose", "1.0"), 0);
+  EXPECT_EQ(sm->removeExternalServiceInstance("com.example.Loose", "1.0"), 0);
   EXPECT_EQ(loose.wait(), SIGTERM);
-  EXPECT_TRUE(sm_->externalServiceGrants().empty());
+  EXPECT_TRUE(sm->externalServiceGrants().empty());
 }
 
 }  // namespace
