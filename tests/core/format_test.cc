@@ -37,6 +37,7 @@ TEST(FormatTest, RendersEachConversion) {
       {Format("%s", 12), "12"},
       {Format("%@", 1, 2), "1"},
       {Format("trailing %5"), "trailing %5"},
+      {Format("trailing %"), "trailing %"},
   };
   for (const auto& [got, expected] : rows) EXPECT_EQ(got, expected);
 }

@@ -62,6 +62,7 @@ TEST(ValueTest, NumbersConvertSaturatingAndCompareAcrossKinds) {
       {Value(int64_t{9007199254740993}), Value(uint64_t{9007199254740992}), false},
       {Value(std::nan("")), Value(std::nan("")), false},
       {Value(Array{1, "a"}), Value(Array{1.0, "a"}), true},
+      {Value(Array{1, "a"}), Value(Array{"a", 1}), false},
       {Value{{"k", 1}}, Value{{"k", true}}, true},
       {Value{{"k", 1}}, Value{{"k", 1}, {"j", 1}}, false},
   };
