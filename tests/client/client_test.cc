@@ -73,7 +73,7 @@ TEST_F(ClientTest, CallsRelayDrdsErrorsAndRefuseRepliesMissingWhatWasPromised) {
   auto access = [](Client& c) { return c.access({kA, kA}).status(); };
   const std::pair<Value, std::function<Status(Client&)>> rows[] = {
       {Value::EmptyDictionary(), match},
-      {Value{{"matches", Value(Array{Value{{"identifier", "a"}}})}}, match},
+      {Value{{"matches", Value(Array{Value{{"identifier", "a"}, {"path", "/p"}}})}}, match},
       {Value{{"extensions", Value(Array{"only one"})}}, access},
       {Value{{"extensions", Value(Array{1, 2})}}, access},
       {Value{{"uuids", kA.string()}},
