@@ -1,137 +1,175 @@
 #include "core/queue.h"
 
 #include <gtest/gtest.h>
-
 #include <sys/resource.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+#include <functional>
+#include <future>
+#include <map>
+#include <sstream>
+#include <string>
 #include <thread>
 #include <vector>
+
+#include "core/turn_queue.h"
 
 namespace dr {
 namespace {
 
-// Work from this thread keeps its order while hundreds of threads wait at
-// once (as when many connections die together), mixing sync and async:
-// every piece runs once, alone, and every waiter gets its turn (a lost
-// wake-up hangs this test).
-TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
-  SerialQueue q("test");
-  std::vector<int> order;
+// Counts pieces of work that run while another runs: the queue is the guard.
+struct Alone {
   std::atomic<int> running{0};
   std::atomic<bool> overlapped{false};
-  auto work = [&](int i) {
+  template <typename F>
+  void run(F f) {
     if (running.fetch_add(1) != 0) overlapped = true;
-    order.push_back(i);  // unguarded on purpose: the queue is the guard
+    f();
     running.fetch_sub(1);
+  }
+};
+
+// Holds `q` busy until the answer is set: work submitted meanwhile waits.
+std::promise<void> Hold(SerialQueue& q) {
+  std::promise<void> released;
+  q.async([f = released.get_future().share()] { f.wait(); });
+  return released;
+}
+
+// Threads submit to a TurnQueue, each for a source of its own, beside work
+// they and this thread give the SerialQueue directly by sync and async:
+// every piece runs once, alone, each source's in order (a lost wake-up hangs
+// this test).
+TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
+  SerialQueue q("test");
+  TurnQueue turns(&q);
+  constexpr int kThreads = 128, kEach = 200;
+  std::map<uint64_t, std::vector<int>> seen;  // unguarded on purpose: the queue is the guard
+  Alone alone;
+  auto work = [&](uint64_t source, int i) {
+    return [&, source, i] { alone.run([&] { seen[source].push_back(i); }); };
   };
-  constexpr int kThreads = 256, kEach = 20;
   std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
+  for (uint64_t t = 0; t < kThreads; ++t) {
     threads.emplace_back([&, t] {
       for (int i = 0; i < kEach; ++i) {
-        if ((t + i) % 2) {
-          q.sync([&] { work(-1); });
-        } else {
-          q.async([&] { work(-1); });
-        }
+        turns.submit(t, work(t, i));
+        if (i % 10 == 0) i % 20 ? q.async(work(1000 + t, i)) : q.sync(work(1000 + t, i));
       }
     });
   }
-  for (int i = 0; i < 200; ++i) {  // sync waits for the work submitted before it
-    if (i % 3 == 0) {
-      q.sync([&, i] { work(i); });
-    } else {
-      q.async([&, i] { work(i); });
-    }
-  }
-  for (auto& t : threads) t.join();
+  for (int i = 0; i < kEach; ++i) i % 3 ? q.async(work(999, i)) : q.sync(work(999, i));
+  for (auto& th : threads) th.join();
   q.sync([] {});
-  EXPECT_FALSE(overlapped);
-  EXPECT_EQ(order.size(), 200u + kThreads * kEach);
-  std::erase(order, -1);
-  ASSERT_EQ(order.size(), 200u);
-  for (int i = 0; i < 200; ++i) EXPECT_EQ(order[i], i);
-}
-
-TEST(SerialQueueTest, SyncRunsOnTheCallersThreadAndKnowsItsQueue) {
-  SerialQueue a("a"), b("b");
-  const auto caller = std::this_thread::get_id();
-  EXPECT_FALSE(a.isCurrent());
-  a.sync([&] {
-    EXPECT_EQ(std::this_thread::get_id(), caller);
-    EXPECT_TRUE(a.isCurrent());
-    EXPECT_FALSE(b.isCurrent());
-    b.sync([&] {
-      EXPECT_TRUE(b.isCurrent());
-      EXPECT_TRUE(a.isCurrent());  // still inside a's work
-    });
-  });
-  EXPECT_FALSE(a.isCurrent());
-  std::atomic<bool> onWorker{false};
-  a.async([&] { onWorker = a.isCurrent() && std::this_thread::get_id() != caller; });
-  a.sync([] {});
-  EXPECT_TRUE(onWorker);
-  EXPECT_EQ(a.syncResult([] { return 42; }), 42);
-}
-
-// A thread that enters background priority runs lower than the others; a
-// queue keeps the priority of the thread that made it, also when work first
-// reaches it from a background thread (threads start as low as their maker),
-// and a background queue's thread runs lower.
-TEST(SerialQueueTest, BackgroundThreadsLowerOnlyThemselves) {
-  auto niceHere = [] { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); };
-  const int caller = niceHere();
-  if (caller >= 19) GTEST_SKIP() << "already at the lowest priority";
-  SerialQueue q("made by a default thread");
-  int background = -100, onQueue = -100;
-  std::thread([&] {
-    EnterBackgroundPriority();
-    EnterBackgroundPriority();  // once is enough: not lowered twice
-    background = niceHere();
-    std::atomic<bool> ran{false};
-    q.async([&] {
-      onQueue = niceHere();
-      ran = true;
-    });
-    while (!ran) std::this_thread::yield();
-  }).join();
-  EXPECT_EQ(background, std::min(caller + 10, 19));
-  EXPECT_EQ(onQueue, caller);
-  EXPECT_EQ(niceHere(), caller);
-
-  SerialQueue low("background", QueuePriority::kBackground);
-  int onLow = -100, inSync = -100;
-  low.async([&] { onLow = niceHere(); });
-  low.sync([&] { inSync = niceHere(); });
-  EXPECT_EQ(onLow, std::min(caller + 10, 19));
-  EXPECT_EQ(inSync, caller) << "sync() runs on its caller's thread";
-}
-
-TEST(SerialQueueTest, DestructionRunsQueuedWork) {
+  EXPECT_FALSE(alone.overlapped);
+  ASSERT_EQ(seen.size(), 2u * kThreads + 1);
+  for (const auto& [source, items] : seen) {
+    EXPECT_EQ(items.size(), source >= 1000 ? kEach / 10 : kEach) << source;
+    EXPECT_EQ(std::adjacent_find(items.begin(), items.end(), std::greater_equal<int>()),
+              items.end())
+        << source;
+  }
   std::atomic<int> ran{0};
   {
-    SerialQueue q("drain");
-    for (int i = 0; i < 50; ++i) q.async([&] { ran++; });
+    SerialQueue drained("drain");
+    for (int i = 0; i < 50; ++i) drained.async([&] { ran++; });
   }
-  EXPECT_EQ(ran, 50);
+  EXPECT_EQ(ran, 50) << "destruction runs queued work";
+}
+
+// Background priority lowers only its own thread; a queue keeps its maker's
+// priority even when work first reaches it from a background thread. sync()
+// runs on its caller's thread, which then is on the queue.
+TEST(SerialQueueTest, SyncRunsOnTheCallerAndBackgroundLowersOnlyItsThread) {
+  auto nice = [] { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); };
+  const int caller = nice(), low = std::min(caller + 10, 19);
+  if (caller >= 19) GTEST_SKIP() << "already at the lowest priority";
+  SerialQueue q("made by a default thread"), bg("bg", QueuePriority::kBackground);
+  int inBackground = -100, onQueue = -100, onBg = -100, inSync = -100;
+  std::thread([&] {
+    EnterBackgroundPriority();
+    EnterBackgroundPriority();  // not lowered twice
+    inBackground = nice();
+    q.async([&] { onQueue = nice(); });
+    q.sync([] {});
+  }).join();
+  bg.async([&] { onBg = bg.isCurrent() ? nice() : -1; });
+  bg.sync([&] {
+    inSync = q.syncResult([&] { return bg.isCurrent() && q.isCurrent() ? nice() : -1; });
+  });
+  EXPECT_FALSE(q.isCurrent());
+  EXPECT_EQ(std::vector<int>({inBackground, onQueue, nice(), onBg, inSync}),
+            std::vector<int>({low, caller, caller, low, caller}));
 }
 
 TEST(SerialQueueDeathTest, SyncFromItsOwnWorkStopsTheProcess) {
-  EXPECT_DEATH(
-      {
-        SerialQueue q("self");
-        q.sync([&] { q.sync([] {}); });
-      },
-      "would deadlock");
-  EXPECT_DEATH(
-      {
-        SerialQueue q("checked");
-        q.assertCurrent("needs the queue");
-      },
-      "needs the queue: not on queue \"checked\"");
+  auto selfSync = [] {
+    SerialQueue q("self");
+    q.sync([&] { q.sync([] {}); });
+  };
+  EXPECT_DEATH(selfSync(), "would deadlock");
+  EXPECT_DEATH(SerialQueue("checked").assertCurrent("needs"), "needs: not on queue \"checked\"");
+}
+
+// Items (source letter, number; z is source 0) submitted while the queue is
+// held: each source's run in order, sources take turns by first arrival, and
+// what a running item submits ("+": its source's next) waits for the round.
+TEST(TurnQueueTest, SourcesTakeTurnsAndEachKeepsItsOrder) {
+  const std::pair<std::string, std::string> cases[] = {
+      {"a1 a2 a3", "a1 a2 a3"},
+      {"a1 a2 a3 b1 b2 c1", "a1 b1 c1 a2 b2 a3"},
+      {"b1 a1 b2 a2 c1", "b1 a1 c1 b2 a2"},
+      {"a1 a2 a3 b1 c1 d1", "a1 b1 c1 d1 a2 a3"},
+      {"z1 z2 f1", "z1 f1 z2"},
+      {"a1+ b1 c1", "a1 b1 c1 a2"},
+  };
+  for (const auto& [submitted, expected] : cases) {
+    SerialQueue q("test");
+    TurnQueue turns(&q);
+    std::string ran;
+    std::function<void(std::string)> submit = [&](std::string label) {
+      turns.submit(label[0] == 'z' ? 0 : label[0] - 'a' + 1, [&, label] {
+        ran += (ran.empty() ? "" : " ") + label.substr(0, 2);
+        if (label.ends_with('+')) submit(label.substr(0, 1) + "2");
+      });
+    };
+    std::promise<void> gate = Hold(q);
+    std::istringstream in(submitted);
+    size_t n = 0;
+    for (std::string label; in >> label; ++n) submit(label);
+    EXPECT_EQ(turns.waiting(), n);
+    gate.set_value();
+    q.sync([] {});
+    q.sync([] {});  // after the drain that ran items submitted by items
+    EXPECT_EQ(ran, expected) << submitted;
+    EXPECT_EQ(turns.waiting(), 0u);
+  }
+}
+
+// A client gone with requests queued: each item still runs once and the
+// client is released after the last, also when the TurnQueue went first.
+TEST(TurnQueueTest, ItemsOfAGoneSourceRunOnceThenReleaseIt) {
+  for (bool dropTurnQueue : {false, true}) {
+    SerialQueue q("test");
+    auto turns = std::make_unique<TurnQueue>(&q);
+    auto client = std::make_shared<int>(0);
+    std::weak_ptr<int> weak = client;
+    std::vector<int> ran;
+    std::promise<void> gate = Hold(q);
+    for (int i = 0; i < 5; ++i) {
+      turns->submit(7, [client, &ran] { ran.push_back(++*client); });
+      turns->submit(8, [] {});
+    }
+    client.reset();
+    EXPECT_FALSE(weak.expired()) << "the queued items hold the client";
+    if (dropTurnQueue) turns.reset();
+    gate.set_value();
+    q.sync([] {});
+    EXPECT_EQ(ran, (std::vector<int>{1, 2, 3, 4, 5})) << dropTurnQueue;
+    EXPECT_TRUE(weak.expired()) << "released after its last item";
+  }
 }
 
 }  // namespace
