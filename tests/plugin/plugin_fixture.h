@@ -1,42 +1,81 @@
-// Plug-in bundles on disk and registry entries over them, for tests of the
-// daemon's plug-in records. Entries are built directly (so every field can be
-// chosen) from the same bytes the registry would store.
+// Plug-in bundles on disk and registry entries over them, built directly (so
+// every field can be chosen) from the bytes the registry would store; values
+// written as JSON, and tables as text.
 #pragma once
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <algorithm>
+#include <map>
 #include <memory>
-#include <optional>
 #include <string>
-#include <utility>
+#include <vector>
 
 #include "core/value.h"
 #include "pdoc/pdoc.h"
+#include "platform/code_signing.h"
 #include "plugin/plugin.h"
 #include "registry/registry.h"
 #include "tests/support/fake_service_manager.h"
+#include "tests/support/fake_types.h"
 #include "tests/support/registry_bundles.h"
 
 namespace dr::test {
 
+using std::nullopt;
 inline constexpr const char* kPoint = "com.example.point";
+
+// A value written as JSON (a scalar too).
+inline Value J(std::string_view json) {
+  return pdoc::Parse("[" + std::string(json) + "]").value().at(0);
+}
+
+// A table as text: rows end at ';' (white space around a row is dropped),
+// cells at '|'.
+inline std::vector<std::vector<std::string>> Table(std::string_view text) {
+  std::vector<std::vector<std::string>> rows;
+  while (!text.empty()) {
+    std::string_view row = text.substr(0, text.find(';'));
+    text.remove_prefix(std::min(row.size() + 1, text.size()));
+    size_t first = row.find_first_not_of(" \n"), last = row.find_last_not_of(" \n");
+    if (first == std::string_view::npos) continue;
+    row = row.substr(first, last + 1 - first);
+    rows.emplace_back();
+    for (size_t bar; (bar = row.find('|')) != std::string_view::npos; row.remove_prefix(bar + 1))
+      rows.back().emplace_back(row.substr(0, bar));
+    rows.back().emplace_back(row);
+  }
+  return rows;
+}
+
+// A host as the daemon's client connection presents it.
+class FakeClient : public PlugInClient {
+ public:
+  explicit FakeClient(Value entitlements = Value()) : entitlements_(std::move(entitlements)) {}
+  pid_t pid() const override { return 4242; }
+  Value entitlementValueForKey(std::string_view key) const override { return entitlements_[key]; }
+  bool hasEntitlement(std::string_view key) const override {
+    return IsEntitlementHeld(entitlements_[key]);
+  }
+
+ private:
+  Value entitlements_;
+};
 
 // A sandboxed plug-in "com.example.<name>.ext" in the bundle
 // "com.example.<name>", version 2.0, executable "<name>"; `pd` entries are
 // added to its plug-in dictionary and `attrs` entries to its attributes.
 inline Value PlugInInfo(const std::string& name, const Value& pd = Value(),
                         const Value& attrs = Value()) {
-  Dictionary a = attrs.dictionary();
-  a.insert_or_assign("UXExtensionIdentifier", "com.example." + name + ".ext");
-  Dictionary p = pd.dictionary();
-  p.insert_or_assign("UXExtensionPointIdentifier", kPoint);
-  if (!p.contains("UXExtensionProtocol")) p.insert_or_assign("UXExtensionProtocol", "Viewer");
-  p.insert_or_assign("UXExtensionAttributes", Value(std::move(a)));
+  Value a =
+      Value(attrs.dictionary()).changing("UXExtensionIdentifier", "com.example." + name + ".ext");
+  Value p = Value(pd.dictionary()).changing("UXExtensionPointIdentifier", kPoint);
+  if (!p.has("UXExtensionProtocol")) p = p.changing("UXExtensionProtocol", "Viewer");
   return Value{{"BNBundleIdentifier", "com.example." + name},
                {"BNBundleVersion", "2.0"},
                {"BNBundleExecutable", name},
-               {"UXExtension", Value(std::move(p))}};
+               {"UXExtension", p.changing("UXExtensionAttributes", a)}};
 }
 
 inline Value Sandboxed() { return Value{{"com.corvel.security.app-sandbox", true}}; }
@@ -73,15 +112,28 @@ class PlugInFixture : public ::testing::Test {
     return DRDPlugIn::initWithRGData(entry(info, entitlements, std::move(f)), services());
   }
 
-  virtual PlugInServices services() {
+  // Other plug-ins' versions come from `versions`, the database's stand-in.
+  PlugInServices services() {
     PlugInServices s;
-    s.serviceManager = &serviceManager;
-    s.getenv = [](const char*) -> const char* { return nullptr; };
+    s.serviceManager = manager ? manager : &serviceManager;
+    s.getenv = [this](const char* name) -> const char* {
+      return testSdk && std::string_view(name) == "DRTEST_SDK" ? testSdk->c_str() : nullptr;
+    };
+    s.types = types;
+    if (!versions.empty())
+      s.plugInVersion = [this](const Uuid& uuid) -> std::optional<std::string> {
+        auto it = versions.find(uuid.string());
+        return it == versions.end() ? std::nullopt : it->second;
+      };
     return s;
   }
 
   registry_test::TempFolder folder;
   FakeServiceManager serviceManager;
+  ServiceManager* manager = nullptr;   // instead of serviceManager
+  FakeTypeService* types = nullptr;    // none: a type conforms only to itself
+  std::optional<std::string> testSdk;  // the daemon's DRTEST_SDK
+  std::map<std::string, std::optional<std::string>> versions;
 
  private:
   int bundles_ = 0;
