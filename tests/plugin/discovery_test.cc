@@ -17,24 +17,18 @@
 namespace dr::test {
 namespace {
 
-struct Copy {
-  std::string version;
-  bool system;
-  double registered;  // seconds since 1970
-};
-
 class DiscoveryTest : public PlugInFixture {
  protected:
   // A copy of plug-in "com.example.<name>.ext" with entitlements beyond the sandbox.
-  DRDPlugInPtr copy(const std::string& name, const Copy& c, const Value& entitlements = Value(),
-                    const Value& attrs = Value()) {
+  DRDPlugInPtr copy(const std::string& name, const std::string& version, bool system,
+                    double registered, const Value& entitlements = {}, const Value& attrs = {}) {
     RegistryEntry::Fields f;
-    f.onSystemVolume = c.system;
-    f.registrationDate = Date{c.registered};
-    if (!c.system) f.containingApplication = RegistryApplication{folder / "App.app", "App"};
+    f.onSystemVolume = system;
+    f.registrationDate = Date{registered};
+    if (!system) f.containingApplication = RegistryApplication{folder / "App.app", "App"};
     Value granted = Sandboxed();
     for (const auto& [k, v] : entitlements.dictionary()) granted = granted.changing(k.str(), v);
-    return make(PlugInInfo(name, {}, attrs).changing("BNBundleVersion", Value(c.version)), granted,
+    return make(PlugInInfo(name, {}, attrs).changing("BNBundleVersion", Value(version)), granted,
                 std::move(f));
   }
   DiscoveryHost host(bool old = false) {
@@ -130,12 +124,11 @@ TEST_F(DiscoveryTest, MatchRulesEveryKeyPatternAndOperator) {
 // arrays of them, also beside other rules, narrow; ordering and type
 // operators, activation rules, patterns not ASCII and no rules do not.
 TEST_F(DiscoveryTest, RuleIndexSelectsEveryRecordTheRulesMatch) {
-  const char* texts[] = {"",     "0",     "00",   "1",     "01",  "10",    "1.1",
-                         "1.01", "01.01", "1.10", "1.1.0", "v1",  "v01",   "V1",
-                         "a0b",  "a00b",  "a0",   "a",     "1a2", "01a02", "1 .1",
-                         "1.",   ".1",    "0.1",  "00.1",  "100", "0100",  "0a"};
-  for (const char* a : texts) {
-    for (const char* b : texts) {
+  const Lines texts = Table(
+      "|0|00|1|01|10|1.1|1.01|01.01|1.10|1.1.0|v1|v01|V1|a0b|a00b|a0|a|1a2|"
+      "01a02|1 .1|1.|.1|0.1|00.1|100|0100|0a")[0];
+  for (const std::string& a : texts) {
+    for (const std::string& b : texts) {
       EXPECT_EQ(*VersionEqualityKey(a) == *VersionEqualityKey(b), compareVersionString(a, b) == 0)
           << '"' << a << "\" vs \"" << b << '"';
     }
@@ -190,35 +183,22 @@ TEST_F(DiscoveryTest, RuleIndexSelectsEveryRecordTheRulesMatch) {
 // copy was registered later; equal times keep the first. Every version
 // (0x1) keeps unequal versions, and with duplicates (0x4) equal ones too.
 TEST_F(DiscoveryTest, DuplicatesOfOneIdentifier) {
-  const struct {
-    Copy first, second;
-    uint64_t flags;
-    const char* returned;
-  } rows[] = {{{"1.2", true, 100}, {"1.10", true, 50}, 0, "second"},
-              {{"1.10", true, 50}, {"1.2", true, 100}, 0, "first"},
-              {{"1", false, 200}, {"1", true, 100}, 0, "second"},
-              {{"1", false, 100}, {"1", false, 200}, 0, "second"},
-              {{"1", false, 100}, {"1", false, 100}, 0, "first"},
-              {{"1", false, 200}, {"1", false, 100}, 0, "first"},
-              {{"1", true, 100}, {"1", false, 200}, 0, "second"},
-              {{"1.2", true, 100}, {"1.10", true, 50}, 0x1, "first+second"},
-              {{"1", true, 100}, {"1", true, 50}, 0x1, "first"},
-              {{"1", true, 100}, {"1", true, 50}, 0x5, "first+second"},
-              {{"1", true, 100}, {"1", true, 50}, 0x4, "first"}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.first.version + " " + row.second.version + " " + std::to_string(row.flags));
-    Discovery d(host(), Value(), row.flags, Value(), {});
-    DRDPlugInPtr a = copy("p", row.first), b = copy("p", row.second);
+  // version | (s)ystem or (a)pp | registered, for each copy; flags; the copies returned
+  const char* rows = R"(1.2|s|100|1.10|s|50|0|2; 1.10|s|50|1.2|s|100|0|1; 1|a|200|1|s|100|0|2;
+      1|a|100|1|a|200|0|2; 1|a|100|1|a|100|0|1; 1|a|200|1|a|100|0|1; 1|s|100|1|a|200|0|2;
+      1.2|s|100|1.10|s|50|1|12; 1|s|100|1|s|50|1|1; 1|s|100|1|s|50|5|12; 1|s|100|1|s|50|4|1)";
+  for (const auto& r : Table(rows)) {
+    SCOPED_TRACE(r[0] + r[1] + r[2] + " " + r[3] + r[4] + r[5] + " " + r[6]);
+    Discovery d(host(), Value(), std::stoul(r[6]), Value(), {});
+    DRDPlugInPtr a = copy("p", r[0], r[1] == "s", std::stod(r[2]));
+    DRDPlugInPtr b = copy("p", r[3], r[4] == "s", std::stod(r[5]));
     d.examine(a);
     d.examine(b);
     std::string returned;
     const Value found = d.finish();
-    for (const Value& form : found.array()) {
-      returned +=
-          (returned.empty() ? "" : "+") +
-          std::string(form["uuid"].stringValue() == a->uuid()->string() ? "first" : "second");
-    }
-    EXPECT_EQ(returned, row.returned);
+    for (const Value& form : found.array())
+      returned += form["uuid"].stringValue() == a->uuid()->string() ? "1" : "2";
+    EXPECT_EQ(returned, r[7]);
     for (const Discovery::Verdict& v : d.verdicts()) {  // the copy left out names the winner
       EXPECT_TRUE(v.outcome != DiscoveryOutcome::kSuperseded || v.by == (v.plugIn == a ? b : a));
     }
@@ -228,10 +208,10 @@ TEST_F(DiscoveryTest, DuplicatesOfOneIdentifier) {
 // The replacer itself is vetoed; the replaced form still names it.
 TEST_F(DiscoveryTest, ReplacementMarksSurviveAVeto) {
   const char* kReplace = "com.corvel.developer.replace-plugin";
-  DRDPlugInPtr old = copy("old", {"1", true, 1});
+  DRDPlugInPtr old = copy("old", "1", true, 1);
   DRDPlugInPtr replacer =
-      copy("new", {"1", true, 1}, Value{{kReplace, J(R"(["com.example.old.ext", 7])")}});
-  DRDPlugInPtr self = copy("self", {"1", true, 1}, Value{{kReplace, "com.example.self.ext"}});
+      copy("new", "1", true, 1, Value{{kReplace, J(R"(["com.example.old.ext", 7])")}});
+  DRDPlugInPtr self = copy("self", "1", true, 1, Value{{kReplace, "com.example.self.ext"}});
   DiscoveryServices services;
   services.mayUse = [](const Value& form) {
     return form["identifier"].stringValue() != "com.example.new.ext";
@@ -260,21 +240,16 @@ TEST_F(DiscoveryTest, WorkaroundBitAndChosenCandidates) {
   for (const auto& row : Table(hosts)) {
     EXPECT_EQ(Needs17732150Workaround(row[0], row[1]), row[2] == "1") << row[0] << " " << row[1];
   }
-  auto filter = [&](int n) {
+  std::vector<DRDPlugInPtr> records;  // two internal filters, then copies in an application
+  for (int n : {0, 5}) {
     RegistryEntry::Fields f;
-    f.registrationDate = Date{static_cast<double>(n)};
+    f.registrationDate = Date{n * 1.0};
     std::string path = folder / ("Effecta/InternalFilters.app/f" + std::to_string(n) + ".appex");
-    return DRDPlugIn::initWithRGData(entry(PlugInInfo("f"), Sandboxed(), f, path), services());
-  };
-  auto named = [&](const std::string& name, const char* point, double registered) {
-    return copy(name, {"2.0", false, registered}, Value(), Value{{"K", point}});
-  };
-  const std::vector<DRDPlugInPtr> records{filter(0),
-                                          named("a", "viewer", 1),
-                                          named("b", "editor", 1),
-                                          named("a", "viewer", 2),
-                                          named("c", "viewer", 1),
-                                          filter(5)};
+    records.push_back(
+        DRDPlugIn::initWithRGData(entry(PlugInInfo("f"), Sandboxed(), f, path), services()));
+  }
+  for (const auto& r : Table("a|1|viewer; b|1|editor; a|2|viewer; c|1|viewer"))
+    records.push_back(copy(r[0], "2.0", false, std::stod(r[1]), {}, Value{{"K", r[2]}}));
   for (const DRDPlugInPtr& r : records) ASSERT_TRUE(r);
   const PlugInSet set(records);
   // rules | flags | old host | plug-ins found
@@ -285,7 +260,7 @@ TEST_F(DiscoveryTest, WorkaroundBitAndChosenCandidates) {
     const uint64_t flags = std::stoul(row[1]);
     const bool old = row[2] == "1";
     SCOPED_TRACE(row[0] + " " + row[1] + " " + row[2]);
-    auto run = [&](const std::vector<DRDPlugInPtr>& examined, std::vector<std::string>& logged) {
+    auto run = [&](const std::vector<DRDPlugInPtr>& examined, Lines& logged) {
       DiscoveryServices services;
       services.log = [&](const std::string& line) { logged.push_back(line); };
       services.debug = services.log;
@@ -298,18 +273,16 @@ TEST_F(DiscoveryTest, WorkaroundBitAndChosenCandidates) {
       some.clear();
       for (uint32_t i : *chosen) some.push_back(records[i]);
     }
-    std::vector<std::string> allLogged, someLogged;
+    Lines allLogged, someLogged;
     auto all = run(records, allLogged);
     EXPECT_EQ(run(some, someLogged), all);
     EXPECT_EQ(someLogged, allLogged);
     EXPECT_EQ(all.first.size(), std::stoul(row[3]));
-    EXPECT_EQ((all.second & message::kDiscoverDuplicates) != 0,
-              old && !(flags & message::kDiscoverAll));
-    if (old && !(flags & message::kDiscoverAll)) {
-      ASSERT_FALSE(allLogged.empty());
-      EXPECT_NE(allLogged[0].find("found a 17732150 PlugIn: " + *records[0]->path()),
-                std::string::npos);
-    }
+    const bool bit = old && !(flags & message::kDiscoverAll);
+    EXPECT_EQ((all.second & message::kDiscoverDuplicates) != 0, bit);
+    EXPECT_EQ(!allLogged.empty() && allLogged[0].find("found a 17732150 PlugIn: " +
+                                                      *records[0]->path()) != std::string::npos,
+              bit);
   }
 }
 

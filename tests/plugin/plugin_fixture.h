@@ -8,15 +8,12 @@
 
 #include <algorithm>
 #include <map>
-#include <memory>
 #include <string>
 #include <vector>
 
-#include "core/value.h"
 #include "pdoc/pdoc.h"
 #include "platform/code_signing.h"
 #include "plugin/plugin.h"
-#include "registry/registry.h"
 #include "tests/support/fake_service_manager.h"
 #include "tests/support/fake_types.h"
 #include "tests/support/registry_bundles.h"
@@ -24,17 +21,15 @@
 namespace dr::test {
 
 using std::nullopt;
+using Lines = std::vector<std::string>;
 inline constexpr const char* kPoint = "com.example.point";
 
 // A value written as JSON (a scalar too).
-inline Value J(std::string_view json) {
-  return pdoc::Parse("[" + std::string(json) + "]").value().at(0);
-}
+inline Value J(std::string_view json) { return pdoc::Parse("[" + std::string(json) + "]")->at(0); }
 
-// A table as text: rows end at ';' (white space around a row is dropped),
-// cells at '|'.
-inline std::vector<std::vector<std::string>> Table(std::string_view text) {
-  std::vector<std::vector<std::string>> rows;
+// A table as text: rows end at ';' (white space around them is dropped), cells at '|'.
+inline std::vector<Lines> Table(std::string_view text) {
+  std::vector<Lines> rows;
   while (!text.empty()) {
     std::string_view row = text.substr(0, text.find(';'));
     text.remove_prefix(std::min(row.size() + 1, text.size()));
@@ -50,32 +45,29 @@ inline std::vector<std::vector<std::string>> Table(std::string_view text) {
 }
 
 // A host as the daemon's client connection presents it.
-class FakeClient : public PlugInClient {
- public:
-  explicit FakeClient(Value entitlements = Value()) : entitlements_(std::move(entitlements)) {}
+struct FakeClient : PlugInClient {
+  explicit FakeClient(Value e = Value()) : entitlements(std::move(e)) {}
   pid_t pid() const override { return 4242; }
-  Value entitlementValueForKey(std::string_view key) const override { return entitlements_[key]; }
-  bool hasEntitlement(std::string_view key) const override {
-    return IsEntitlementHeld(entitlements_[key]);
+  Value entitlementValueForKey(std::string_view k) const override { return entitlements[k]; }
+  bool hasEntitlement(std::string_view k) const override {
+    return IsEntitlementHeld(entitlements[k]);
   }
-
- private:
-  Value entitlements_;
+  Value entitlements;
 };
 
 // A sandboxed plug-in "com.example.<name>.ext" in the bundle
 // "com.example.<name>", version 2.0, executable "<name>"; `pd` entries are
 // added to its plug-in dictionary and `attrs` entries to its attributes.
-inline Value PlugInInfo(const std::string& name, const Value& pd = Value(),
-                        const Value& attrs = Value()) {
-  Value a =
-      Value(attrs.dictionary()).changing("UXExtensionIdentifier", "com.example." + name + ".ext");
+inline Value PlugInInfo(const std::string& name, const Value& pd = {}, const Value& attrs = {}) {
   Value p = Value(pd.dictionary()).changing("UXExtensionPointIdentifier", kPoint);
   if (!p.has("UXExtensionProtocol")) p = p.changing("UXExtensionProtocol", "Viewer");
   return Value{{"BNBundleIdentifier", "com.example." + name},
                {"BNBundleVersion", "2.0"},
                {"BNBundleExecutable", name},
-               {"UXExtension", p.changing("UXExtensionAttributes", a)}};
+               {"UXExtension", p.changing("UXExtensionAttributes",
+                                          Value(attrs.dictionary())
+                                              .changing("UXExtensionIdentifier",
+                                                        "com.example." + name + ".ext"))}};
 }
 
 inline Value Sandboxed() { return Value{{"com.corvel.security.app-sandbox", true}}; }
@@ -92,19 +84,17 @@ class PlugInFixture : public ::testing::Test {
     f.uuid = Uuid::random();
     f.url = path.empty() ? folder / ("p" + std::to_string(++bundles_) + "/A.plugin") : path;
     registry_test::MakeBundle(f.url, info, entitlements);
-    if (auto exe = info["BNBundleExecutable"].string()) {
-      std::string exePath = f.url + "/Contents/Exec/" + std::string(*exe);
-      registry_test::WriteBytes(exePath, "#!/bin/sh\n");
-      EXPECT_EQ(::chmod(exePath.c_str(), 0755), 0);
+    if (auto name = info["BNBundleExecutable"].string()) {
+      std::string exe = f.url + "/Contents/Exec/" + std::string(*name);
+      registry_test::WriteBytes(exe, "#!/bin/sh\n");
+      EXPECT_EQ(::chmod(exe.c_str(), 0755), 0);
     }
     f.plugInIdentifier =
         info["UXExtension"]["UXExtensionAttributes"]["UXExtensionIdentifier"].stringValue();
-    if (f.plugInIdentifier.empty()) f.plugInIdentifier = info["BNBundleIdentifier"].stringValue();
     std::optional<std::string> entBytes;
     if (entitlements.isPresent()) entBytes = pdoc::WriteXml(entitlements).value_or("");
-    auto files = std::make_shared<RegistryBundleFiles>(pdoc::WriteXml(info).value_or(""),
-                                                       std::move(entBytes));
-    return std::make_shared<RegistryEntry>(std::move(f), std::move(files));
+    return std::make_shared<RegistryEntry>(
+        std::move(f), std::make_shared<RegistryBundleFiles>(*pdoc::WriteXml(info), entBytes));
   }
 
   std::shared_ptr<DRDPlugIn> make(const Value& info, const Value& entitlements = Sandboxed(),
@@ -112,7 +102,6 @@ class PlugInFixture : public ::testing::Test {
     return DRDPlugIn::initWithRGData(entry(info, entitlements, std::move(f)), services());
   }
 
-  // Other plug-ins' versions come from `versions`, the database's stand-in.
   PlugInServices services() {
     PlugInServices s;
     s.serviceManager = manager ? manager : &serviceManager;
@@ -120,11 +109,8 @@ class PlugInFixture : public ::testing::Test {
       return testSdk && std::string_view(name) == "DRTEST_SDK" ? testSdk->c_str() : nullptr;
     };
     s.types = types;
-    if (!versions.empty())
-      s.plugInVersion = [this](const Uuid& uuid) -> std::optional<std::string> {
-        auto it = versions.find(uuid.string());
-        return it == versions.end() ? std::nullopt : it->second;
-      };
+    if (versions.empty()) return s;
+    s.plugInVersion = [this](const Uuid& uuid) { return versions[uuid.string()]; };
     return s;
   }
 
@@ -133,7 +119,7 @@ class PlugInFixture : public ::testing::Test {
   ServiceManager* manager = nullptr;   // instead of serviceManager
   FakeTypeService* types = nullptr;    // none: a type conforms only to itself
   std::optional<std::string> testSdk;  // the daemon's DRTEST_SDK
-  std::map<std::string, std::optional<std::string>> versions;
+  std::map<std::string, std::optional<std::string>> versions;  // other plug-ins', by UUID
 
  private:
   int bundles_ = 0;

@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <sstream>
 
 #include "core/format.h"
 #include "core/log.h"
@@ -19,47 +20,34 @@
 namespace dr::test {
 namespace {
 
-using Lines = std::vector<std::string>;
 using PlugInTest = PlugInFixture;
 
 // Sandboxed plug-ins only, unless data or Effecta ones; registration times
-// clamp into whole seconds; the hub protocol version defaults to 2, or 1 for
-// an old-style bundle.
+// clamp into whole seconds; the hub protocol version defaults to 2.
 TEST_F(PlugInTest, AdmitsSandboxedPlugInsAndTakesTheEntrysFields) {
-  const std::string unsandboxed = "Dromon error 12: plug-ins must be sandboxed";
-  const struct {
-    Value info;
-    const char* entitlements;  // "": no entitlements file
-    std::string refusal;       // the reason logged; "": admitted
-    double registered = 0;
-    int64_t lastModified = 0;
-    uint64_t hub = 2;
-  } rows[] = {
-      {PlugInInfo("a"), R"({"com.corvel.security.app-sandbox": "NO"})", "", 1.9, 1},
-      {PlugInInfo("a"), "", unsandboxed},
-      {PlugInInfo("a"), R"({"com.corvel.security.app-sandbox": 0.0})", unsandboxed},
-      {PlugInInfo("a", J(R"({"UXExtensionProtocol": "#Data", "HubProtocolVersion": 5})")), "", "",
-       -1.9, -1, 5},
-      {PlugInInfo("a", {}, J(R"({"UXExtensionPointName": "Effecta"})")), "", "", 1e300, INT64_MAX},
-      {PlugInInfo("a", J(R"({"UXExtensionPointName": "Effecta"})")), "", unsandboxed},
-      {J(R"({"Dromon": {"SDK": "com.example.point", "Protocol": "P", "Attributes": {}},
-            "BNBundleIdentifier": "com.example.old"})"),
-       R"({"com.corvel.security.app-sandbox": 1})", "", 1700000000.99, 1700000000, 1},
-      {J(R"({"UXExtension": {"UXExtensionAttributes": {"UXExtensionIdentifier": "a"}}})"), "{}",
-       "Dromon error 12: missing \"UXExtensionProtocol\" key in Info.pdoc or SDK"}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.info.description() + " " + row.entitlements);
+  // plug-in dictionary | attributes | entitlements ("": none) | registered | what it must be or
+  // the last modified time and hub protocol version
+  const char* rows = R"({}|{}|{"com.corvel.security.app-sandbox": "NO"}|1.9|1 2; {}|{}||0|sandboxed;
+      {}|{}|{"com.corvel.security.app-sandbox": 0.0}|0|sandboxed;
+      {"UXExtensionProtocol": "#Data", "HubProtocolVersion": 5}|{}||-1.9|-1 5;
+      {}|{"UXExtensionPointName": "Effecta"}||1e300|9223372036854775807 2;
+      {"UXExtensionPointName": "Effecta"}|{}||0|sandboxed)";
+  for (const auto& r : Table(rows)) {
+    SCOPED_TRACE(r[0] + " " + r[1] + " " + r[2]);
     ScopedLogCapture log;
     RegistryEntry::Fields f;
-    f.registrationDate = Date{row.registered};
-    RegistryEntryPtr e = entry(row.info, *row.entitlements ? J(row.entitlements) : Value(), f);
+    f.registrationDate = Date{std::stod(r[3])};
+    RegistryEntryPtr e =
+        entry(PlugInInfo("a", J(r[0]), J(r[1])), r[2].empty() ? Value() : J(r[2]), f);
     auto plugIn = DRDPlugIn::initWithRGData(e, services());
-    EXPECT_EQ(log.lines(), row.refusal.empty() ? Lines{}
-                                               : Lines{"ignoring mis-configured plug-in at " +
-                                                       e->url() + ": " + row.refusal});
-    if (!plugIn) continue;
-    EXPECT_EQ(plugIn->hubProtocolVersion(), row.hub);
-    EXPECT_EQ(plugIn->lastModified(), row.lastModified);
+    if (!plugIn) {
+      EXPECT_EQ(log.lines(), Lines{"ignoring mis-configured plug-in at " + e->url() +
+                                   ": Dromon error 12: plug-ins must be " + r[4]});
+      continue;
+    }
+    EXPECT_EQ(
+        std::to_string(plugIn->lastModified()) + " " + std::to_string(plugIn->hubProtocolVersion()),
+        r[4]);
   }
   // An entry without a path or a readable information dictionary: nothing, silently.
   ScopedLogCapture log;
@@ -68,7 +56,7 @@ TEST_F(PlugInTest, AdmitsSandboxedPlugInsAndTakesTheEntrysFields) {
   auto files = std::make_shared<RegistryBundleFiles>(*pdoc::WriteXml(PlugInInfo("a")), nullopt);
   EXPECT_FALSE(DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services()));
   f.url = folder.path();
-  files = std::make_shared<RegistryBundleFiles>("<pdoc><dict><key>", std::nullopt);
+  files = std::make_shared<RegistryBundleFiles>("<pdoc><dict><key>", nullopt);
   EXPECT_FALSE(DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services()));
   EXPECT_TRUE(log.lines().empty());
 }
@@ -80,75 +68,57 @@ TEST_F(PlugInTest, FormGetsOneTokenPerDeclaredResource) {
   SandboxOptions options{.keyPath = folder / "keys/sandbox.key"};
   testing::FakeCodeSigning signing;
   std::unique_ptr<Sandbox> sandbox = MakeLinuxSandbox(options, &signing);
-  const struct {
-    const char* shared;   // "": no "Shared"
-    std::string granted;  // "name=path" relative to the bundle, for each token
-    const char* failed;   // the resource a failure is logged for, and why
-  } rows[] = {{"", "", nullptr},
-              {R"(".")", ".=.", nullptr},
-              {R"(["Resources/a", 7, "Resources/nested/b"])",
-               "Resources/a=Resources/a Resources/nested/b=Resources/nested/b", nullptr},
-              {R"({"Resources/a": true})", "Resources/a=Resources/a", nullptr},
-              {"42", "", nullptr},
-              {R"(["missing"])", "", "/missing in plug-in at @: No such file or directory"},
-              {R"("../outside")", "", "/../outside in plug-in at @: Permission denied"},
-              {R"("Resources/escape")", "", "/Resources/escape in plug-in at @: Permission denied"},
-              {R"("Resources/alias")", "Resources/alias=Resources/nested/b", nullptr}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.shared);
-    Value pd = *row.shared ? Value{{"Shared", J(row.shared)}} : Value();
+  // "Shared" ("": none) | "name=path" relative to the bundle for each token | the failure logged
+  const char* rows =
+      R"(||; "."|.=.|; {"r/a": true}|r/a=r/a|; 42||; ["r/a", 7, "r/n/b"]|r/a=r/a r/n/b=r/n/b|;
+      ["missing"]||/missing in plug-in at @: No such file or directory;
+      "../outside"||/../outside in plug-in at @: Permission denied;
+      "r/escape"||/r/escape in plug-in at @: Permission denied; "r/alias"|r/alias=r/n/b|)";
+  for (const auto& r : Table(rows)) {
+    SCOPED_TRACE(r[0]);
     PlugInServices s = services();
     s.sandbox = sandbox.get();
+    Value pd = r[0].empty() ? Value() : Value{{"Shared", J(r[0])}};
     auto plugIn = DRDPlugIn::initWithRGData(entry(PlugInInfo("a", pd), Sandboxed()), s);
-    ASSERT_TRUE(plugIn);
     std::string bundle = *plugIn->url();
-    registry_test::WriteBytes(bundle + "/Resources/a", "a");
-    registry_test::WriteBytes(bundle + "/Resources/nested/b", "b");
+    registry_test::WriteBytes(bundle + "/r/a", "a");
+    registry_test::WriteBytes(bundle + "/r/n/b", "b");
     registry_test::WriteBytes(bundle + "/../outside", "o");
-    std::filesystem::create_symlink("../../outside", bundle + "/Resources/escape");
-    std::filesystem::create_symlink("nested/b", bundle + "/Resources/alias");
+    std::filesystem::create_symlink("../../outside", bundle + "/r/escape");
+    std::filesystem::create_symlink("n/b", bundle + "/r/alias");
     ScopedLogCapture log;
     Dictionary form{{"identifier", Value("kept")}};
     plugIn->augmentForm(form);
-    EXPECT_EQ(form.size(), *row.shared ? 2u : 1u);
+    EXPECT_EQ(form.size(), r[0].empty() ? 1u : 2u);
     std::string granted;
     for (const auto& [name, token] : form["extensions"].dictionary()) {
       std::string path = consumeExtension(token.stringValue(), options).value_or("(refused)");
       if (path.starts_with(bundle)) path = path == bundle ? "." : path.substr(bundle.size() + 1);
       granted += (granted.empty() ? "" : " ") + name.str() + "=" + path;
     }
-    EXPECT_EQ(granted, row.granted);
-    std::string failure = row.failed ? "failed to make extension for " + bundle + row.failed : "";
-    if (row.failed) failure.replace(failure.find('@'), 1, bundle);
-    ASSERT_EQ(log.lines().size(), row.failed ? 1u : 0u);
-    EXPECT_TRUE(!row.failed || log.lines()[0].starts_with(failure)) << log.lines()[0];
+    EXPECT_EQ(granted, r[1]);
+    std::string failure = r[2];
+    if (!failure.empty()) failure = "failed to make extension for " + bundle + failure;
+    if (size_t at = failure.find('@'); at != std::string::npos) failure.replace(at, 1, bundle);
+    EXPECT_EQ(log.lines(), failure.empty() ? Lines{} : Lines{failure});
   }
 }
 
 // The host's restriction is checked before the plug-in's demand; a demand
 // that is no string demands nothing; any value but false holds it.
 TEST_F(PlugInTest, HostRestrictionAndDemandedEntitlement) {
-  const std::string invalid = "invalid host restriction entitlement";
-  const std::string outside = "the host's plug-in entitlement does not allow this plug-in";
-  const char* allowed = R"({"com.corvel.developer.dromon.allowedplugins": )";
-  const struct {
-    std::string host, demand;  // the host's entitlements, the plug-in's demand ("": none)
-    std::string refusal;       // "": allowed
-  } rows[] = {{"{}", "", ""},
-              {std::string(allowed) + "[]}", "", invalid},
-              {std::string(allowed) + "{}}", "", ""},
-              {std::string(allowed) + R"({"UXExtensionIdentifier": "com.example.a.ext"}})", "", ""},
-              {std::string(allowed) + R"({"UXExtensionIdentifier": "com.example.b.ext"}})",
-               R"("x")", outside},
-              {R"({"x": false})", R"("x")", "the host does not have the \"x\" entitlement"},
-              {R"({"x": "NO"})", R"("x")", ""},
-              {"{}", R"(["x"])", ""}};
-  for (const auto& row : rows) {
-    Value pd = row.demand.empty() ? Value() : Value{{"UXExtensionHostEntitlement", J(row.demand)}};
-    auto plugIn = make(PlugInInfo("a", pd));
-    ASSERT_TRUE(plugIn);
-    EXPECT_EQ(plugIn->allowForClient(FakeClient(J(row.host))).value_or(""), row.refusal)
-        << row.host << " " << row.demand;
+  const std::string restriction = "com.corvel.developer.dromon.allowedplugins";
+  // the host's restriction ("": none) or entitlements | the plug-in's demand | the refusal
+  const char* rows = R"(||; []||invalid host restriction entitlement; {}||;
+      {"UXExtensionIdentifier": "com.example.a.ext"}||;
+      {"UXExtensionIdentifier": "com.example.b.ext"}|"x"|the host's plug-in entitlement does not allow this plug-in;
+      {"x": false}|"x"|the host does not have the "x" entitlement; {"x": "NO"}|"x"|; |["x"]|)";
+  for (const auto& r : Table(rows)) {
+    Value host = r[0].empty() ? J("{}") : J(r[0]);
+    if (!r[0].empty() && !host.has("x")) host = Value{{restriction, host}};
+    Value pd = r[1].empty() ? Value() : Value{{"UXExtensionHostEntitlement", J(r[1])}};
+    EXPECT_EQ(make(PlugInInfo("a", pd))->allowForClient(FakeClient(host)).value_or(""), r[2])
+        << r[0] << " " << r[1];
   }
 }
 
@@ -161,24 +131,21 @@ TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
   ScopedEnv sdkPath{"DR_SDK_PATH", folder / "sdks"};
   std::unique_ptr<ServiceManager> real = NewServiceManager({});
   manager = real.get();
-  const struct {
-    std::optional<std::string> testSdk;
-    const char *ipcService, *expected;  // the bundle's "IPCService" ("": none); the overlay's
-  } rows[] = {{nullopt, "", "{}"},
-              {"/sdk", R"({"EnvironmentVariables": {"DRTEST_SDK": "/own", "A": "1"}, "Other": 5})",
-               R"({"EnvironmentVariables": {"DRTEST_SDK": "/own", "A": "1"}, "Other": 5})"},
-              {"/sdk", R"("junk")", R"({"EnvironmentVariables": {"DRTEST_SDK": "/sdk"}})"},
-              {"/sdk", R"({"EnvironmentVariables": "junk"})",
-               R"({"EnvironmentVariables": {"DRTEST_SDK": "/sdk"}})"},
-              {nullopt, R"({"EnvironmentVariables": {"A": 1, "B": "b", "C": []}})",
-               R"({"EnvironmentVariables": {"B": "b"}})"}};
+  // DRTEST_SDK ("": none) | the bundle's "IPCService" ("": none) | its variables in the overlay
+  const char* rows =
+      R"(||{}; /sdk|{"EnvironmentVariables": {"DRTEST_SDK": "/own", "A": "1"}, "Other": 5}|
+        {"DRTEST_SDK": "/own", "A": "1"}; /sdk|"junk"|{"DRTEST_SDK": "/sdk"};
+      /sdk|{"EnvironmentVariables": "junk"}|{"DRTEST_SDK": "/sdk"};
+      |{"EnvironmentVariables": {"A": 1, "B": "b", "C": []}}|{"B": "b"})";
   size_t n = 0;
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.ipcService);
-    testSdk = row.testSdk;
-    auto plugIn = make(*row.ipcService ? PlugInInfo("a").changing("IPCService", J(row.ipcService))
-                                       : PlugInInfo("a"));
-    ASSERT_TRUE(plugIn);
+  for (const auto& r : Table(rows)) {
+    SCOPED_TRACE(r[1]);
+    if (r[0].empty())
+      testSdk.reset();
+    else
+      testSdk = r[0];
+    Value service = r[1].empty() ? Value() : J(r[1]);
+    auto plugIn = make(PlugInInfo("a").changing("IPCService", service));
     ScopedLogCapture log;
     pid_t pid = ::getpid();  // grants to processes that are gone are dropped
     EXPECT_TRUE(plugIn->enableForPid(pid).ok());
@@ -188,9 +155,8 @@ TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
     ASSERT_EQ(grants.size(), ++n);
     EXPECT_EQ(grants.back().hostPid, pid);
     EXPECT_EQ(grants.back().executablePath, *plugIn->url() + "/Contents/Exec/a");
-    Value expected = J(row.expected);
-    if (!expected.has("EnvironmentVariables"))
-      expected = expected.changing("EnvironmentVariables", J("{}"));
+    Value expected = service.isDictionary() ? service : J("{}");
+    expected = expected.changing("EnvironmentVariables", J(r[2]));
     EXPECT_EQ(grants.back().overlay,
               (Value{{"IPCService", expected}, {"BNBundlePackageType", "IPC!"}}));
   }
@@ -203,9 +169,9 @@ TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
   ScopedLogCapture log;
   EXPECT_EQ(plugIn->enableForPid(77).description(),
             Error("Dromon", 4, "unable to enable plug-in " + id + " for pid 77").description());
-  ASSERT_EQ(log.lines().size(), 2u);
-  EXPECT_EQ(log.lines()[1], "ipc error 13 allowing pid 77 to use plug-in com.example.a.ext(2.0) " +
-                                plugIn->uuid()->string() + " at " + path);
+  EXPECT_EQ(log.lines().at(1),
+            "ipc error 13 allowing pid 77 to use plug-in com.example.a.ext(2.0) " +
+                plugIn->uuid()->string() + " at " + path);
   std::filesystem::remove_all(path);
   log.clear();
   EXPECT_EQ(plugIn->enableForPid(77).description(),
@@ -217,38 +183,36 @@ TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
 // Instances of other versions are skipped; one without a version or a
 // record counts; an incomplete one is skipped with a log line.
 TEST_F(PlugInTest, CheckBusyFindsTheFirstInstanceOfThisVersion) {
+  std::map<std::string, Uuid> ids{{"v1", Uuid::random()},
+                                  {"v200", Uuid::random()},
+                                  {"none", Uuid::random()},
+                                  {"unknown", Uuid::random()}};
+  versions = {
+      {ids["v1"].string(), "1.0"}, {ids["v200"].string(), "2.00"}, {ids["none"].string(), nullopt}};
   auto plugIn = make(PlugInInfo("a"));
-  const Uuid self = *plugIn->uuid(), v1 = Uuid::random(), v200 = Uuid::random(),
-             none = Uuid::random(), unknown = Uuid::random();
-  versions = {{v1.string(), "1.0"}, {v200.string(), "2.00"}, {none.string(), nullopt}};
-  plugIn = DRDPlugIn::initWithRGData(plugIn->rgproxy(), services());
-  auto at = [&](pid_t pid, Uuid as, std::optional<std::string> path = "/b/A.plugin") {
-    return BusyExtensionInstance{pid, std::move(path), "com.example.a", as};
-  };
-  const struct {
-    std::vector<BusyExtensionInstance> instances;
-    std::string busy;  // "pid version"; "": none; "!": the query fails
-    const char* line;
-  } rows[] = {{{}, "", nullptr},
-              {{at(1, v1), at(2, self)}, "2 2.0", nullptr},
-              {{at(1, v1), at(2, v200)}, "", nullptr},
-              {{at(3, none)}, "3 -", nullptr},
-              {{at(3, unknown)}, "3 -", nullptr},
-              {{at(4, self, nullopt), at(5, self)},
-               "5 2.0",
-               "ipc reported incomplete bundle \"com.example.a\" for plug-in com.example.a.ext"},
-              {{at(6, self)}, "!", "ipc failed to report dirty state for \"com.example.a\""}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.busy);
-    serviceManager.instances = row.instances;
+  ids["self"] = *plugIn->uuid();
+  // instances (pid:plug-in, "-": no path) | the busy one's "pid version" ("!": the query fails)
+  const char* rows = R"(||; 1:v1 2:self|2 2.0|; 1:v1 2:v200||; 3:none|3 -|; 3:unknown|3 -|;
+      4:-self 5:self|5 2.0|ipc reported incomplete bundle "com.example.a" for plug-in com.example.a.ext;
+      6:self|!|ipc failed to report dirty state for "com.example.a")";
+  for (const auto& r : Table(rows)) {
+    SCOPED_TRACE(r[0]);
+    serviceManager.instances.clear();
+    std::istringstream in(r[0]);
+    for (std::string i; in >> i;) {
+      std::string who = i.substr(i.find(':') + 1);
+      std::optional<std::string> path = "/b/A.plugin";
+      if (who[0] == '-') path = nullopt, who.erase(0, 1);
+      serviceManager.instances.push_back({std::stoi(i), path, "com.example.a", ids[who]});
+    }
     serviceManager.busyError.reset();
-    if (row.busy == "!") serviceManager.busyError = PosixError(EIO, "proc");
+    if (r[1] == "!") serviceManager.busyError = PosixError(EIO, "proc");
     serviceManager.busyQueries.clear();
     ScopedLogCapture log;
     std::optional<BusyInstance> busy = plugIn->checkBusy();
     EXPECT_EQ(busy ? std::to_string(busy->pid) + " " + busy->version.value_or("-") : "",
-              row.busy == "!" ? "" : row.busy);
-    EXPECT_EQ(log.lines(), row.line ? Lines{row.line} : Lines{});
+              r[1] == "!" ? "" : r[1]);
+    EXPECT_EQ(log.lines(), r[2].empty() ? Lines{} : Lines{r[2]});
     EXPECT_EQ(serviceManager.busyQueries, std::vector<Lines>{{"com.example.a"}});
   }
   // Without a bundle identifier nothing can be asked.
