@@ -132,7 +132,7 @@ Value Envelope(const char* request) {
 // One request that must succeed.
 Value Ask(Connection& c, const Value& message, const std::string& what) {
   dr::Result<Value> reply = c.request(message, kRequestTimeout);
-  if (!reply) Die(what + ": " + reply.error().description());
+  if (!reply.ok()) Die(what + ": " + reply.error().description());
   if (reply->has("errorcode")) {
     Die(what + ": drd answered error " + std::to_string((*reply)["errorcode"].intValue()) + " \"" +
         (*reply)["error"].stringValue() + "\"");
@@ -143,13 +143,13 @@ Value Ask(Connection& c, const Value& message, const std::string& what) {
 std::unique_ptr<Connection> Open(const std::string& folder,
                                  const std::string& name = kServiceName) {
   auto c = Connection::Open(name, folder);
-  if (!c) Die("cannot connect to " + folder + "/" + name + ": " + c.error().description());
+  if (!c.ok()) Die("cannot connect to " + folder + "/" + name + ": " + c.error().description());
   return std::move(c).value();
 }
 
 size_t FrameSize(const Value& body) {
   auto frame = dr::drm1::EncodeFrame(1, 0, dr::drm1::kFlagWantsReply, body);
-  if (!frame) Die("cannot encode a frame");
+  if (!frame.ok()) Die("cannot encode a frame");
   return frame->size();
 }
 
@@ -290,14 +290,14 @@ Figures Compare(const Drd& drd, const std::function<void()>& drdOnce, EchoServer
 
 std::string RequestFrame(const Value& request) {
   auto frame = dr::drm1::EncodeFrame(1, 0, dr::drm1::kFlagWantsReply, request);
-  if (!frame) Die("cannot encode a request");
+  if (!frame.ok()) Die("cannot encode a request");
   return std::move(frame).value();
 }
 
 // A reply body that must decode to a dictionary without "errorcode".
 Value DecodeReply(std::string_view body, const std::string& what) {
   auto reply = dr::drm1::DecodeBody(body);
-  if (!reply) Die(what + ": a reply that does not decode: " + reply.error().description());
+  if (!reply.ok()) Die(what + ": a reply that does not decode: " + reply.error().description());
   if (reply->has("errorcode")) {
     Die(what + ": drd answered error " + std::to_string((*reply)["errorcode"].intValue()) + " \"" +
         (*reply)["error"].stringValue() + "\"");
@@ -343,7 +343,7 @@ void FirstReply(Drd& d, Clock::time_point started, const Value& request,
   std::unique_ptr<Connection> conn;
   while (!conn) {
     auto attempt = Connection::Open(kServiceName, d.socketFolder());
-    if (attempt) {
+    if (attempt.ok()) {
       conn = std::move(attempt).value();
     } else {
       std::this_thread::sleep_for(std::chrono::microseconds(200));
@@ -452,7 +452,8 @@ void MixedClient(const std::string& socketFolder, const Targets& t, int points, 
     Clock::time_point t0 = Clock::now();
     dr::Result<Value> reply = c->request(request, kRequestTimeout);
     out->add(Micros(t0, Clock::now()));
-    if (!reply) Die("W7: client " + std::to_string(client) + ": " + reply.error().description());
+    if (!reply.ok())
+      Die("W7: client " + std::to_string(client) + ": " + reply.error().description());
     if (reply->has("errorcode") && !mayBeRefused) {
       Die("W7: client " + std::to_string(client) + ": \"" + request["request"].stringValue() +
           "\" answered error " + std::to_string((*reply)["errorcode"].intValue()) + " \"" +
@@ -1129,7 +1130,7 @@ int Main(int argc, char** argv) {
     std::string answered;
     {
       auto reply = dr::drm1::DecodeBody(listing);
-      if (!reply) Die("W8: a listing that does not decode: " + reply.error().description());
+      if (!reply.ok()) Die("W8: a listing that does not decode: " + reply.error().description());
       if (reply->has("errorcode")) {
         answered = "error " + std::to_string((*reply)["errorcode"].intValue()) + " \"" +
                    (*reply)["error"].stringValue() + "\"";

@@ -65,7 +65,7 @@ void WriteFile(const std::string& path, const std::string& bytes) {
 
 void WritePdoc(const std::string& path, const Value& value) {
   dr::Result<std::string> xml = dr::pdoc::WriteXml(value);
-  if (!xml) Die("cannot encode " + path);
+  if (!xml.ok()) Die("cannot encode " + path);
   WriteFile(path, *xml);
 }
 

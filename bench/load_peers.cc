@@ -127,7 +127,7 @@ void EchoServer::run() {
     peer.decoder.feed(bytes);
     for (;;) {
       auto frame = peer.decoder.next();
-      if (!frame || !frame->has_value()) break;
+      if (!frame.ok() || !frame->has_value()) break;
       dr::Value reply;
       {
         std::lock_guard<std::mutex> lock(mu_);
@@ -136,7 +136,7 @@ void EchoServer::run() {
       auto encoded = dr::drm1::EncodeFrame(peer.serial++, (**frame).header.serial,
                                            dr::drm1::kFlagIsReply, reply);
       size_t sent = 0;
-      while (encoded && sent < encoded->size()) {
+      while (encoded.ok() && sent < encoded->size()) {
         ssize_t w = ::send(fd, encoded->data() + sent, encoded->size() - sent, MSG_NOSIGNAL);
         if (w <= 0) break;
         sent += static_cast<size_t>(w);
@@ -199,7 +199,7 @@ void CannedServer::run() {
     while (peer.in.size() - at >= dr::drm1::kHeaderSize) {
       const std::string_view rest = std::string_view(peer.in).substr(at);
       auto header = dr::drm1::DecodeHeader(rest);
-      if (!header) Die("canned floor: " + header.error().description());
+      if (!header.ok()) Die("canned floor: " + header.error().description());
       if (rest.size() < dr::drm1::kHeaderSize + header->bodyLength) break;
       const std::string_view body = rest.substr(dr::drm1::kHeaderSize, header->bodyLength);
       std::lock_guard<std::mutex> lock(mu_);
@@ -261,7 +261,7 @@ const std::string& RawClient::exchange(const std::string& frame) {
     readExactly(head, sizeof head);
     auto header =
         dr::drm1::DecodeHeader(std::string_view(head, sizeof head), dr::drm1::kFromDaemon);
-    if (!header) Die("a raw reply: " + header.error().description());
+    if (!header.ok()) Die("a raw reply: " + header.error().description());
     body_.resize(header->bodyLength);
     readExactly(body_.data(), body_.size());
     // Anything but the reply to this request (a notification) is passed over.
@@ -303,8 +303,9 @@ dr::Value DecodeFrame(const void* data, size_t size) {
   std::string_view bytes(static_cast<const char*>(data), size);
   if (bytes.size() < dr::drm1::kHeaderSize) Die("D-Bus echo: short frame");
   auto header = dr::drm1::DecodeHeader(bytes);
-  auto body = header ? dr::drm1::DecodeBody(bytes.substr(dr::drm1::kHeaderSize)) : header.error();
-  if (!body) Die("D-Bus echo: bad frame");
+  auto body =
+      header.ok() ? dr::drm1::DecodeBody(bytes.substr(dr::drm1::kHeaderSize)) : header.error();
+  if (!body.ok()) Die("D-Bus echo: bad frame");
   return std::move(body).value();
 }
 
@@ -324,7 +325,7 @@ int DbusPeer::OnEcho(void* message, void* userdata) {
     reply = self->reply_;
   }
   auto bytes = dr::drm1::EncodeFrame(1, 1, dr::drm1::kFlagIsReply, reply);
-  if (!bytes) Die("D-Bus echo: cannot encode the reply");
+  if (!bytes.ok()) Die("D-Bus echo: cannot encode the reply");
   sd_bus_message* out = nullptr;
   r = sd_bus_message_new_method_return(m, &out);
   if (r >= 0) r = sd_bus_message_append_array(out, 'y', bytes->data(), bytes->size());
@@ -409,7 +410,7 @@ DbusPeer::Client::~Client() { sd_bus_flush_close_unref(static_cast<sd_bus*>(bus_
 
 dr::Value DbusPeer::Client::call(const dr::Value& request) {
   auto bytes = dr::drm1::EncodeFrame(serial_++, 0, dr::drm1::kFlagWantsReply, request);
-  if (!bytes) Die("D-Bus echo: cannot encode the request");
+  if (!bytes.ok()) Die("D-Bus echo: cannot encode the request");
   sd_bus* bus = static_cast<sd_bus*>(bus_);
   sd_bus_message* m = nullptr;
   sd_bus_message* reply = nullptr;

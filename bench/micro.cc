@@ -231,8 +231,8 @@ std::optional<dr::drm1::Frame> DecodeInPieces(dr::drm1::FrameDecoder& decoder, s
   for (size_t at = 0; at < frame.size() && !got; at += 65536) {
     decoder.feed(std::string_view(frame).substr(at, 65536));
     auto next = decoder.next();
-    if (!next) state.SkipWithError("decode failed");
-    if (next && next->has_value()) got = std::move(**next);
+    if (!next.ok()) state.SkipWithError("decode failed");
+    if (next.ok() && next->has_value()) got = std::move(**next);
   }
   return got;
 }
@@ -335,7 +335,7 @@ void BM_Drm1DecodeKeyOrder(benchmark::State& state, bool descending) {
   const std::string body = KeyOrderBody(static_cast<int>(state.range(0)), descending);
   for (auto _ : state) {
     auto value = dr::drm1::DecodeBody(body);
-    if (!value || value->size() != static_cast<size_t>(state.range(0)))
+    if (!value.ok() || value->size() != static_cast<size_t>(state.range(0)))
       state.SkipWithError("decode failed");
     benchmark::DoNotOptimize(value);
   }
@@ -370,7 +370,7 @@ std::string JsonInfo() {
 void BM_PdocParse(benchmark::State& state, std::string bytes) {
   for (auto _ : state) {
     auto value = dr::pdoc::Parse(bytes);
-    if (!value) state.SkipWithError("parse failed");
+    if (!value.ok()) state.SkipWithError("parse failed");
     benchmark::DoNotOptimize(value);
   }
   state.SetBytesProcessed(state.iterations() * static_cast<int64_t>(bytes.size()));

@@ -104,8 +104,8 @@ class Result {
   Result(const Status& s) : v_(std::in_place_index<1>, s.error()) {}
 
   bool has_value() const { return v_.index() == 0; }
+  // Tested as `result.ok()`, as a Status is: no conversion to bool.
   bool ok() const { return has_value(); }
-  explicit operator bool() const { return has_value(); }
 
   // REQUIRES: has_value().
   T& value() & {

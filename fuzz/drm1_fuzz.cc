@@ -65,12 +65,12 @@ Outcome DecodeStream(std::string_view in, size_t step) {
     fed += n;
     for (;;) {
       Result<std::optional<drm1::Frame>> next = decoder.next();
-      if (!next) {
+      if (!next.ok()) {
         out.error = next.error();
         Result<std::optional<drm1::Frame>> after = decoder.next();
-        DRD_FUZZ_CHECK(
-            !after && after.error().localizedDescription() == out.error->localizedDescription(),
-            "the decoder recovered from an error");
+        DRD_FUZZ_CHECK(!after.ok() && after.error().localizedDescription() ==
+                                          out.error->localizedDescription(),
+                       "the decoder recovered from an error");
         break;
       }
       if (!*next) break;

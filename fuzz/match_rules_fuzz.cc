@@ -198,12 +198,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (inApp) fs.files[g_root + "/Host.app/Contents/Info.pdoc"] = std::string(info);
   Result<registry_internal::ScannedBundle> bundle =
       registry_internal::ScanBundle(url, {onSystem ? g_root : "/usr"}, &fs);
-  if (!bundle) return 0;
+  if (!bundle.ok()) return 0;
 
   InputServiceManager serviceManager;
   if (!sdk.empty()) {
     Result<Value> parsed = pdoc::Parse(sdk);
-    serviceManager.sdk = parsed ? Result<Value>(*parsed) : Result<Value>(parsed.error());
+    serviceManager.sdk = parsed.ok() ? Result<Value>(*parsed) : Result<Value>(parsed.error());
   }
   PlugInServices services;
   services.serviceManager = &serviceManager;

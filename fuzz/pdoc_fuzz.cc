@@ -34,7 +34,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
                                               : value.error().localizedDescription() ==
                                                     again.error().localizedDescription()),
       "the same bytes read differently the second time");
-  if (!value) {
+  if (!value.ok()) {
     const Error& e = value.error();
     DRD_FUZZ_CHECK(e.domain() == kPdocErrorDomain && e.code() == pdoc::kMalformed,
                    "a parse error outside the pdoc domain");
@@ -44,7 +44,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   DRD_FUZZ_CHECK(value->isPresent(), "a parse answered an absent value");
 
   Result<std::string> xml = pdoc::WriteXml(*value);
-  if (!xml) {
+  if (!xml.ok()) {
     // JSON may carry text XML cannot ("\u0001"); what XML carried in, it
     // carries out.
     const size_t first = in.find_first_not_of(" \t\r\n\xEF\xBB\xBF");

@@ -91,7 +91,7 @@ TEST_F(ClientTest, CallsRelayDrdsErrorsAndRefuseRepliesMissingWhatWasPromised) {
 // closed fails every call after, and never hangs.
 TEST_F(ClientTest, ConnectionSkipsLateRepliesAndFailsOnceClosed) {
   auto opened = Connection::Open("com.example.client", sockets_);
-  ASSERT_TRUE(opened);
+  ASSERT_TRUE(opened.ok());
   Connection& c = **opened;
   std::atomic<int> wrong{0};
   auto echoed = [&c](const Value& v) { return c.request(v, 5s).value_or(Value()) == v; };
@@ -104,7 +104,8 @@ TEST_F(ClientTest, ConnectionSkipsLateRepliesAndFailsOnceClosed) {
   for (std::thread& thread : threads) thread.join();
   EXPECT_EQ(wrong, 0);
   for (const Value& unsendable : {Value(Array{Value(1)}), Value{{"s", std::string("\xC3\x28")}}})
-    EXPECT_FALSE(c.request(unsendable, 1s) || c.send(unsendable).ok()) << unsendable.description();
+    EXPECT_FALSE(c.request(unsendable, 1s).ok() || c.send(unsendable).ok())
+        << unsendable.description();
   for (const Value& late : {Value{{"do", "sleep"}, {"ms", 400}}, Value{{"do", "ignore"}}})
     EXPECT_EQ(CodeOf(c.request(late, 100ms).status()), Code(kClientErrorDomain, kTimeout));
   EXPECT_TRUE(echoed(Value{{"n", 2}}));
@@ -125,7 +126,7 @@ std::string Parse(const std::string& args) {
   std::istringstream in(args);
   for (std::string a; in >> a;) argv.push_back(a);
   Result<Invocation> inv = ParseCommandLine(argv);
-  if (!inv) return "! " + inv.error().localizedDescription();
+  if (!inv.ok()) return "! " + inv.error().localizedDescription();
   const Invocation& i = *inv;
   std::string out = i.verb + (i.service != kDefaultServiceName ? " S=" + i.service : "") +
                     (i.help ? " help" : "") + (i.version ? " version" : "") +
@@ -204,7 +205,7 @@ TEST(DrkitTest, ParsesCommandLinesAndJson) {
        {std::string("{"), std::string(R"([1, null])"),
         std::string(100, '[') + std::string(100, ']'), std::string(R"({"$data": "not base64!"})"),
         std::string(R"({"$date": "today"})"), std::string(R"({"$what": 1})")})
-    EXPECT_FALSE(FromJson(bad)) << bad;
+    EXPECT_FALSE(FromJson(bad).ok()) << bad;
   EXPECT_EQ(DescribeError(Error(kDaemonErrorDomain, 99, "new")), "new (drd error, code 99)");
 }
 

@@ -82,10 +82,10 @@ TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
                      "/registry/r.sqlite3)\n");
   Result<std::unique_ptr<client::Connection>> c =
       client::Connection::Open("com.corvel.dromon.drd", root_ / "sockets");
-  ASSERT_TRUE(c) << c.error().description();
+  ASSERT_TRUE(c.ok()) << c.error().description();
   ASSERT_TRUE((*c)->send(Request("frobnicate")).ok());
   Result<Value> reply = (*c)->request(Request("bulk"), 10s);
-  ASSERT_TRUE(reply) << reply.error().description();
+  ASSERT_TRUE(reply.ok()) << reply.error().description();
   EXPECT_EQ(ErrorText(*reply), "");
   ASSERT_TRUE(drd_->signal(SIGTERM));
   EXPECT_EQ(drd_->waitForExit(), 0);
@@ -94,11 +94,11 @@ TEST_F(DrdTest, LogsStartAndStopAndRemovesItsSocket) {
   EXPECT_NE(::access(socket.c_str(), F_OK), 0) << "the socket file is left behind";
   drd_.reset();
   reply = (*c)->request(Request("bulk"), 10s);
-  ASSERT_FALSE(reply);
+  ASSERT_FALSE(reply.ok());
   EXPECT_EQ(reply.error().domain(), client::kClientErrorDomain);
   EXPECT_EQ(reply.error().code(), client::kConnectionClosed) << reply.error().description();
   EXPECT_FALSE((*c)->isOpen());
-  EXPECT_FALSE(client::Connection::Open("com.corvel.dromon.drd", root_ / "sockets"));
+  EXPECT_FALSE(client::Connection::Open("com.corvel.dromon.drd", root_ / "sockets").ok());
 }
 
 // The last -S counts. Lines carry their priority only when JOURNAL_STREAM

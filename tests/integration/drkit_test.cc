@@ -211,7 +211,7 @@ TEST_F(DrkitTest, ExclusionsHidePlugInsAndKeepTheRestOfTheFile) {
   EXPECT_EQ(ok({"exclude", "list"}), "");
   EXPECT_EQ(ok({"match"}), "  com.example.a (1.0)\n  com.example.b (1.0)\n");
   Result<Value> stored = pdoc::ReadFile(w.prefsFile());
-  ASSERT_TRUE(stored) << stored.error().description();
+  ASSERT_TRUE(stored.ok()) << stored.error().description();
   EXPECT_EQ(*stored, (Value{{"other", "kept"}, {"exclusions", Value::EmptyArray()}}));
   for (const std::vector<std::string>& args :
        {std::vector<std::string>{"exclude", "remove", "1"},
@@ -304,7 +304,7 @@ TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
     const std::string out = ok(row.args);
     EXPECT_EQ(out.find('\n'), out.size() - 1) << "not one line: " << out;
     Result<Value> parsed = pdoc::Parse(out);
-    ASSERT_TRUE(parsed) << out;
+    ASSERT_TRUE(parsed.ok()) << out;
     Value at = *parsed;
     for (const std::string& step : row.path) {
       at = at.isArray() ? at.at(std::stoul(step)) : Value(at[step]);

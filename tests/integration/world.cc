@@ -98,7 +98,7 @@ HostApp::HostApp(const std::string& appPath, const std::string& drdSocket,
   if (child_->readLine() != "ready") return;
   Result<std::unique_ptr<client::Connection>> c =
       client::Connection::Open(kServiceName, relayFolder);
-  if (c) connection_ = std::move(*c);
+  if (c.ok()) connection_ = std::move(*c);
 }
 
 World::World() { std::filesystem::create_directories(root_ / "system"); }
@@ -140,7 +140,7 @@ bool World::kill9() {
 std::unique_ptr<client::Connection> World::connect() const {
   Result<std::unique_ptr<client::Connection>> c =
       client::Connection::Open(kServiceName, root_ / "sockets");
-  return c ? std::move(*c) : nullptr;
+  return c.ok() ? std::move(*c) : nullptr;
 }
 
 Value World::call(const Value& request, client::Connection* connection) const {
@@ -152,7 +152,7 @@ Value World::call(const Value& request, client::Connection* connection) const {
   const Value failed{{"errorcode", Value(uint64_t{99999})}};
   if (!connection) return failed;
   Result<Value> reply = connection->request(request, std::chrono::seconds(20));
-  return reply ? *reply : failed;
+  return reply.ok() ? *reply : failed;
 }
 
 std::string World::makeApp(const std::string& path, const std::string& id,

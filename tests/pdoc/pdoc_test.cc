@@ -42,7 +42,7 @@ TEST(PdocTest, WritesXmlThatReadsBackAsTheSameValue) {
   for (const Value& value : rows) {
     const std::string xml = WriteXml(value).value_or("(refused)");
     Result<Value> back = Parse(xml);
-    ASSERT_TRUE(back) << value.description() << ": " << xml;
+    ASSERT_TRUE(back.ok()) << value.description() << ": " << xml;
     EXPECT_TRUE(Identical(value, *back)) << xml << "read back as " << back->description();
   }
 }
@@ -72,11 +72,11 @@ TEST(PdocTest, ReadsBothForms) {
   };
   for (const auto& row : rows) {
     Result<Value> value = Parse(row.input);
-    EXPECT_TRUE(value && Identical(row.expected, *value)) << row.input;
+    EXPECT_TRUE(value.ok() && Identical(row.expected, *value)) << row.input;
   }
   // kMaxDepth levels are allowed in both forms.
-  EXPECT_TRUE(Parse(Nested("[", "]", kMaxDepth)));
-  EXPECT_TRUE(Parse(InPdoc(Nested("<array>", "</array>", kMaxDepth))));
+  EXPECT_TRUE(Parse(Nested("[", "]", kMaxDepth)).ok());
+  EXPECT_TRUE(Parse(InPdoc(Nested("<array>", "</array>", kMaxDepth))).ok());
 }
 
 TEST(PdocTest, RefusesMalformedAndHostileInput) {
@@ -128,7 +128,7 @@ TEST(PdocTest, RefusesMalformedAndHostileInput) {
   for (const auto& [fragment, inputs] : rows) {
     for (const std::string& input : inputs) {
       Result<Value> value = Parse(input);
-      ASSERT_FALSE(value) << input.substr(0, 200) << " read as " << value->description();
+      ASSERT_FALSE(value.ok()) << input.substr(0, 200) << " read as " << value->description();
       EXPECT_TRUE(value.error().domain() == kPdocErrorDomain && value.error().code() == kMalformed);
       EXPECT_NE(value.error().localizedDescription().find(fragment), std::string::npos)
           << input.substr(0, 200) << ": " << value.error().description();
@@ -152,7 +152,7 @@ TEST(PdocTest, RefusesToWriteWhatPdocCannotHold) {
   };
   for (const auto& [value, fragment] : rows) {
     Result<std::string> xml = WriteXml(value);
-    ASSERT_FALSE(xml) << *xml;
+    ASSERT_FALSE(xml.ok()) << *xml;
     EXPECT_TRUE(xml.error().domain() == kPdocErrorDomain && xml.error().code() == kUnwritable);
     EXPECT_NE(xml.error().localizedDescription().find(fragment), std::string::npos)
         << xml.error().description();
@@ -203,8 +203,8 @@ TEST(PdocTest, WritesIndentedXmlAndEntriesAlone) {
   // What WriteXml refuses, an entry refuses too.
   Result<std::string> uuid = WriteXmlEntry("id", Value{{"u", Uuid::random()}}, 2);
   EXPECT_NE(uuid.error().localizedDescription().find("at /id/u: a UUID"), std::string::npos);
-  EXPECT_FALSE(WriteXmlEntry("k\xff", 1, 2));
-  EXPECT_FALSE(WriteXmlEntry("k", Value(), 2));
+  EXPECT_FALSE(WriteXmlEntry("k\xff", 1, 2).ok());
+  EXPECT_FALSE(WriteXmlEntry("k", Value(), 2).ok());
 }
 
 }  // namespace

@@ -250,7 +250,8 @@ TEST_F(RegistryTest, RegistrationAcknowledgedBeforeSigkillSurvives) {
   ASSERT_GE(child, 0);
   if (child == 0) {
     auto registry = Registry::Open(Options());
-    if (registry && (*registry)->registerBundle(path).ok() && write(fds[1], "y", 1) != 1) _exit(2);
+    if (registry.ok() && (*registry)->registerBundle(path).ok() && write(fds[1], "y", 1) != 1)
+      _exit(2);
     for (;;) pause();
   }
   close(fds[1]);

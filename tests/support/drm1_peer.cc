@@ -45,14 +45,14 @@ bool Drm1Peer::sendRaw(const std::string& bytes) {
 bool Drm1Peer::send(uint64_t serial, const Value& body, bool wantsReply) {
   Result<std::string> frame =
       drm1::EncodeFrame(serial, 0, wantsReply ? drm1::kFlagWantsReply : 0, body);
-  return frame && sendRaw(*frame);
+  return frame.ok() && sendRaw(*frame);
 }
 
 std::optional<drm1::Frame> Drm1Peer::receive(std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
   for (;;) {
     Result<std::optional<drm1::Frame>> frame = decoder_.next();
-    if (!frame) return std::nullopt;
+    if (!frame.ok()) return std::nullopt;
     if (frame->has_value()) return std::move(**frame);
     if (eof_) return std::nullopt;
     auto left = std::chrono::duration_cast<std::chrono::milliseconds>(

@@ -13,7 +13,7 @@ std::unique_ptr<Listener> StartStandInListener(const std::string& socketDirector
   options.serviceName = serviceName;
   options.useSocketActivation = false;
   Result<std::unique_ptr<Listener>> listener = Listener::Create(options, queue);
-  if (!listener) {
+  if (!listener.ok()) {
     ADD_FAILURE() << listener.error().description();
     return nullptr;
   }

@@ -38,7 +38,7 @@ Result<Value> DecodeWhole(const std::string& bytes, const Limits& limits = kToDa
   FrameDecoder decoder(limits);
   decoder.feed(bytes);
   Result<std::optional<drm1::Frame>> frame = decoder.next();
-  if (!frame || !*frame) return frame ? Error("test", 0, "incomplete") : frame.error();
+  if (!frame.ok() || !*frame) return frame.ok() ? Error("test", 0, "incomplete") : frame.error();
   return (*frame)->body;
 }
 
@@ -56,7 +56,7 @@ TEST(Drm1Test, EncodesFramesToTheByte) {
                          Tag(kTagString) + Str("é");
 
   Result<std::string> frame = EncodeFrame(7, 3, kFlagIsReply, body);
-  ASSERT_TRUE(frame) << frame.error().description();
+  ASSERT_TRUE(frame.ok()) << frame.error().description();
   EXPECT_EQ(*frame,
             HeaderBytes(static_cast<uint32_t>(expected.size()), 7, 3, kFlagIsReply) + expected);
 
@@ -121,18 +121,19 @@ TEST(Drm1Test, RefusesFramesThatBreakTheRules) {
   };
   for (const auto& row : rows) {
     Result<Value> v = DecodeWhole(row.bytes);
-    ASSERT_FALSE(v) << row.fragment;
+    ASSERT_FALSE(v.ok()) << row.fragment;
     EXPECT_TRUE(v.error().domain() == kDrm1ErrorDomain && v.error().code() == kProtocolError);
     EXPECT_NE(v.error().localizedDescription().find(row.fragment), std::string::npos)
         << v.error().localizedDescription();
   }
   // 64 levels of containers is the limit, the top dictionary being level 1.
-  EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Nested(kMaxDepth)))));
-  EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Arr(kMaxValues - 2, kTagTrue)))));
+  EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Nested(kMaxDepth)))).ok());
+  EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Arr(kMaxValues - 2, kTagTrue)))).ok());
   // Frames from the daemon may be larger and hold any number of values.
-  EXPECT_TRUE(DecodeHeader(HeaderBytes(kMaxReplyBodySize, 1, 1, kFlagIsReply), kFromDaemon));
-  EXPECT_FALSE(DecodeHeader(HeaderBytes(kMaxReplyBodySize + 1, 1, 1, kFlagIsReply), kFromDaemon));
-  EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Arr(kMaxValues))), kFromDaemon));
+  EXPECT_TRUE(DecodeHeader(HeaderBytes(kMaxReplyBodySize, 1, 1, kFlagIsReply), kFromDaemon).ok());
+  EXPECT_FALSE(
+      DecodeHeader(HeaderBytes(kMaxReplyBodySize + 1, 1, 1, kFlagIsReply), kFromDaemon).ok());
+  EXPECT_TRUE(DecodeWhole(Frame(OneEntry(Arr(kMaxValues))), kFromDaemon).ok());
 }
 
 TEST(Drm1Test, DecoderSplitsAStreamFedInPiecesAndStaysBrokenAfterAnError) {
@@ -143,7 +144,7 @@ TEST(Drm1Test, DecoderSplitsAStreamFedInPiecesAndStaysBrokenAfterAnError) {
   for (char c : stream) {
     decoder.feed(std::string_view(&c, 1));
     Result<std::optional<drm1::Frame>> f = decoder.next();
-    ASSERT_TRUE(f);
+    ASSERT_TRUE(f.ok());
     if (*f) {
       EXPECT_EQ((**f).body["n"].uintValue(), (**f).header.serial);
       serials.push_back((**f).header.serial);
@@ -154,10 +155,10 @@ TEST(Drm1Test, DecoderSplitsAStreamFedInPiecesAndStaysBrokenAfterAnError) {
   // A serial again is refused at its header, before its body is in; nothing after is read.
   decoder.feed(EncodeFrame(5, 0, 0, Value::EmptyDictionary())->substr(0, kHeaderSize));
   Result<std::optional<drm1::Frame>> again = decoder.next();
-  ASSERT_FALSE(again);
+  ASSERT_FALSE(again.ok());
   EXPECT_NE(again.error().localizedDescription().find("serial 5 not above"), std::string::npos);
   decoder.feed(*EncodeFrame(6, 0, 0, Value::EmptyDictionary()));
-  EXPECT_FALSE(decoder.next());
+  EXPECT_FALSE(decoder.next().ok());
 }
 
 // Text is read eight bytes at a time, so a NUL or a byte that is not UTF-8
@@ -187,11 +188,11 @@ TEST(Drm1Test, RefusesToEncodeWhatPeersWouldRefuse) {
   for (const auto& [body, refusal] : rows) {
     Result<std::string> f = EncodeFrame(1, 0, 0, body);
     if (!refusal) {
-      ASSERT_TRUE(f) << f.error().description();
+      ASSERT_TRUE(f.ok()) << f.error().description();
       EXPECT_EQ(DecodeWhole(*f).value_or(Value()), body);
       continue;
     }
-    ASSERT_FALSE(f) << body.description();
+    ASSERT_FALSE(f.ok()) << body.description();
     EXPECT_EQ(f.error().code(), kUnencodable);
     EXPECT_NE(f.error().description().find(refusal), std::string::npos) << f.error().description();
   }
@@ -206,9 +207,9 @@ TEST(Drm1Test, EncodesBodiesUpTo16MiB) {
       const Value body{{"k", std::string(size - 15, 'x')}};  // 15 bytes around the padding
       Result<std::string> f = EncodeFrame(1, flags ? 1 : 0, flags, body);
       ASSERT_EQ(f.ok(), size <= kMaxBodySize || flags) << size;
-      EXPECT_TRUE(f ? f->size() == kHeaderSize + size &&
-                          DecodeWhole(*f, kFromDaemon).value_or(Value()) == body
-                    : f.error().code() == kUnencodable);
+      EXPECT_TRUE(f.ok() ? f->size() == kHeaderSize + size &&
+                               DecodeWhole(*f, kFromDaemon).value_or(Value()) == body
+                         : f.error().code() == kUnencodable);
     }
   }
 }
