@@ -84,7 +84,7 @@ TEST_F(DiscoveryTest, DuplicatesOfOneIdentifier) {
     d.examine(a);
     d.examine(b);
     std::string returned;
-    const Value matches = d.finish();
+    const Value matches = d.finish().value();
     for (const Value& form : matches.array()) {
       returned +=
           (returned.empty() ? "" : "+") +
@@ -106,12 +106,10 @@ TEST_F(DiscoveryTest, ReplacementMarksSurviveAVeto) {
   DRDPlugInPtr self = copy("self", {"1", true, 1}, Value{{kReplace, "com.example.self.ext"}});
   DiscoveryServices services;
   // The replacer itself is vetoed; the replaced form still names it.
-  services.mayUse = [](const Value& form) {
-    return form["identifier"].stringValue() != "com.example.new.ext";
-  };
+  services.mayUse = [](std::string_view id) { return id != "com.example.new.ext"; };
   Discovery d = discovery(0, services);
   for (const DRDPlugInPtr& p : {old, replacer, self}) d.examine(p);
-  Value matches = d.finish();
+  Value matches = d.finish().value();
   ASSERT_EQ(matches.size(), 2u);
   EXPECT_EQ(matches.at(0)["overrider"].stringValue(), replacer->uuid()->string());
   EXPECT_FALSE(matches.at(0).has("overriding"));
@@ -197,7 +195,7 @@ TEST_F(DiscoveryTest, ExaminingTheChosenCandidatesAnswersAsExaminingAll) {
       h.needs17732150Workaround = row.workaround;
       Discovery d(h, row.rules, row.flags, Value(), services);
       for (const DRDPlugInPtr& p : examined) d.examine(p);
-      return std::make_pair(d.finish(), d.flags());
+      return std::make_pair(d.finish().value(), d.flags());
     };
     std::optional<std::vector<uint32_t>> chosen =
         CandidatesToExamine(set, row.rules, row.flags, row.workaround);
