@@ -23,9 +23,6 @@ constexpr WorkaroundHost kWorkaroundHosts[] = {
     {"com.corvel.OdelloApp", "10.2"},
 };
 
-constexpr const char* kAnnotationsFormKey = "annotations";
-constexpr const char* kOverriderFormKey = "overrider";
-constexpr const char* kOverridingFormKey = "overriding";
 constexpr const char* kReplaceEntitlement = "com.corvel.developer.replace-plugin";
 
 }  // namespace
@@ -263,16 +260,9 @@ DiscoveredForms Discovery::finish() {
 
 namespace {
 
-// What a request adds to a form, in the order of its keys.
-struct Added {
-  const char* key;
-  const Value& value;
-};
-std::array<Added, 4> AddedEntries(const DiscoveredForms::Form& form) {
-  return {{{kAnnotationsFormKey, form.annotations},
-           {kFormExtensionsKey, form.extensions},
-           {kOverriderFormKey, form.overrider},
-           {kOverridingFormKey, form.overriding}}};
+// What a request adds to a form, in the order of kFormRequestKeys.
+std::array<const Value*, 4> AddedEntries(const DiscoveredForms::Form& form) {
+  return {&form.annotations, &form.extensions, &form.overrider, &form.overriding};
 }
 
 }  // namespace
@@ -284,17 +274,17 @@ void DiscoveredForms::splice(drm1::Splice& out) const {
   out.container(drm1::kTagArray, static_cast<uint32_t>(forms_.size()), kDepth - 1);
   for (const Form& form : forms_) {
     const std::shared_ptr<const drm1::EncodedEntries> entries(form.encoded, &form.encoded->entries);
-    const std::array<Added, 4> added = AddedEntries(form);
+    const std::array<const Value*, 4> added = AddedEntries(form);
     size_t count = entries->count();
-    for (const Added& a : added) count += a.value.isPresent() ? 1 : 0;
+    for (const Value* value : added) count += value->isPresent() ? 1 : 0;
     out.container(drm1::kTagDictionary, static_cast<uint32_t>(count), kDepth);
     size_t next = 0;
-    for (const Added& a : added) {
-      if (a.value.isAbsent()) continue;
-      const size_t at = entries->lowerBound(a.key);
+    for (size_t i = 0; i < added.size(); ++i) {
+      if (added[i]->isAbsent()) continue;
+      const size_t at = form.encoded->requestKeyAt[i];
       out.entries(entries, next, at);
-      out.key(a.key);
-      out.value(a.value, kDepth + 1);
+      out.key(kFormRequestKeys[i]);
+      out.value(*added[i], kDepth + 1);
       next = at;
     }
     out.entries(entries, next, SIZE_MAX);
@@ -306,8 +296,9 @@ Value DiscoveredForms::value() const {
   forms.reserve(forms_.size());
   for (const Form& form : forms_) {
     Dictionary entries = form.plugIn->formEntries();
-    for (const Added& added : AddedEntries(form)) {
-      if (added.value.isPresent()) entries.insert_or_assign(added.key, added.value);
+    const std::array<const Value*, 4> added = AddedEntries(form);
+    for (size_t i = 0; i < added.size(); ++i) {
+      if (added[i]->isPresent()) entries.insert_or_assign(kFormRequestKeys[i], *added[i]);
     }
     forms.push_back(Value(std::move(entries)));
   }

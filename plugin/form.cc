@@ -101,6 +101,9 @@ std::shared_ptr<const DRPlugInCore::EncodedForm> DRPlugInCore::encodedForm() con
   made->lastModified = form[kFormLastModifiedKey];
   made->systemResident = form[kFormSystemResidentKey];
   made->uuid = form[kFormUuidKey];
+  for (size_t i = 0; i < kFormRequestKeys.size(); ++i) {
+    made->requestKeyAt[i] = static_cast<uint32_t>(made->entries.lowerBound(kFormRequestKeys[i]));
+  }
   std::lock_guard<std::mutex> lock(mu_);
   if (encodedForm_) return encodedForm_;
   if (generation == generation_) encodedForm_ = made;

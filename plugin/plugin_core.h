@@ -23,6 +23,7 @@
 // line; nothing throws.
 #pragma once
 
+#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -242,6 +243,8 @@ class DRPlugInCore {
     Value lastModified;    // signed
     Value systemResident;  // boolean
     Value uuid;            // string
+    // The entry before which each of kFormRequestKeys sorts in.
+    std::array<uint32_t, 4> requestKeyAt;
   };
   // Made on first use (any thread; several may ask at once) and kept until
   // the record next changes. Never fails: a form the wire cannot carry keeps
