@@ -165,8 +165,9 @@ class Splice {
   void key(std::string_view key);
   // `value` encoded at nesting level `depth`.
   void value(const Value& value, int depth);
-  // Entries [from, to) of `entries`, shared; a refusal among them is this
-  // frame's refusal.
+  // Entries [from, to) of `entries`, shared, not copied. A `to` past
+  // count() means to the end, where the refusal of entries that could not
+  // all be encoded becomes this frame's.
   void entries(const std::shared_ptr<const EncodedEntries>& entries, size_t from, size_t to);
 
   // Fills in the header once the body is complete: OK, or why the frame
