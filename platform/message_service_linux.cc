@@ -420,9 +420,6 @@ void PeerConnection::endSoon() {
 
 Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
                                  std::vector<UniqueFd> descriptors) {
-  if (!body.isDictionary()) {
-    return Error(drm1::kDrm1ErrorDomain, drm1::kUnencodable, "the body is not a dictionary");
-  }
   drm1::Splice frame(drm1::kMaxReplyBodySize);
   frame.value(body, 1);
   return sendReply(requestSerial, std::move(frame), std::move(descriptors));

@@ -454,7 +454,6 @@ Result<std::string> EncodeValue(const Value& value) {
 
 Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
                                 const Value& body) {
-  if (!body.isDictionary()) return Unencodable("the body is not a dictionary");
   Splice frame((flags & kFlagIsReply) != 0 ? kMaxReplyBodySize : kMaxBodySize);
   frame.value(body, 1);
   if (Status s = frame.seal(serial, replyTo, flags); !s.ok()) return s.error();
@@ -555,12 +554,7 @@ void Splice::entries(const std::shared_ptr<const EncodedEntries>& entries, size_
   if (from < end) {
     const char* p = entries->bytes.data() + entries->starts[from];
     const size_t n = entries->starts[end] - entries->starts[from];
-    Piece& last = pieces_.back();
-    if (last.shared != nullptr && last.shared + last.size == p) {
-      last.size += n;
-    } else {
-      pieces_.push_back({p, 0, n});
-    }
+    pieces_.push_back({p, 0, n});
     size_ += n;
     if (kept_.empty() || kept_.back() != entries) kept_.push_back(entries);
   }
