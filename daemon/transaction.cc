@@ -71,6 +71,44 @@ void Transaction::setReplyValue(std::string_view key, const Value& value) {
   reply_ = reply_.changing(key, value);
 }
 
+void Transaction::setReplyForms(std::string_view key, DiscoveredForms forms) {
+  formsKey_ = key;
+  forms_ = std::move(forms);
+}
+
+Value Transaction::replyValue() const {
+  return forms_ ? reply_.changing(formsKey_, forms_->value()) : reply_;
+}
+
+// The reply's entries in key order, the forms among them.
+drm1::Splice Transaction::replyFrame() const {
+  drm1::Splice frame(drm1::kMaxReplyBodySize);
+  if (!forms_) {
+    frame.value(reply_, 1);
+    return frame;
+  }
+  const Dictionary& entries = reply_.dictionary();
+  const bool replaced = entries.contains(formsKey_);
+  frame.container(drm1::kTagDictionary, static_cast<uint32_t>(entries.size() + (replaced ? 0 : 1)),
+                  1);
+  bool written = false;
+  for (const auto& [key, value] : entries) {
+    if (!written && key >= formsKey_) {
+      frame.key(formsKey_);
+      forms_->splice(frame);
+      written = true;
+      if (key == formsKey_) continue;
+    }
+    frame.key(key);
+    frame.value(value, 2);
+  }
+  if (!written) {
+    frame.key(formsKey_);
+    forms_->splice(frame);
+  }
+  return frame;
+}
+
 Value Transaction::ArrayValue(const Value& message, std::string_view key) {
   const Value& value = message[key];
   return value.isArray() ? value : Value();
@@ -163,14 +201,14 @@ void Transaction::done() {
     return;
   }
   replied_ = true;
-  if (verbose_ >= 2) debug("Replying %@", reply_);
+  if (verbose_ >= 2) debug("Replying %@", replyValue());
   if (probes::RequestOutputEnabled()) {
-    probes::RequestOutput(client_->pid(), reply_.description().c_str());
+    probes::RequestOutput(client_->pid(), replyValue().description().c_str());
   }
   if (!request_.wantsReply) return;
   std::shared_ptr<PeerConnection> c = client_->connection();
   if (!c) return;
-  Status sent = c->sendReply(request_.serial, reply_, std::move(descriptors_));
+  Status sent = c->sendReply(request_.serial, replyFrame(), std::move(descriptors_));
   if (!sent.ok() && c->isOpen()) {
     log("unable to reply to client %d: %@", client_->pid(), sent);
     // A reply the wire cannot carry (nested too deeply or too large, say

@@ -13,6 +13,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -23,6 +24,7 @@
 #include "core/unique_fd.h"
 #include "core/value.h"
 #include "platform/message_service.h"
+#include "plugin/discovery.h"
 #include "plugin/plugin.h"
 
 namespace dr {
@@ -65,6 +67,9 @@ class Transaction {
   const Value& request() const { return request_.body; }
   // Adds `key` to the reply.
   void setReplyValue(std::string_view key, const Value& value);
+  // Adds `key` to the reply with the forms of a discovery, written from
+  // their records' encoded bytes.
+  void setReplyForms(std::string_view key, DiscoveredForms forms);
   // Sends `fd` with the reply.
   void attachDescriptor(UniqueFd fd) { descriptors_.push_back(std::move(fd)); }
 
@@ -85,11 +90,16 @@ class Transaction {
 
  private:
   Transaction(PeerMessage request, std::shared_ptr<DRDIpcClient> client);
+  // The reply as a value (for log lines), and as the body of its frame.
+  Value replyValue() const;
+  drm1::Splice replyFrame() const;
 
   const std::shared_ptr<DRDIpcClient> client_;
   const PeerMessage request_;
-  const uint32_t verbose_;             // the server's, when the request came
-  Value reply_;                        // a dictionary
+  const uint32_t verbose_;  // the server's, when the request came
+  Value reply_;             // a dictionary
+  std::string formsKey_;    // where forms_ go in the reply, if anywhere
+  std::optional<DiscoveredForms> forms_;
   std::vector<UniqueFd> descriptors_;  // sent with the reply
   bool replied_ = false;
 };

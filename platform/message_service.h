@@ -135,6 +135,10 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   // here once sent.
   Status sendReply(uint64_t requestSerial, const Value& body,
                    std::vector<UniqueFd> descriptors = {});
+  // The same for a body already written as pieces (its frame is sealed
+  // here), whose shared pieces are written from where they lie.
+  Status sendReply(uint64_t requestSerial, drm1::Splice frame,
+                   std::vector<UniqueFd> descriptors = {});
   // Closes the connection; the handler then gets kConnectionInvalid.
   void cancel();
   bool isOpen() const { return !closed_.load(); }
@@ -169,7 +173,7 @@ class PeerConnection : public std::enable_shared_from_this<PeerConnection> {
   std::atomic<bool> resumed_{false};
 
   mutable std::mutex mu_;
-  std::deque<std::string> outbox_;  // guarded by mu_: encoded frames not yet written
+  std::deque<drm1::Splice> outbox_;  // guarded by mu_: sealed frames not yet written
   // The descriptors sent with each frame of outbox_ (most have none).
   std::deque<std::vector<UniqueFd>> outboxDescriptors_;  // guarded by mu_
   size_t outboxSent_ = 0;          // guarded by mu_: bytes of the first one written

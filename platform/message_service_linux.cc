@@ -45,6 +45,10 @@ constexpr std::chrono::milliseconds kAcceptBackOff{250};
 // without pause does not keep the loop from the others.
 constexpr int kReadsPerTurn = 16;
 
+// The pieces one write takes: a spliced reply holds a few per form, and
+// the socket's buffer takes a few hundred kilobytes a call.
+constexpr size_t kWriteParts = 256;
+
 int MakeWakeFd() { return ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); }
 
 void DrainWakeFd(int fd) {
@@ -416,17 +420,23 @@ void PeerConnection::endSoon() {
 
 Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
                                  std::vector<UniqueFd> descriptors) {
+  drm1::Splice frame(drm1::kMaxReplyBodySize);
+  frame.value(body, 1);
+  return sendReply(requestSerial, std::move(frame), std::move(descriptors));
+}
+
+Status PeerConnection::sendReply(uint64_t requestSerial, drm1::Splice frame,
+                                 std::vector<UniqueFd> descriptors) {
   std::lock_guard<std::mutex> lock(mu_);
   if (closed_) return Error(drm1::kDrm1ErrorDomain, drm1::kProtocolError, "connection closed");
   if (descriptors.size() > drm1::kMaxDescriptors) {
     return Error(drm1::kDrm1ErrorDomain, drm1::kUnencodable, "too many descriptors");
   }
   const uint32_t flags = drm1::kFlagIsReply | (descriptors.empty() ? 0 : drm1::kFlagDescriptors);
-  Result<std::string> frame = drm1::EncodeFrame(nextSerial_, requestSerial, flags, body);
-  if (!frame.ok()) return frame.error();
+  if (Status sealed = frame.seal(nextSerial_, requestSerial, flags); !sealed.ok()) return sealed;
   ++nextSerial_;
   const bool queuedBefore = !outbox_.empty();
-  if (queuedBefore) outboxQueued_ += frame->size();
+  if (queuedBefore) outboxQueued_ += frame.size();
   // A peer that does not take its replies gets no more of its requests
   // read; the loop closes it if it then takes nothing for long.
   if (outboxQueued_ > kMaxQueuedReplyBytes && !repliesBacklogged_) {
@@ -435,7 +445,7 @@ Status PeerConnection::sendReply(uint64_t requestSerial, const Value& body,
     SystemLog("not reading %@: more than 64 MiB of replies unread", description());
     if (id_ != 0) loop_->post(id_);
   }
-  outbox_.push_back(std::move(*frame));
+  outbox_.push_back(std::move(frame));
   outboxDescriptors_.push_back(std::move(descriptors));
   // Nothing ahead of it: write it from here rather than have the loop do
   // so, which would double the thread switches of every request. A failure
@@ -468,14 +478,13 @@ bool PeerConnection::writeSomeLocked() {
     // first byte of their frame, so a call that carries some starts at that
     // frame, and one stops short of the next frame that has some.
     const bool attach = outboxSent_ == 0 && !outboxDescriptors_.front().empty();
-    struct iovec parts[16];
+    struct iovec parts[kWriteParts];
     size_t count = 0;
     auto descriptors = outboxDescriptors_.begin();
     for (auto it = outbox_.begin(); it != outbox_.end() && count < std::size(parts);
          ++it, ++descriptors) {
       if (count > 0 && !descriptors->empty()) break;
-      const size_t skip = count == 0 ? outboxSent_ : 0;
-      parts[count++] = {it->data() + skip, it->size() - skip};
+      count += it->gather(count == 0 ? outboxSent_ : 0, parts + count, std::size(parts) - count);
     }
     static const std::vector<UniqueFd> kNone;
     ssize_t n = SendWithDescriptors(fd_, parts, count, attach ? outboxDescriptors_.front() : kNone);

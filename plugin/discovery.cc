@@ -1,6 +1,8 @@
 #include "plugin/discovery.h"
 
 #include <algorithm>
+#include <array>
+#include <cstdint>
 #include <iterator>
 
 #include "core/format.h"
@@ -21,9 +23,6 @@ constexpr WorkaroundHost kWorkaroundHosts[] = {
     {"com.corvel.OdelloApp", "10.2"},
 };
 
-constexpr const char* kAnnotationsFormKey = "annotations";
-constexpr const char* kOverriderFormKey = "overrider";
-constexpr const char* kOverridingFormKey = "overriding";
 constexpr const char* kReplaceEntitlement = "com.corvel.developer.replace-plugin";
 
 }  // namespace
@@ -168,26 +167,25 @@ void Discovery::examine(const DRDPlugInPtr& candidate) {
   }
   if (!resolveDuplicates(candidate, verdict)) return;
 
-  // The form's entries straight from the record (exporting never fails), so
-  // that the annotations and tokens are added without copying the form.
-  Dictionary entries = p.formEntries();
-  if (services_.addAnnotation) {
-    services_.addAnnotation(p, entries);
-  } else {
-    entries[kAnnotationsFormKey] = DRPlugInCore::NoAnnotations();
-  }
-  p.augmentForm(entries);
-  const Value form(std::move(entries));
+  // The record's encoded form, and what this request adds to it.
+  DiscoveredForms::Form form{
+      candidate,
+      p.encodedForm(),
+      services_.annotations ? services_.annotations(p) : DRPlugInCore::NoAnnotations(),
+      p.formExtensions(),
+      Value(),
+      Value()};
+  const Value& uuid = form.encoded->uuid;
   const size_t position = accepted_.size();
-  accepted_.push_back({candidate, verdict, form});
-  if (const Value& id = form[kFormIdentifierKey]; id.isString()) {
+  if (const Value& id = form.encoded->identifier; id.isString()) {
     acceptedByIdentifier_[id.stringValue()].push_back(position);
   }
+  accepted_.push_back({verdict, std::move(form)});
 
   const Value replaces = p.valueForEntitlement(kReplaceEntitlement);
   auto replace = [&](const Value& identifier) {
     if (identifier.isString()) {
-      replacements_[identifier.stringValue()] = {position, form[kFormUuidKey]};
+      replacements_[identifier.stringValue()] = {position, uuid};
     }
   };
   if (replaces.isArray()) {
@@ -205,12 +203,11 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
   std::vector<size_t>& positions = same->second;  // in the order accepted
   for (auto it = positions.begin(); it != positions.end(); ++it) {
     Accepted& existing = accepted_[*it];
-    const Value& e = existing.form;
-    const int order = compareVersionString(version, e[kFormVersionKey].stringValue());
-    const bool systemResident =
-        e[kFormSystemResidentKey].isBool() && e[kFormSystemResidentKey].boolValue();
-    const bool fresher = (p.onSystemVolume() && !systemResident) ||
-                         p.lastModified() > e[kFormLastModifiedKey].intValue();
+    const DRPlugInCore::EncodedForm& e = *existing.form.encoded;
+    const int order = compareVersionString(version, e.version.stringValue());
+    const bool systemResident = e.systemResident.isBool() && e.systemResident.boolValue();
+    const bool fresher =
+        (p.onSystemVolume() && !systemResident) || p.lastModified() > e.lastModified.intValue();
     bool replaceExisting;
     if (flags_ & message::kDiscoverAllVersions) {
       if ((flags_ & message::kDiscoverDuplicates) || order != 0) continue;  // both stay
@@ -221,7 +218,7 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
       replaceExisting = order > 0;
     }
     if (!replaceExisting) {
-      setOutcome(verdict, DiscoveryOutcome::kSuperseded, {}, existing.plugIn);
+      setOutcome(verdict, DiscoveryOutcome::kSuperseded, {}, existing.form.plugIn);
       return false;
     }
     setOutcome(existing.verdict, DiscoveryOutcome::kSuperseded, {}, candidate);
@@ -232,35 +229,80 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
   return true;
 }
 
-Value Discovery::finish() {
+DiscoveredForms Discovery::finish() {
   if (!replacements_.empty()) {
     for (Accepted& a : accepted_) {
-      const Value& identifier = a.form[kFormIdentifierKey];
+      const Value& identifier = a.form.encoded->identifier;
       if (a.removed || !identifier.isString()) continue;
       auto found = replacements_.find(identifier.stringValue());
       if (found == replacements_.end()) continue;
       const Replacer& r = found->second;
-      a.form = dictionaryChangingTo(a.form, kOverriderFormKey, r.uuid);
+      a.form.overrider = r.uuid;
       // A replacer dropped as a duplicate meanwhile has no form to mark.
       Accepted& replacer = accepted_[r.accepted];
-      if (!replacer.removed) {
-        replacer.form =
-            dictionaryChangingTo(replacer.form, kOverridingFormKey, a.form[kFormIdentifierKey]);
-      }
+      if (!replacer.removed) replacer.form.overriding = identifier;
     }
   }
-  Array matches;
+  DiscoveredForms matches;
   const pid_t pid = host_.client->pid();
-  for (const Accepted& a : accepted_) {
+  for (Accepted& a : accepted_) {
     if (a.removed) continue;
-    if (services_.mayUse && !services_.mayUse(a.form)) {
-      debug(Format("client %d plugin %@ rejected by Keeper", pid, a.form[kFormIdentifierKey]));
+    const Value& identifier = a.form.encoded->identifier;
+    if (services_.mayUse && !services_.mayUse(identifier.stringValue())) {
+      debug(Format("client %d plugin %@ rejected by Keeper", pid, identifier));
       setOutcome(a.verdict, DiscoveryOutcome::kVetoed);
       continue;
     }
-    matches.push_back(a.form);
+    matches.add(std::move(a.form));
   }
-  return Value(std::move(matches));
+  return matches;
+}
+
+namespace {
+
+// What a request adds to a form, in the order of kFormRequestKeys.
+std::array<const Value*, 4> AddedEntries(const DiscoveredForms::Form& form) {
+  return {&form.annotations, &form.extensions, &form.overrider, &form.overriding};
+}
+
+}  // namespace
+
+// Each form is the record's entries with the request's spliced in where
+// their keys sort (a record's own form has none of them).
+void DiscoveredForms::splice(drm1::Splice& out) const {
+  constexpr int kDepth = DRPlugInCore::kFormDepth;
+  out.container(drm1::kTagArray, static_cast<uint32_t>(forms_.size()), kDepth - 1);
+  for (const Form& form : forms_) {
+    const std::shared_ptr<const drm1::EncodedEntries> entries(form.encoded, &form.encoded->entries);
+    const std::array<const Value*, 4> added = AddedEntries(form);
+    size_t count = entries->count();
+    for (const Value* value : added) count += value->isPresent() ? 1 : 0;
+    out.container(drm1::kTagDictionary, static_cast<uint32_t>(count), kDepth);
+    size_t next = 0;
+    for (size_t i = 0; i < added.size(); ++i) {
+      if (added[i]->isAbsent()) continue;
+      const size_t at = form.encoded->requestKeyAt[i];
+      out.entries(entries, next, at);
+      out.key(kFormRequestKeys[i]);
+      out.value(*added[i], kDepth + 1);
+      next = at;
+    }
+    out.entries(entries, next, SIZE_MAX);
+  }
+}
+
+Value DiscoveredForms::value() const {
+  Array forms;
+  forms.reserve(forms_.size());
+  for (const Form& form : forms_) {
+    Dictionary entries = form.plugIn->formEntries();
+    const std::array<const Value*, 4> added = AddedEntries(form);
+    for (size_t i = 0; i < added.size(); ++i) {
+      if (added[i]->isPresent()) entries.insert_or_assign(kFormRequestKeys[i], *added[i]);
+    }
+    forms.push_back(Value(std::move(entries)));
+  }
+  return Value(std::move(forms));
 }
 
 }  // namespace dr

@@ -23,6 +23,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <vector>
 
@@ -30,6 +31,7 @@
 #include "plugin/plugin.h"
 #include "plugin/plugin_client.h"
 #include "plugin/plugin_set.h"
+#include "wire/drm1.h"
 #include "wire/protocol.h"
 
 namespace dr {
@@ -79,11 +81,12 @@ struct DiscoveryHost {
 // hold, no annotation, nothing vetoed, no log.
 struct DiscoveryServices {
   std::function<bool(const DRDPlugIn&)> isHeld;
-  // Puts the user's annotation of the plug-in into its form under
-  // "annotations"; unset: an empty dictionary is put there.
-  std::function<void(const DRDPlugIn&, Dictionary& form)> addAnnotation;
-  // Whether the host may use the plug-in described by `form`.
-  std::function<bool(const Value& form)> mayUse;
+  // What the plug-in's form carries under "annotations", a dictionary;
+  // unset: an empty one.
+  std::function<Value(const DRDPlugIn&)> annotations;
+  // Whether the host may use the plug-in `identifier` (a form's
+  // "identifier", "" when it has none).
+  std::function<bool(std::string_view identifier)> mayUse;
   std::function<void(const std::string&)> log;    // always written
   std::function<void(const std::string&)> debug;  // written when verbose
 };
@@ -98,6 +101,36 @@ struct DiscoveryServices {
 std::optional<std::vector<uint32_t>> CandidatesToExamine(const PlugInSet& candidates,
                                                          const Value& rules, uint64_t flags,
                                                          bool needs17732150Workaround);
+
+// The forms one discovery answers, in order. Each is its record's encoded
+// form (made once per record) and what this request adds: the user's
+// annotations, tokens for the plug-in's shared resources ("extensions")
+// and the replacement marks ("overrider", "overriding").
+class DiscoveredForms {
+ public:
+  struct Form {
+    DRDPlugInPtr plugIn;
+    std::shared_ptr<const DRPlugInCore::EncodedForm> encoded;
+    Value annotations;  // a dictionary
+    Value extensions;   // absent when the plug-in shares no resource
+    Value overrider;    // absent unless it is replaced
+    Value overriding;   // absent unless it replaces another
+  };
+
+  size_t size() const { return forms_.size(); }
+  const std::vector<Form>& forms() const { return forms_; }
+  void add(Form form) { forms_.push_back(std::move(form)); }
+
+  // The array of forms, written into `out` as a value at nesting level
+  // DRPlugInCore::kFormDepth - 1, the record's bytes shared.
+  void splice(drm1::Splice& out) const;
+  // The same array as a value, each form made afresh from its record (for
+  // log lines and checks; replies use splice).
+  Value value() const;
+
+ private:
+  std::vector<Form> forms_;
+};
 
 class Discovery {
  public:
@@ -120,7 +153,7 @@ class Discovery {
   void examine(const DRDPlugInPtr& candidate);
   // Marks replacements, applies the policy and answers the forms to return,
   // in the order accepted. Call once, after the last examine.
-  Value finish();
+  DiscoveredForms finish();
 
   // Every candidate examined so far (and, after finish, vetoed ones too),
   // in the order examined.
@@ -129,9 +162,8 @@ class Discovery {
 
  private:
   struct Accepted {
-    DRDPlugInPtr plugIn;
-    size_t verdict;        // index into verdicts_
-    Value form;            // a dictionary
+    size_t verdict;  // index into verdicts_
+    DiscoveredForms::Form form;
     bool removed = false;  // superseded by a later copy; kept so positions stay
   };
 

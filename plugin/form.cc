@@ -44,15 +44,21 @@ Value DRPlugInCore::exportForm() const { return Value(formEntries()); }
 
 // One lock for the whole form rather than one per property (a form is made
 // for every plug-in a match returns), which also makes the form one
-// consistent picture of the record. The keys go in ascending order, each at
-// the end of the dictionary.
+// consistent picture of the record.
 Dictionary DRPlugInCore::formEntries() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return formEntriesLocked(true);
+}
+
+// The keys go in ascending order, each at the end of the dictionary.
+Dictionary DRPlugInCore::formEntriesLocked(bool annotations) const {
   Dictionary form;
   auto add = [&form](const char* key, Value value) {
     if (value.isPresent()) form.emplace_hint(form.end(), key, std::move(value));
   };
-  std::lock_guard<std::mutex> lock(mu_);
-  add(kFormAnnotationsKey, annotations_.isDictionary() ? annotations_ : NoAnnotations());
+  if (annotations) {
+    add(kFormAnnotationsKey, annotations_.isDictionary() ? annotations_ : NoAnnotations());
+  }
   // Copied only when there is something to leave out.
   add(kFormBundleInfoKey,
       bundleInfoDictionary_.has(kBNBundleInfoPdocURLKey)
@@ -73,6 +79,35 @@ Dictionary DRPlugInCore::formEntries() const {
   // still carries a string, the empty one, which orders before every version.
   add(kFormVersionKey, versionOf(plugInDictionary_).value_or(""));
   return form;
+}
+
+// Encoded outside the lock; of two threads that both make it, the first
+// to finish keeps its own, and one made from a record that changed
+// meanwhile is answered but not kept.
+std::shared_ptr<const DRPlugInCore::EncodedForm> DRPlugInCore::encodedForm() const {
+  Dictionary entries;
+  uint64_t generation;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    if (encodedForm_) return encodedForm_;
+    entries = formEntriesLocked(false);
+    generation = generation_;
+  }
+  auto made = std::make_shared<EncodedForm>();
+  made->entries = drm1::EncodeEntries(entries, kFormDepth + 1);
+  const Value form(std::move(entries));
+  made->identifier = form[kFormIdentifierKey];
+  made->version = form[kFormVersionKey];
+  made->lastModified = form[kFormLastModifiedKey];
+  made->systemResident = form[kFormSystemResidentKey];
+  made->uuid = form[kFormUuidKey];
+  for (size_t i = 0; i < kFormRequestKeys.size(); ++i) {
+    made->requestKeyAt[i] = static_cast<uint32_t>(made->entries.lowerBound(kFormRequestKeys[i]));
+  }
+  std::lock_guard<std::mutex> lock(mu_);
+  if (encodedForm_) return encodedForm_;
+  if (generation == generation_) encodedForm_ = made;
+  return made;
 }
 
 std::shared_ptr<DRPlugInCore> DRPlugInCore::initWithForm(const Value& form) {

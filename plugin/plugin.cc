@@ -93,10 +93,14 @@ ServiceManager* DRDPlugIn::serviceManager() const {
   return services_.serviceManager ? services_.serviceManager : DefaultServiceManager();
 }
 
-void DRDPlugIn::augmentForm(Dictionary& form) const {
+Value DRDPlugIn::formExtensions() const {
   Value shared = plugInDictionary()[kSharedKey];
-  if (shared.isAbsent()) return;
-  form.insert_or_assign(kFormExtensionsKey, issueResourceExtensions(shared));
+  return shared.isAbsent() ? Value() : issueResourceExtensions(shared);
+}
+
+void DRDPlugIn::augmentForm(Dictionary& form) const {
+  Value extensions = formExtensions();
+  if (extensions.isPresent()) form.insert_or_assign(kFormExtensionsKey, std::move(extensions));
 }
 
 Value DRDPlugIn::issueResourceExtensions(const Value& resources) const {

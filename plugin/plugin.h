@@ -69,8 +69,10 @@ class DRDPlugIn : public DRPlugInCore {
   static std::shared_ptr<DRDPlugIn> initWithRGData(const RegistryEntryPtr& entry,
                                                    const PlugInServices& services = {});
 
-  // Adds "extensions" (resource name → token) to `form` when the plug-in
-  // dictionary declares "Shared"; leaves it unchanged otherwise.
+  // What a form carries under "extensions" (resource name → token, issued
+  // afresh): absent unless the plug-in dictionary declares "Shared".
+  Value formExtensions() const;
+  // Adds formExtensions() to `form` when there are any.
   void augmentForm(Dictionary& form) const;
   // Read-only sandbox tokens for the named resources of the bundle ("." is
   // the bundle itself), keyed by the names as given; resources whose token

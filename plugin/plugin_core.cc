@@ -51,6 +51,7 @@ bool DRPlugInCore::setDictionaries(const Value& dict) {
   if (!dict.isDictionary()) return false;
   const std::string id = identifier().value_or("");
   std::lock_guard<std::mutex> lock(mu_);
+  changedLocked();
   bundleInfoDictionary_ = dict;
   topDictionary_ = dict[kUXExtensionKey];
   if (!topDictionary_.isDictionary()) return false;

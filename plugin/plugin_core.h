@@ -23,6 +23,7 @@
 // line; nothing throws.
 #pragma once
 
+#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -36,6 +37,7 @@
 #include "core/value.h"
 #include "platform/service_manager.h"
 #include "registry/service_manager_linux.h"
+#include "wire/drm1.h"
 
 namespace dr {
 
@@ -227,6 +229,27 @@ class DRPlugInCore {
   // The same form as a mutable dictionary, for a caller that adds entries
   // before wrapping it (no absent values in it).
   Dictionary formEntries() const;
+
+  // A form's nesting level in a "match" reply: the body is level 1 and its
+  // "matches" array level 2.
+  static constexpr int kFormDepth = 3;
+  // The form's entries that stay the same from request to request (all but
+  // "annotations"), encoded as they sit in a "match" reply, and the values
+  // discovery decides by, so that a reply carrying the form copies neither.
+  struct EncodedForm {
+    drm1::EncodedEntries entries;
+    Value identifier;      // string
+    Value version;         // string
+    Value lastModified;    // signed
+    Value systemResident;  // boolean
+    Value uuid;            // string
+    // The entry before which each of kFormRequestKeys sorts in.
+    std::array<uint32_t, 4> requestKeyAt;
+  };
+  // Made on first use (any thread; several may ask at once) and kept until
+  // the record next changes. Never fails: a form the wire cannot carry keeps
+  // the refusal in its entries.
+  std::shared_ptr<const EncodedForm> encodedForm() const;
   // What a form's "annotations" holds for a plug-in without any: one shared
   // empty dictionary rather than a new node per form.
   static const Value& NoAnnotations();
@@ -243,7 +266,15 @@ class DRPlugInCore {
   void set(T& field, T value) {
     std::lock_guard<std::mutex> lock(mu_);
     std::swap(field, value);  // the old value dies outside the lock
+    changedLocked();
   }
+  // Drops the encoded form. REQUIRES: mu_ held.
+  void changedLocked() {
+    encodedForm_.reset();
+    ++generation_;
+  }
+  // The form's entries; "annotations" only when `annotations`. REQUIRES: mu_ held.
+  Dictionary formEntriesLocked(bool annotations) const;
   const Uuid& requireUuid(const std::optional<Uuid>& uuid) const;
   // version() of a plug-in dictionary.
   static std::optional<std::string> versionOf(const Value& plugInDictionary);
@@ -265,6 +296,8 @@ class DRPlugInCore {
   std::optional<Uuid> uuid_;
   std::optional<Data> cdhash_;
   std::optional<std::string> requirement_;
+  mutable std::shared_ptr<const EncodedForm> encodedForm_;  // guarded by mu_
+  uint64_t generation_ = 0;  // guarded by mu_: counts changes, so a stale form is not kept
 };
 
 }  // namespace dr

@@ -4,6 +4,8 @@
 // text is spelled here once; everything else names the constant.
 #pragma once
 
+#include <array>
+
 namespace dr {
 
 // The bundle's information dictionary.
@@ -77,6 +79,11 @@ inline constexpr const char* kFormLocalizedShortNameKey = "localizedShortName";
 inline constexpr const char* kFormHashKey = "hash";
 inline constexpr const char* kFormRequirementKey = "requirement";
 inline constexpr const char* kFormExtensionsKey = "extensions";
+inline constexpr const char* kFormOverriderKey = "overrider";
+inline constexpr const char* kFormOverridingKey = "overriding";
+// The entries a "match" adds to a record's form, in ascending order.
+inline constexpr std::array<const char*, 4> kFormRequestKeys = {
+    kFormAnnotationsKey, kFormExtensionsKey, kFormOverriderKey, kFormOverridingKey};
 
 // Entitlements, match rules and the service overlay.
 // Entitlements.

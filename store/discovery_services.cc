@@ -1,9 +1,7 @@
 #include "store/discovery_services.h"
 
+#include <string_view>
 #include <utility>
-
-#include "plugin/plugin_keys.h"
-#include "wire/protocol.h"
 
 namespace dr {
 
@@ -16,16 +14,15 @@ DiscoveryServices MakeDiscoveryServices(std::function<Value(const DRDPlugIn&)> a
                                         std::function<void(const std::string&)> log,
                                         std::function<void(const std::string&)> debug) {
   DiscoveryServices hooks;
-  hooks.addAnnotation = [annotation = std::move(annotation)](const DRDPlugIn& p, Dictionary& form) {
+  hooks.annotations = [annotation = std::move(annotation)](const DRDPlugIn& p) {
     Value stored = annotation(p);
-    form[message::kAnnotationsKey] =
-        stored.isDictionary() ? std::move(stored) : DRPlugInCore::NoAnnotations();
+    return stored.isDictionary() ? stored : DRPlugInCore::NoAnnotations();
   };
   if (makeJudge) {
     hooks.mayUse = [makeJudge = std::move(makeJudge),
-                    judge = Policy::PlugInJudge()](const Value& form) mutable {
+                    judge = Policy::PlugInJudge()](std::string_view identifier) mutable {
       if (!judge) judge = makeJudge();
-      return judge(form[kFormIdentifierKey].stringValue());
+      return judge(identifier);
     };
   }
   hooks.log = std::move(log);

@@ -382,20 +382,36 @@ class ValueWriter {
   const size_t limit_;
 };
 
-// `value` encoded after `prefix` bytes (left as they are in `out`, which
-// holds at least that many), the buffer sized once, within `limit` bytes.
-Status Encode(std::string& out, size_t prefix, const Value& value, size_t limit) {
-  const size_t size = EncodedSize(value, 1);
-  if (size <= limit) {
+// `value` encoded at nesting level `depth` after what `out` holds, the
+// buffer grown once: text and data of at most `limit` bytes, and the whole
+// encoding within `room` bytes (else "too large", after any value met
+// before the room ran out is refused as such).
+Status Encode(std::string& out, const Value& value, int depth, size_t limit, size_t room) {
+  const size_t prefix = out.size();
+  const size_t size = EncodedSize(value, depth);
+  if (size <= room) {
     out.resize(prefix + size);
     FittingSink sink(out.data() + prefix);
-    if (Status s = ValueWriter<FittingSink>(sink, limit).value(value, 1); !s.ok()) return s;
+    if (Status s = ValueWriter<FittingSink>(sink, limit).value(value, depth); !s.ok()) {
+      out.resize(prefix);
+      return s;
+    }
     out.resize(static_cast<size_t>(sink.end() - out.data()));
     return Status::OK();
   }
-  CountingSink sink(limit);
-  if (Status s = ValueWriter<CountingSink>(sink, limit).value(value, 1); !s.ok()) return s;
+  CountingSink sink(room);
+  if (Status s = ValueWriter<CountingSink>(sink, limit).value(value, depth); !s.ok()) return s;
   return Unencodable(TooLarge(limit));
+}
+
+// A string's length and bytes, checked as a key.
+Status AppendKey(std::string& out, std::string_view key, size_t limit) {
+  if (key.size() > limit || !IsPlainAscii(key)) {
+    if (Status s = CheckText(key, "key", limit); !s.ok()) return s;
+  }
+  Store(out, static_cast<uint32_t>(key.size()));
+  out.append(key);
+  return Status::OK();
 }
 
 }  // namespace
@@ -432,25 +448,162 @@ Result<Value> DecodeBody(std::string_view body, size_t maxValues, size_t* values
 
 Result<std::string> EncodeValue(const Value& value) {
   std::string out;
-  if (Status s = Encode(out, 0, value, kMaxBodySize); !s.ok()) return s.error();
+  if (Status s = Encode(out, value, 1, kMaxBodySize, kMaxBodySize); !s.ok()) return s.error();
   return out;
 }
 
 Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
                                 const Value& body) {
-  if (!body.isDictionary()) return Unencodable("the body is not a dictionary");
-  const size_t limit = (flags & kFlagIsReply) != 0 ? kMaxReplyBodySize : kMaxBodySize;
-  std::string out(kHeaderSize, '\0');
-  if (Status s = Encode(out, kHeaderSize, body, limit); !s.ok()) return s.error();
-  const size_t length = out.size() - kHeaderSize;
-  if (length > limit) return Unencodable(TooLarge(limit));
-  std::memcpy(out.data(), kMagic, sizeof kMagic);
+  Splice frame((flags & kFlagIsReply) != 0 ? kMaxReplyBodySize : kMaxBodySize);
+  frame.value(body, 1);
+  if (Status s = frame.seal(serial, replyTo, flags); !s.ok()) return s.error();
+  return std::move(frame).flatten();
+}
+
+std::string_view EncodedEntries::key(size_t i) const {
+  const char* p = bytes.data() + starts[i];
+  return std::string_view(p + 4, Load<uint32_t>(p));
+}
+
+size_t EncodedEntries::lowerBound(std::string_view key) const {
+  size_t low = 0, high = count();
+  while (low < high) {
+    const size_t mid = (low + high) / 2;
+    // Keys order as unsigned bytes, as a dictionary's do (and memcmp).
+    if (this->key(mid).compare(key) < 0) {
+      low = mid + 1;
+    } else {
+      high = mid;
+    }
+  }
+  return low;
+}
+
+EncodedEntries EncodeEntries(const Dictionary& entries, int depth) {
+  EncodedEntries out;
+  size_t size = 0;
+  for (const auto& [k, v] : entries) size += 4 + k.size() + EncodedSize(v, depth);
+  out.bytes.reserve(std::min<size_t>(size, kMaxReplyBodySize));
+  out.starts.reserve(entries.size() + 1);
+  for (const auto& [k, v] : entries) {
+    const size_t start = out.bytes.size();
+    out.starts.push_back(static_cast<uint32_t>(start));
+    Status s = AppendKey(out.bytes, k, kMaxReplyBodySize);
+    if (s.ok() && out.bytes.size() > kMaxReplyBodySize)
+      s = Unencodable(TooLarge(kMaxReplyBodySize));
+    if (s.ok()) {
+      s = Encode(out.bytes, v, depth, kMaxReplyBodySize, kMaxReplyBodySize - out.bytes.size());
+    }
+    if (!s.ok()) {
+      out.bytes.resize(start);
+      out.refusal = s;
+      return out;
+    }
+  }
+  out.starts.push_back(static_cast<uint32_t>(out.bytes.size()));
+  return out;
+}
+
+Splice::Splice(size_t limit) : limit_(limit), local_(kHeaderSize, '\0') { local(0); }
+
+void Splice::local(size_t from) {
+  const size_t n = local_.size() - from;
+  if (n == 0) return;
+  if (!pieces_.empty() && pieces_.back().shared == nullptr &&
+      pieces_.back().at + pieces_.back().size == from) {
+    pieces_.back().size += n;
+  } else {
+    pieces_.push_back({nullptr, from, n});
+  }
+  size_ += n;
+}
+
+void Splice::stop(Status why) {
+  if (status_.ok()) status_ = std::move(why);
+}
+
+void Splice::container(Tag tag, uint32_t count, int depth) {
+  if (stopped()) return;
+  if (depth > kMaxDepth) {
+    return stop(Unencodable("nesting deeper than " + std::to_string(kMaxDepth) + " levels"));
+  }
+  const size_t from = local_.size();
+  local_.push_back(static_cast<char>(tag));
+  Store(local_, count);
+  local(from);
+}
+
+void Splice::key(std::string_view key) {
+  if (stopped()) return;
+  const size_t from = local_.size();
+  if (Status s = AppendKey(local_, key, limit_); !s.ok()) return stop(std::move(s));
+  local(from);
+}
+
+void Splice::value(const Value& value, int depth) {
+  if (stopped()) return;
+  const size_t from = local_.size();
+  const size_t room = limit_ - (size_ - kHeaderSize);
+  if (Status s = Encode(local_, value, depth, limit_, room); !s.ok()) return stop(std::move(s));
+  local(from);
+}
+
+void Splice::entries(const std::shared_ptr<const EncodedEntries>& entries, size_t from, size_t to) {
+  if (stopped()) return;
+  const size_t end = std::min(to, entries->count());
+  if (from < end) {
+    const char* p = entries->bytes.data() + entries->starts[from];
+    const size_t n = entries->starts[end] - entries->starts[from];
+    pieces_.push_back({p, 0, n});
+    size_ += n;
+    if (kept_.empty() || kept_.back() != entries) kept_.push_back(entries);
+  }
+  // A refusal beyond the limit is not reached: the body is too large first.
+  if (to > entries->count() && !entries->refusal.ok() && !stopped()) stop(entries->refusal);
+}
+
+Status Splice::seal(uint64_t serial, uint64_t replyTo, uint32_t flags) {
+  if (!status_.ok()) return status_;
+  const size_t length = size_ - kHeaderSize;
+  if (length > limit_) return Unencodable(TooLarge(limit_));
+  struct iovec first;
+  if (length == 0 || gather(kHeaderSize, &first, 1) != 1 ||
+      *static_cast<const uint8_t*>(first.iov_base) != kTagDictionary) {
+    return Unencodable("the body is not a dictionary");
+  }
+  char* out = local_.data();
+  std::memcpy(out, kMagic, sizeof kMagic);
   const uint32_t length32 = static_cast<uint32_t>(length), reserved = 0;
-  std::memcpy(out.data() + 4, &length32, 4);
-  std::memcpy(out.data() + 8, &serial, 8);
-  std::memcpy(out.data() + 16, &replyTo, 8);
-  std::memcpy(out.data() + 24, &flags, 4);
-  std::memcpy(out.data() + 28, &reserved, 4);
+  std::memcpy(out + 4, &length32, 4);
+  std::memcpy(out + 8, &serial, 8);
+  std::memcpy(out + 16, &replyTo, 8);
+  std::memcpy(out + 24, &flags, 4);
+  std::memcpy(out + 28, &reserved, 4);
+  return Status::OK();
+}
+
+size_t Splice::gather(size_t offset, struct iovec* out, size_t max) const {
+  size_t filled = 0;
+  for (const Piece& piece : pieces_) {
+    if (filled == max) break;
+    if (offset >= piece.size) {
+      offset -= piece.size;
+      continue;
+    }
+    const char* base = piece.shared != nullptr ? piece.shared : local_.data() + piece.at;
+    out[filled++] = {const_cast<char*>(base + offset), piece.size - offset};
+    offset = 0;
+  }
+  return filled;
+}
+
+std::string Splice::flatten() && {
+  if (pieces_.size() == 1 && size_ == local_.size()) return std::move(local_);
+  std::string out;
+  out.reserve(size_);
+  for (const Piece& piece : pieces_) {
+    out.append(piece.shared != nullptr ? piece.shared : local_.data() + piece.at, piece.size);
+  }
   return out;
 }
 

@@ -31,12 +31,16 @@
 // is shared between threads.
 #pragma once
 
+#include <sys/uio.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <deque>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "core/status.h"
 #include "core/value.h"
@@ -119,6 +123,81 @@ Result<std::string> EncodeValue(const Value& value);
 // header's bodyLength is filled in. Fails with kUnencodable otherwise.
 Result<std::string> EncodeFrame(uint64_t serial, uint64_t replyTo, uint32_t flags,
                                 const Value& body);
+
+// The entries of a dictionary, (key: string, value)* without the
+// dictionary's tag and count, encoded once to be spliced into many messages
+// (Splice::entries). `starts` holds where each entry begins, then the end.
+// An entry that cannot be encoded ends them: `bytes` stop where it begins,
+// and `refusal` says why (OK when every entry was encoded).
+struct EncodedEntries {
+  std::string bytes;
+  std::vector<uint32_t> starts;
+  Status refusal;
+
+  size_t count() const { return starts.empty() ? 0 : starts.size() - 1; }
+  // The key of entry `i`, read back from the bytes. REQUIRES: i < count().
+  std::string_view key(size_t i) const;
+  // The first entry whose key is not below `key` (count() when none).
+  size_t lowerBound(std::string_view key) const;
+};
+
+// `entries` encoded as they sit in a dictionary at nesting level `depth`
+// (their values one level deeper), with the limits of a reply.
+EncodedEntries EncodeEntries(const Dictionary& entries, int depth);
+
+// A frame written in pieces: bytes encoded for this message, and bytes
+// encoded once and shared with other messages (EncodedEntries), which are
+// kept alive and not copied, so a reply made mostly of the latter is written
+// with scatter-gather I/O. The pieces are appended in wire order; the first
+// refusal (or the body passing the limit) is kept, later pieces are then
+// ignored, and seal() answers it. Not shared between threads; moving it
+// keeps every piece valid.
+class Splice {
+ public:
+  // An empty frame whose body may be `limit` bytes (kMaxReplyBodySize for a
+  // reply).
+  explicit Splice(size_t limit);
+
+  // The tag and count of an array or dictionary at nesting level `depth`;
+  // its `count` elements follow.
+  void container(Tag tag, uint32_t count, int depth);
+  // A dictionary key; its value follows.
+  void key(std::string_view key);
+  // `value` encoded at nesting level `depth`.
+  void value(const Value& value, int depth);
+  // Entries [from, to) of `entries`, shared, not copied. A `to` past
+  // count() means to the end, where the refusal of entries that could not
+  // all be encoded becomes this frame's.
+  void entries(const std::shared_ptr<const EncodedEntries>& entries, size_t from, size_t to);
+
+  // Fills in the header once the body is complete: OK, or why the frame
+  // cannot be sent (as EncodeFrame answers).
+  Status seal(uint64_t serial, uint64_t replyTo, uint32_t flags);
+  // Bytes of the whole frame, header included.
+  size_t size() const { return size_; }
+  // The iovecs of the frame's bytes from `offset` on, at most `max` of them;
+  // answers how many were filled.
+  size_t gather(size_t offset, struct iovec* out, size_t max) const;
+  // The frame in one string (moved out when no piece is shared).
+  std::string flatten() &&;
+
+ private:
+  struct Piece {
+    const char* shared;  // null: local_[at, at + size)
+    size_t at;
+    size_t size;
+  };
+  bool stopped() const { return !status_.ok() || size_ - kHeaderSize > limit_; }
+  void local(size_t from);  // local_ from `from` on is the next piece
+  void stop(Status why);
+
+  const size_t limit_;
+  std::string local_;  // the header and every byte encoded here
+  std::vector<Piece> pieces_;
+  std::vector<std::shared_ptr<const EncodedEntries>> kept_;
+  size_t size_ = 0;
+  Status status_;
+};
 
 // Splits a byte stream into frames within `limits`. Feed it what the socket
 // delivers; take frames while next() answers one. The buffer holds what was

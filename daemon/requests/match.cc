@@ -62,7 +62,7 @@ void matchPlugIns(Transaction& t, DRDatabase& database, PlugInHolds& holds, DRDU
   } else {
     for (const DRDPlugInPtr& candidate : records) discovery.examine(candidate);
   }
-  t.setReplyValue(kMatchesKey, discovery.finish());
+  t.setReplyForms(kMatchesKey, discovery.finish());
   t.done();
 }
 

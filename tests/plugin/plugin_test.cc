@@ -721,7 +721,7 @@ TEST_F(PlugInTest, DuplicatesOfOneIdentifier) {
     d.examine(a);
     d.examine(b);
     std::string returned;
-    const Value found = d.finish();
+    const Value found = d.finish().value();
     for (const Value& form : found.array())
       returned += form["uuid"].stringValue() == a->uuid()->string() ? "1" : "2";
     EXPECT_EQ(returned, r[7]);
@@ -767,7 +767,7 @@ TEST_F(PlugInTest, WorkaroundBitAndChosenCandidates) {
       services.debug = services.log;
       Discovery d(host(old), rules, flags, Value(), services);
       for (const DRDPlugInPtr& p : examined) d.examine(p);
-      return std::make_pair(d.finish(), d.flags());
+      return std::make_pair(d.finish().value(), d.flags());
     };
     std::vector<DRDPlugInPtr> some = records;
     if (auto chosen = CandidatesToExamine(set, rules, flags, old)) {
