@@ -1,5 +1,3 @@
-// The built drkit (and any other program) as a real process in the
-// environment DrdProcess gives drd under the same root folder.
 #pragma once
 
 #include <fcntl.h>
@@ -31,14 +29,11 @@ inline std::vector<std::string> DrkitEnvironment(const std::string& root) {
           "PATH=/usr/bin:/bin"};
 }
 
-// <build>/client/<name>, beside <build>/daemon/drd.
 inline std::string ClientBinaryPath(const std::string& name) {
   const std::string drd = DrdProcess::BinaryPath();
   return drd.substr(0, drd.rfind("/daemon/drd")) + "/client/" + name;
 }
 
-// A child process with pipes on its standard input, output and error;
-// killed when destroyed while still running.
 class Child {
  public:
   Child(const std::string& binary, const std::vector<std::string>& args,
@@ -86,12 +81,8 @@ class Child {
     fds_[0] = -1;
   }
   bool signal(int number) { return ::kill(pid_, number) == 0; }
-  // The next line of standard output or error, without its newline; "" when
-  // the output ended or nothing came within 20 s.
   std::string readLine() { return readLineFrom(1); }
   std::string readErrorLine() { return readLineFrom(2); }
-  // Waits for the exit and collects what is left of both outputs; the exit
-  // status, or -1 after a signal.
   int wait() {
     for (int fd : {1, 2}) {
       char chunk[4096];
@@ -136,7 +127,6 @@ struct Ran {
   std::string out, err;
 };
 
-// Runs drkit with `args` to its end, with `input` on its standard input.
 inline Ran RunDrkit(const std::string& root, const std::vector<std::string>& args,
                     const std::string& input = "", const std::string& cwd = "") {
   Child child(ClientBinaryPath("drkit"), args, DrkitEnvironment(root), cwd);

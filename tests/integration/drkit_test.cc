@@ -1,6 +1,3 @@
-// drkit end to end: the real drkit binary against the real drd, with real
-// bundles on disk. Checks what a user sees: standard output, standard error
-// and exit status.
 #include <gtest/gtest.h>
 #include <signal.h>
 
@@ -22,8 +19,6 @@ class DrkitTest : public ::testing::Test {
   void SetUp() override { ASSERT_TRUE(w.start()) << w.log(); }
 
   const std::string& root() const { return w.root(); }
-  // Plug-in com.example.<name> inside an application, so that discovery
-  // offers it to any host; its path.
   std::string makePlugIn(const std::string& name, const std::string& version = "1.0",
                          const std::string& point = kPoint,
                          const std::string& app = "Apps/Host.app") {
@@ -32,13 +27,11 @@ class DrkitTest : public ::testing::Test {
                         version, {{"UXExtensionPointIdentifier", Value(point)}});
   }
   Ran drkit(const std::vector<std::string>& args) { return RunDrkit(root(), args); }
-  // drkit that must succeed; its standard output.
   std::string ok(const std::vector<std::string>& args, const std::string& input = "") {
     Ran r = RunDrkit(root(), args, input);
     EXPECT_EQ(r.status, 0) << args[0] << ": " << r.err;
     return r.out;
   }
-  // A refusal: status 1, nothing on standard output, `err` on standard error.
   void refused(const std::vector<std::string>& args, const std::string& err) {
     Ran r = drkit(args);
     EXPECT_EQ(r.status, 1) << args[0];
@@ -62,7 +55,6 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
   const std::string a = makePlugIn("a", "1.0");
   makePlugIn("b", "2.0");
   makePlugIn("other", "3.0", "com.example.elsewhere");
-  // A relative path is taken from drkit's working folder.
   Ran added = RunDrkit(root(),
                        {"add", a, "Apps/Host.app/Contents/PlugIns/b.appex",
                         "Apps/Host.app/Contents/PlugIns/other.appex"},
@@ -81,8 +73,6 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
       {{"match", "--rule", "BNBundleVersion=>=2"},
        "  com.example.b (2.0)\n  com.example.other (3.0)\n"},
       {{"match", "-p", "com.example.nowhere"}, ""},
-      // Typed patterns: true asks for a key that is present, false for one
-      // that is absent; the text "true" is a version text.
       {{"match", "--rule", "UXExtensionPointName:=true"}, all},
       {{"match", "--rule", "UXExtensionPointName=true"}, ""},
       {{"match", "--rule", "NoSuchKey:=false", "-i", "com.example.a"}, "  com.example.a (1.0)\n"},
@@ -97,34 +87,11 @@ TEST_F(DrkitTest, RegistersListsFiltersAndRemoves) {
 
   EXPECT_EQ(ok({"remove", a}), "");
   EXPECT_EQ(ok({"match", "-p", kPoint}), "  com.example.b (2.0)\n");
-  // drd's refusals: message and code on standard error.
   refused({"remove", a}, "drkit: no plugin at " + a + " (bad path, code 9)\n");
   refused({"add", root() + "/missing.appex"},
           "drkit: invalid plugin path: " + root() + "/missing.appex (bad path, code 9)\n");
   refused({"match", "--all"},
           "drkit: unauthorized discovery flag (DRDiscoverAll) (not permitted, code 11)\n");
-}
-
-TEST_F(DrkitTest, ElectionsAndSettingsAreRecorded) {
-  ok({"add", makePlugIn("a"), makePlugIn("b")});
-  const std::pair<std::string, std::string> rows[] = {
-      {"use", "+ com.example.a (1.0)\n  com.example.b (1.0)\n"},
-      {"ignore", "- com.example.a (1.0)\n  com.example.b (1.0)\n"},
-      {"default", "  com.example.a (1.0)\n  com.example.b (1.0)\n"},
-  };
-  for (const auto& [choice, listing] : rows) {
-    EXPECT_EQ(ok({"elect", "-i", "com.example.a", choice}), "");
-    EXPECT_EQ(ok({"match"}), listing) << choice;
-  }
-  refused({"elect", "-i", "com.example.none", "use"},
-          "drkit: no plug-in with identifier 'com.example.none'\n");
-  // Settings change key by key; the election stays.
-  ok({"elect", "-i", "com.example.b", "use"});
-  EXPECT_EQ(ok({"annotate", "-i", "com.example.b", "color=red", "size=3", "note=a=b"}), "");
-  EXPECT_EQ(ok({"annotate", "-i", "com.example.b", "--unset", "color", "size=4"}), "");
-  EXPECT_EQ(ok({"annotate", "-i", "com.example.b"}), "{\"note\":\"a=b\",\"size\":\"4\"}\n");
-  EXPECT_EQ(ok({"match", "-i", "com.example.b"}), "+ com.example.b (1.0)\n");
-  EXPECT_EQ(ok({"annotate", "-i", "com.example.a"}), "{}\n");
 }
 
 TEST_F(DrkitTest, AccessTokensGrantTheBundleAndReadyChecksThePlugIn) {
@@ -155,8 +122,7 @@ TEST_F(DrkitTest, AccessTokensGrantTheBundleAndReadyChecksThePlugIn) {
   }
 }
 
-// A hold lasts until drkit's input ends, a signal, a release by its token
-// from any process, or drd's end (then drkit says the hold is gone).
+// A hold lasts until input ends, a signal, a release by token, or drd's end (drkit says so).
 TEST_F(DrkitTest, HoldLastsUntilInputEndsOrASignalOrARelease) {
   const std::string a = makePlugIn("a");
   ok({"add", a});
@@ -197,7 +163,6 @@ TEST_F(DrkitTest, HoldLastsUntilInputEndsOrASignalOrARelease) {
 
 TEST_F(DrkitTest, ExclusionsHidePlugInsAndKeepTheRestOfTheFile) {
   ok({"add", makePlugIn("a"), makePlugIn("b")});
-  // Another setting of the same preferences file survives drkit's edits.
   registry_test::WriteBytes(w.prefsFile(), "{\"other\": \"kept\"}");
   ok({"exclude", "add", "-i", "com.example.a"});
   EXPECT_EQ(ok({"exclude", "list"}), "1: {\"UXExtensionIdentifier\":\"com.example.a\"}\n");
@@ -263,8 +228,7 @@ TEST_F(DrkitTest, RawSendsAnyRequestAndStatusTellsWhetherDrdAnswers) {
       << r.err;
 }
 
-// --json on every verb that prints: one line of JSON, with the fields the
-// text shows.
+// --json on every verb that prints: one line of JSON, with the fields the text shows.
 TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
   const std::string a = makePlugIn("a");
   ok({"add", a, makePlugIn("b")});
@@ -273,8 +237,6 @@ TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
   ok({"exclude", "add", "-i", "com.example.b"});
   const std::string access = ok({"access", uuid});
   const std::string token = access.substr(0, access.find('\n'));
-  // The value at `path` (keys, or indexes of arrays) of the output; any
-  // value there when `expected` is absent.
   const struct {
     std::vector<std::string> args, path;
     Value expected;
@@ -296,7 +258,6 @@ TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
       {{"raw", "--json", R"({"request": "match", "version": 2})"},
        {"matches", "0", "identifier"},
        Value("com.example.a")},
-      // Standard input ends at once: the hold is placed, printed, released.
       {{"hold", "--plugin", a, "--json"}, {"token"}, Value()},
   };
   for (const auto& row : rows) {
@@ -315,7 +276,6 @@ TEST_F(DrkitTest, JsonOutputOfEveryVerbThatPrints) {
 
 TEST_F(DrkitTest, ExplainTellsTheFateOfEveryCopy) {
   ok({"add", makePlugIn("a", "1.0"), makePlugIn("b", "1.0")});
-  // A second copy of com.example.a, newer, in another application.
   const std::string newer = makePlugIn("a", "2.0", kPoint, "Apps/Other.app");
   ok({"add", newer});
   const std::string older = root() + "/Apps/Host.app/Contents/PlugIns/a.appex";
@@ -338,7 +298,6 @@ TEST_F(DrkitTest, ExplainTellsTheFateOfEveryCopy) {
       "    discovery: excluded by the user: { \"UXExtensionIdentifier\": \"com.example.a\" }\n");
   explains({"explain", newer, "-p", "com.example.elsewhere"},
            "    discovery: does not match the host's rules\n");
-  // The administrator's policy is read as drd reads it.
   registry_test::WriteBytes(root() + "/policy.pdoc", R"({"DeniedPlugIns": ["com.example.b"]})");
   EXPECT_EQ(ok({"match", "-i", "com.example.b"}), "");
   explains({"explain", "com.example.b"}, "    discovery: denied by the administrator's policy\n");
@@ -360,8 +319,7 @@ TEST_F(DrkitTest, HostExampleDiscoversAndReadiesAPlugIn) {
   EXPECT_EQ(nothing.err(), "no plug-in to ready\n");
 }
 
-// What the process prints and its exit status for a bad command line (the
-// cases are in the unit tests) and for help.
+// Exit status and output for a bad command line (cases in the unit tests) and for help.
 TEST(DrkitProcessTest, UsageErrorsExit2AndHelpExits0) {
   TempFolder root;
   const struct {

@@ -1,5 +1,3 @@
-// Install folders end to end: a real drd following real folders with
-// inotify, and the registry it keeps across restarts.
 #include <signal.h>
 #include <unistd.h>
 
@@ -20,8 +18,7 @@ namespace {
 namespace fs = std::filesystem;
 using registry_test::WriteBytes;
 
-// Every registered plug-in as "identifier@version", sorted, once it is
-// `expected` (polling up to ten seconds); the last seen otherwise.
+// Registered plug-ins as sorted "identifier@version" once `expected` (up to 10 s), else the last.
 std::string Installed(const World& w, const std::string& expected = "") {
   std::string seen;
   for (auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
@@ -46,7 +43,6 @@ class InstalledTest : public ::testing::Test {
   uint64_t remove(const std::string& path) const {
     return ErrorCode(w.call(Request("remove", {{"paths", Value(Array{Value(path)})}})));
   }
-  // A plug-in bundle "<name>.appex" with identifier "<name>" in `where`.
   std::string plugIn(const std::string& name, const std::string& version = "1.0",
                      const std::string& where = "installed") const {
     return w.makePlugIn(where + "/" + name + ".appex", name, version);
@@ -55,8 +51,7 @@ class InstalledTest : public ::testing::Test {
   World w;
 };
 
-// Each step changes the folders of a running drd; the registry follows
-// within the settle time, and only when the bundle is whole.
+// The registry follows a running drd's folders within the settle time, once a bundle is whole.
 TEST_F(InstalledTest, FollowsTheFoldersWhileRunning) {
   plugIn("present");
   plugIn("added", "1.0", "elsewhere");
@@ -82,7 +77,6 @@ TEST_F(InstalledTest, FollowsTheFoldersWhileRunning) {
        "added@1.0 dropped@1.0 present@1.0 tool@1.0"},
       {"replaced in place by a new version", [&] { plugIn("present", "2.0"); },
        "added@1.0 dropped@1.0 present@2.0 tool@1.0"},
-      // The marker, written after it, is acted on no sooner.
       {"half-written",
        [&] {
          fs::create_directories(folder("half.appex/Contents"));
@@ -122,15 +116,12 @@ TEST_F(InstalledTest, FollowsTheFoldersWhileRunning) {
     step.change();
     EXPECT_EQ(Installed(w, step.expected), step.expected) << w.log();
   }
-  // The linked bundle was known under its own path, not the link's.
   EXPECT_NE(w.log().find("INSTALLED:linked.bundle linked(1.0)"), std::string::npos);
   EXPECT_NE(w.log().find(w.path("outside/linked.appex")), std::string::npos);
-  // A bundle that cannot be registered is logged once, not at every scan.
   EXPECT_EQ(Occurrences(w.log(), folder("Broken.appex")), 1u) << w.log();
 }
 
-// What changed while drd was down is found at start; the user's removal
-// and the bundles registered by "add" from elsewhere stay as they were.
+// Changes made while drd was down are found at start; removals and "add"ed bundles stay.
 TEST_F(InstalledTest, RestartReconciles) {
   plugIn("kept");
   plugIn("deleted");
@@ -150,16 +141,12 @@ TEST_F(InstalledTest, RestartReconciles) {
   ASSERT_TRUE(w.start({"DR_PLUGIN_PATH=" + folder()})) << w.log();
   EXPECT_EQ(Installed(w, "added@1.0 kept@1.0 updated@2.0"), "added@1.0 kept@1.0 updated@2.0");
   EXPECT_EQ(w.uuidOf("kept"), kept) << "an unchanged bundle is registered again";
-  // drkit explain tells where a plug-in came from, and who removed one.
   Ran from = RunDrkit(w.root(), {"explain", "kept"});
   EXPECT_NE(from.out.find("    install folder: " + folder() + "\n"), std::string::npos) << from.out;
   Ran removed = RunDrkit(w.root(), {"explain", folder("removed.appex")});
   EXPECT_NE(removed.out.find(": not registered: removed by the user on "), std::string::npos)
       << removed.out;
 
-  // An install folder taken off the list takes its bundles with it, but
-  // not those registered by "add" from elsewhere; with DR_PLUGIN_PATH empty
-  // the default install folder is not looked at either.
   ASSERT_TRUE(w.stop());
   w.makePlugIn("data/dromon/PlugIns/stray.appex", "stray");
   ASSERT_TRUE(w.start({"DR_PLUGIN_PATH="})) << w.log();

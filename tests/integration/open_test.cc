@@ -1,6 +1,3 @@
-// Opening read tokens: a host that cannot reach a plug-in's files hands drd
-// the token and reads through the descriptor drd sends back. The sandbox is
-// a real one (bubblewrap) that shows the host only what it binds in.
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/socket.h>
@@ -22,9 +19,8 @@ namespace {
 
 constexpr const char* kBwrap = "/usr/bin/bwrap";
 
-// bwrap's arguments for a process that sees the system's programs and
-// libraries, the build tree, and the folders in `binds` (read-write), and
-// nothing else of the file system; `extra` comes last.
+// bwrap arguments: system programs and libraries, the build tree and `binds` (read-write) only;
+// `extra` comes last.
 std::vector<std::string> Sandbox(const std::vector<std::string>& binds,
                                  const std::vector<std::string>& extra = {}) {
   std::vector<std::string> args{
@@ -63,7 +59,6 @@ class OpenTest : public ::testing::Test {
     token = reply["extensions"].at(0).stringValue();
   }
 
-  // `argv` run inside the sandbox with `binds` bound in.
   Ran sandboxed(const std::vector<std::string>& binds, std::vector<std::string> argv) {
     std::vector<std::string> all = Sandbox(binds, argv);
     Child child(all[0], std::vector<std::string>(all.begin() + 1, all.end()),
@@ -88,7 +83,6 @@ TEST_F(OpenTest, SandboxedHostReadsThePlugInOnlyThroughItsToken) {
   } rows[] = {
       {{w.path("sockets")}, {drkit, "extension", "open", token, "Contents/Info.pdoc"}, 0, info},
       {{w.path("sockets")}, {drkit, "extension", "open", token}, 0, "Contents\n"},
-      // The path itself is out of the sandbox's reach.
       {{}, {"/usr/bin/cat", plugIn + "/Contents/Info.pdoc"}, 1, ""},
   };
   ASSERT_FALSE(info.empty());
@@ -124,14 +118,12 @@ TEST_F(OpenTest, BadTokensOpenNothing) {
     EXPECT_EQ(ErrorText(reply), row.error);
   };
   for (const Row& row : rows) check(row);
-  // A folder swapped for a link is not followed, and a deleted one is gone.
   const std::string moved = w.path("elsewhere.appex");
   std::filesystem::rename(plugIn, moved);
   std::filesystem::create_directory_symlink(moved, plugIn);
   check({"link", Value(token), 9, "cannot open " + plugIn + ": " + std::to_string(ELOOP)});
   std::filesystem::remove(plugIn);
   check({"gone", Value(token), 9, "cannot open " + plugIn + ": " + std::to_string(ENOENT)});
-  // Connections are closed behind their replies.
   EXPECT_TRUE(Eventually([&] { return OpenDescriptors(w.drd().pid()) <= before; }));
 }
 
@@ -179,7 +171,6 @@ TEST_F(OpenTest, RequestsMayNotCarryDescriptors) {
 }
 
 TEST_F(OpenTest, AHostInsideAFlatpakIsSandboxed) {
-  // A manager host may list everything only while it is not confined.
   const std::string marker = w.path("flatpak-info");
   registry_test::WriteBytes(marker, "[Application]\nname=com.example.Manager\n");
   for (bool flatpak : {false, true}) {

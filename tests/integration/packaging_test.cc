@@ -1,6 +1,3 @@
-// drd as it is installed and first met: the example application's plug-ins
-// register and are usable through a running drd, and drd started the way its systemd units start it
-// serves the socket it is handed and reports itself ready.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -43,9 +40,6 @@ std::string ExamplesDir() {
 }
 std::string GalleryApp() { return ExamplesDir() + "/Gallery.app"; }
 
-// What each example plug-in must register as once its SDK is merged in:
-// bundle, identifier, protocol, point name, hub protocol version, version,
-// and the SDK's CleanTimeout where the SDK reaches the plug-in's dictionary.
 struct ExamplePlugIn {
   std::string bundle, identifier, protocol, pointName;
   uint64_t hubProtocolVersion;
@@ -53,27 +47,20 @@ struct ExamplePlugIn {
   Value cleanTimeout;
 };
 const ExamplePlugIn kExamples[] = {
-    // One multiple bundle: each plug-in states its own protocol and point,
-    // since the SDK completes the bundle's top dictionary only.
     {"Adjust.appex", "org.example.gallery.filter.brightness", kFilterProtocol, kFilterPoint, 2,
      "2.0", Value()},
     {"Adjust.appex", "org.example.gallery.filter.contrast", kFilterProtocol, kFilterPoint, 2, "2.0",
      Value()},
     {"Presets.appex", "org.example.gallery.presets", "#Data", "org.example.gallery.presets", 2,
      "1.0", Value()},
-    // New style: protocol and point name come from the SDK.
     {"Sepia.appex", "org.example.gallery.filter.sepia", kFilterProtocol, kFilterPoint, 2, "1.2",
      Value(30)},
-    // Old style ("Dromon"): converted, then completed from the same SDK.
     {"Vignette.appex", "org.example.gallery.filter.vignette", kFilterProtocol, kFilterPoint, 1,
      "0.9", Value(30)},
 };
 
-// What ./dev examples does, through a real drd with the examples' SDK folder
-// on DR_SDK_PATH: install Gallery by copying it into the install folder
-// while drd runs (no "add"); every plug-in of every bundle registers as the
-// table says (an example added without its row fails), is found by the
-// rules a host would send, and readies.
+// As ./dev examples: Gallery copied into the install folder of a running drd registers every
+// plug-in as the table says (one without its row fails), is found by a host's rules, and readies.
 TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
   std::set<std::string> onDisk, listed;
   for (const auto& e : std::filesystem::directory_iterator(GalleryApp() + "/Contents/PlugIns")) {
@@ -92,7 +79,6 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
     ASSERT_LT(std::chrono::steady_clock::now(), deadline) << w.log();
     std::this_thread::sleep_for(100ms);
   }
-  // The application holds plug-ins but is none itself.
   EXPECT_EQ(ErrorCode(w.add({gallery})), 2u);
   Array all;
   for (const Value forms = w.match(); const Value& form : forms.array()) {
@@ -122,7 +108,6 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
        brightness + " " + contrast + " " + sepia + " org.example.gallery.filter.vignette"},
       {Value{{"UXExtensionPointName", "org.example.gallery.presets"}},
        "org.example.gallery.presets"},
-      // Activation rules: image/* takes any image type, up to its count.
       {Value{{"AcceptedTypes", Value{{"image/png", 1}}}},
        brightness + " " + contrast + " " + sepia},
       {Value{{"AcceptedTypes", Value{{"image/jpeg", 1}}}},
@@ -132,22 +117,17 @@ TEST(ExamplesTest, DrdRegistersFindsAndReadiesTheExamples) {
   for (const auto& [rules, identifiers] : rows) {
     EXPECT_EQ(World::Identifiers(w.match(rules)), identifiers) << rules.description();
   }
-  // Readying hands each filter's executable to the service manager, so a
-  // missing or non-executable Exec/ file fails here; the data plug-in needs
-  // none.
   Value readied = w.call(Request("ready", {{"uuids", Value(all)}}));
   EXPECT_EQ(ErrorCode(readied), 0u) << readied.description() << w.log();
 }
 
 // ---- Socket activation, as drd.socket and drd.service run it -----------------
 
-// A Unix socket bound at `path`: a listening stream socket made as systemd
-// makes it (folder 0700, socket 0600), or a datagram one. -1 on failure.
+// A Unix socket at `path`: a listening one as systemd makes it (0700/0600) or datagram; -1 if not.
 int BoundSocket(const std::string& path, int type) {
   const std::string folder = std::filesystem::path(path).parent_path();
   std::filesystem::create_directories(folder);
   ::chmod(folder.c_str(), 0700);
-  // Above the descriptors the shell moves them to.
   int fd = type == SOCK_STREAM ? ::fcntl(::socket(AF_UNIX, type, 0), F_DUPFD, 64)
                                : ::socket(AF_UNIX, type, 0);
   sockaddr_un addr{};
@@ -160,9 +140,7 @@ int BoundSocket(const std::string& path, int type) {
   return fd;
 }
 
-// Run alone, and after another listening socket passed first (a unit that
-// listens under more than one name): drd serves the one of its own name,
-// reports itself ready, and leaves the socket behind.
+// Alone and after another passed socket: drd serves its own name, is ready, leaves the socket.
 class SocketActivationTest : public ::testing::TestWithParam<bool> {};
 INSTANTIATE_TEST_SUITE_P(PassedFirst, SocketActivationTest, ::testing::Values(false, true));
 
@@ -177,9 +155,6 @@ TEST_P(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehi
   ASSERT_TRUE(listenFd >= 0 && decoyFd >= 0 && notifyFd >= 0);
   struct stat before {};
   ASSERT_EQ(::lstat(socketPath.c_str(), &before), 0);
-  // What systemd execs: the sockets as the first passed descriptors, and
-  // only they open (a socket drd closes must stop listening); the shell's
-  // pid is drd's.
   const std::string l = std::to_string(listenFd), d = std::to_string(decoyFd);
   const std::string fds =
       decoyFirst ? "3<&" + d + " 4<&" + l + " LISTEN_FDS=2" : "3<&" + l + " LISTEN_FDS=1";
@@ -210,8 +185,6 @@ TEST_P(SocketActivationTest, DrdServesThePassedSocketReportsReadyAndLeavesItBehi
   EXPECT_TRUE(reply && reply->header.replyTo == 7u && !reply->body.has("error"));
   drd.signal(SIGTERM);
   EXPECT_EQ(drd.wait(), 0) << drd.err();
-  // The socket is systemd's: still the same file after drd is gone, so the
-  // next client starts drd again.
   struct stat after {};
   ASSERT_EQ(::lstat(socketPath.c_str(), &after), 0) << "drd removed the passed socket";
   EXPECT_EQ(after.st_ino, before.st_ino);

@@ -1,11 +1,6 @@
-// A stand-in host application for the end-to-end tests.
-//
-//   drd_relay_host DRD_SOCKET RELAY_SOCKET
-//
-// Copied into an application bundle's Contents/Exec/ and started from there,
-// it connects to drd, so drd judges the peer by that bundle. It then listens
-// on RELAY_SOCKET, prints "ready", accepts one connection (the test's) and
-// passes bytes both ways until either side closes.
+// drd_relay_host DRD_SOCKET RELAY_SOCKET, run from a bundle's Contents/Exec/: connects
+// to drd (judged by that bundle), prints "ready" and relays one connection on
+// RELAY_SOCKET to drd both ways until either side closes.
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>

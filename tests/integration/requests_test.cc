@@ -1,5 +1,3 @@
-// The requests end to end: a real drd, real bundles, hosts running from
-// inside application bundles.
 #include <unistd.h>
 
 #include <chrono>
@@ -15,9 +13,6 @@
 namespace dr::testing {
 namespace {
 
-using registry_test::ReadBytes;
-using registry_test::WriteBytes;
-
 using message::kDiscoverAllVersions;
 using message::kDiscoverHybrid;
 using message::kDiscoverSystemOnly;
@@ -32,8 +27,7 @@ class RequestsTest : public ::testing::Test {
   World w;
 };
 
-// Pipelined on one connection, every request gets one reply bound to its
-// serial, in order; a failure carries only the code and the error.
+// Pipelined, each request gets one reply bound to its serial, in order; failures: code and error.
 TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
   const std::string a = w.makePlugIn("system/a.appex", "com.example.a");
   const Value v2(uint64_t{2});
@@ -51,8 +45,6 @@ TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
        "invalid request format (missing type)"},
       {Request("Match"), 4, "unrecognized request"},
       {Request("frobnicate"), 4, "unrecognized request"},
-      // Every name reaches its own handler: bare, each fails its own way or
-      // has nothing to do.
       {Request("add"), 4, "invalid request format"},
       {Request("remove"), 4, "invalid request format"},
       {Request("bulk"), 0, ""},
@@ -63,7 +55,6 @@ TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
       {Request("annotate"), 4, "invalid request format (bad annotations dictionary)"},
       {Request("lock"), 4, "invalid request format"},
       {Request("add", {{"paths", Value(Array{Value(uint64_t{1})})}}), 4, "invalid request format"},
-      // The paths before a bad one are registered.
       {Request("add", {{"paths", Value(Array{Value(a), Value("rel/b.appex")})}}), 9,
        "absolute path required: rel/b.appex"},
       {Request("ready", {{"uuids", Value(Array{Value("x")})}}), 4,
@@ -73,7 +64,6 @@ TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
       {Request("match", {{"rules", "x"}}), 4, "invalid request format (bad rules dictionary)"},
   };
   Drm1Peer peer(w.drd().socketPath());
-  // A message that wants no reply is processed without one.
   ASSERT_TRUE(peer.send(1, Request("match"), false));
   for (size_t i = 0; i < std::size(rows); ++i) ASSERT_TRUE(peer.send(10 + i, rows[i].request));
   for (size_t i = 0; i < std::size(rows); ++i) {
@@ -93,39 +83,6 @@ TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
   EXPECT_NE(w.log().find("bulk options 0x1f not supported"), std::string::npos);
 }
 
-TEST_F(RequestsTest, AddAndRemoveStopAtTheFirstBadPath) {
-  const std::string a = w.makePlugIn("system/a.appex", "com.example.a");
-  const std::string c = w.makePlugIn("system/c.appex", "com.example.c");
-  const std::string missing = w.path("system/missing.appex");
-  const std::string junk =
-      registry_test::MakeBundle(w.path("system/junk.appex"), Value{{"BNBundleIdentifier", "j"}});
-  const struct {
-    std::vector<std::string> paths;
-    uint64_t code;
-    std::string error;
-  } rows[] = {
-      {{a, missing, c}, 9, "invalid plugin path: " + missing},
-      {{junk}, 2, "unable to register plug-in at " + junk},  // no plug-in dictionary
-      {{}, 0, ""},
-  };
-  for (const auto& row : rows) {
-    Value reply = w.add(row.paths);
-    EXPECT_EQ(ErrorCode(reply), row.code) << row.error;
-    EXPECT_EQ(ErrorText(reply), row.error);
-  }
-  EXPECT_EQ(World::Identifiers(w.match()), "com.example.a");
-  EXPECT_NE(w.log().find("failed to register plug-in at " + junk), std::string::npos);
-  EXPECT_EQ(ErrorCode(w.add({c})), 0u);
-  // A bundle gone from disk is still unregistered under the path sent.
-  std::filesystem::remove_all(c);
-  auto remove = [&](Array paths) {
-    return ErrorText(w.call(Request("remove", {{"paths", Value(std::move(paths))}})));
-  };
-  EXPECT_EQ(remove({Value(c), Value(a)}), "");
-  EXPECT_EQ(World::Identifiers(w.match()), "");
-  EXPECT_EQ(remove({Value(a)}), "no plugin at " + a);
-}
-
 TEST_F(RequestsTest, WhatEachHostIsOffered) {
   w.makeApp("Host.app", "com.example.host");
   w.makeApp("Other.app", "com.example.other");
@@ -140,7 +97,6 @@ TEST_F(RequestsTest, WhatEachHostIsOffered) {
           w.makePlugIn("Host.app/Contents/PlugIns/own.appex", "com.example.own", "1.0", dedicated),
           w.makePlugIn("loose/free.appex", "com.example.free"),
           w.makePlugIn("system/hy.appex", "com.example.hy", "1.0", {{"EmbeddedCode", "lib"}}),
-          // Two copies: the newer version wins unless all are asked for.
           w.makePlugIn("A.app/Contents/PlugIns/p.appex", "com.example.p", "1.2"),
           w.makePlugIn("B.app/Contents/PlugIns/p.appex", "com.example.p", "1.10"),
       })),
@@ -167,7 +123,6 @@ TEST_F(RequestsTest, WhatEachHostIsOffered) {
   const Value p = w.match(Value{{"UXExtensionIdentifier", "com.example.p"}});
   ASSERT_EQ(p.size(), 1u);
   EXPECT_EQ(p.at(0)["version"].stringValue(), "1.10");
-  // The privileged view needs the manager entitlement.
   Value reply =
       w.call(Request("match", {{"flags", Value(message::kDiscoverAll)}}), host->connection());
   EXPECT_EQ(ErrorCode(reply), 11u);
@@ -175,29 +130,14 @@ TEST_F(RequestsTest, WhatEachHostIsOffered) {
   EXPECT_EQ(w.everything().size(), 7u);  // one copy of com.example.p
 }
 
-TEST_F(RequestsTest, UserExclusionsAndAdministratorPolicyHideAPlugIn) {
-  w.add({w.makePlugIn("system/a.appex", "com.example.a"),
-         w.makePlugIn("system/b.appex", "com.example.b"),
-         w.makePlugIn("system/c.appex", "com.example.c")});
-  WriteBytes(w.prefsFile(),
-             "{\"exclusions\": [{\"UXExtensionIdentifier\": \"com.example.b\"}, 3]}");
-  WriteBytes(w.path("policy.pdoc"), "{\"DeniedPlugIns\": [\"com.example.c\"]}");
-  EXPECT_EQ(World::Identifiers(w.match()), "com.example.a");
-  EXPECT_NE(w.log().find("plugin com.example.b excluded"), std::string::npos);
-  EXPECT_NE(w.log().find("plugin com.example.c rejected by Keeper"), std::string::npos);
-}
-
-// A plug-in whose form no reply could carry is refused by "add", so that
-// discovery still finds the others; settings are held to the same bound
-// (two levels lower in a form than in the request).
+// A form no reply could carry is refused by "add"; settings get the same bound (two levels lower).
 TEST_F(RequestsTest, PlugInNestedTooDeepForAReplyIsRefused) {
   auto nested = [](int depth) {
     Value v("bottom");
     for (int level = 0; level < depth; ++level) v = Value(Array{v});
     return v;
   };
-  // The reply, "matches", the form, "bundleInfo", "UXExtension", "Deep": 59
-  // arrays reach the 64 levels a message may nest.
+  // Reply, "matches", form, "bundleInfo", "UXExtension", "Deep" + 59 arrays: the 64 levels allowed.
   ASSERT_EQ(ErrorCode(w.add({w.makePlugIn("system/fits.appex", "com.example.fits", "1.0",
                                           {{"Deep", nested(59)}})})),
             0u);
@@ -219,8 +159,7 @@ TEST_F(RequestsTest, PlugInNestedTooDeepForAReplyIsRefused) {
   EXPECT_EQ(World::Identifiers(w.match()), "com.example.fits") << w.log();
 }
 
-// A reply over the wire's 256 MiB is answered with an error instead, and
-// the connection goes on serving.
+// A reply over the wire's 256 MiB is answered with an error; the connection goes on serving.
 TEST_F(RequestsTest, ReplyTooLargeForTheWireIsAnsweredWithAnError) {
   // Each form carries the 8 MiB text twice: in "bundleInfo" and in "info".
   const std::string big(size_t{8} << 20, 'x');
@@ -238,69 +177,6 @@ TEST_F(RequestsTest, ReplyTooLargeForTheWireIsAnsweredWithAnError) {
     ASSERT_TRUE(ErrorText(reply).starts_with("reply cannot be sent: ")) << ErrorText(reply);
   }
   EXPECT_EQ(ErrorCode(w.call(Request("bulk"), c.get())), 0u);
-}
-
-TEST_F(RequestsTest, ReplacementIsMarkedOnBothForms) {
-  w.add({w.makePlugIn("system/old.appex", "com.example.old"),
-         w.makePlugIn("system/new.appex", "com.example.new", "1.0", {},
-                      Value{{"com.corvel.developer.replace-plugin", "com.example.old"}})});
-  Value matches = w.match();
-  ASSERT_EQ(matches.size(), 2u);
-  for (const Value& form : matches.array()) {
-    if (form["identifier"].stringValue() == "com.example.old") {
-      EXPECT_EQ(form["overrider"].stringValue(), w.uuidOf("com.example.new").description());
-    } else {
-      EXPECT_EQ(form["overriding"].stringValue(), "com.example.old");
-    }
-  }
-}
-
-TEST_F(RequestsTest, AnnotationsAreMergedNotifiedAndKeptAcrossRestart) {
-  w.add({w.makePlugIn("system/a.appex", "com.example.a"),
-         w.makePlugIn("system/b.appex", "com.example.b")});
-  const Value a = w.uuidOf("com.example.a");
-  const Value b = w.uuidOf("com.example.b");
-  auto annotate = [&](Dictionary annotations, Value list) {
-    return w.call(Request(
-        "annotate", {{"annotations", Value(std::move(annotations))}, {"uuids", std::move(list)}}));
-  };
-  const std::string counter = w.path("notify/com.corvel.dromon.annotation-change");
-  // Nothing to change: succeeds without looking at "uuids", posts nothing.
-  EXPECT_EQ(ErrorCode(annotate({{"other", 1}}, Value("junk"))), 0u);
-  EXPECT_EQ(ReadBytes(counter), "");
-  EXPECT_EQ(ErrorCode(annotate({{"election", 1}}, Uuids({a, b}))), 0u);
-  EXPECT_EQ(ReadBytes(counter), "2\n");
-  EXPECT_EQ(ErrorCode(annotate({{"extension", Value{{"size", 3}}}}, Uuids({a}))), 0u);
-  const struct {
-    Dictionary annotations;
-    std::string error;
-  } bad[] = {
-      {{{"election", "yes"}}, "invalid request format (annotation election)"},
-      {{{"election", true}}, "invalid request format (annotation election)"},
-      {{{"extension", 3}}, "invalid request format (annotation extension)"},
-      // The annotation file cannot hold a UUID.
-      {{{"extension", Value{{"id", Value(Uuid::random())}}}},
-       "invalid request format (annotation extension)"},
-  };
-  for (const auto& row : bad) {
-    Value reply = annotate(row.annotations, Uuids({a}));
-    EXPECT_EQ(ErrorCode(reply), 4u) << row.error;
-    EXPECT_EQ(ErrorText(reply), row.error);
-  }
-  // An unknown UUID in the middle: the plug-ins before it are annotated.
-  Value reply = annotate({{"election", 0}}, Uuids({b, Value(Uuid::random()), a}));
-  EXPECT_EQ(ErrorText(reply), "no such plugin (uuid not found)");
-
-  ASSERT_TRUE(w.restart()) << w.log();
-  for (const Value forms = w.match(); const Value& form : forms.array()) {
-    EXPECT_EQ(form["annotations"], form["uuid"].stringValue() == a.description()
-                                       ? (Value{{"election", 1}, {"extension", Value{{"size", 3}}}})
-                                       : (Value{{"election", 0}}));
-  }
-  // One report per change of election: a and b elected, then b unelected.
-  const std::string usage = ReadBytes(w.path("usage.log"));
-  EXPECT_EQ(Occurrences(usage, "\"Enabled\""), 2u) << usage;
-  EXPECT_EQ(Occurrences(usage, "\"Disabled\""), 1u) << usage;
 }
 
 TEST_F(RequestsTest, ReadyChecksEveryPlugInBeforeEnablingAny) {
@@ -328,15 +204,12 @@ TEST_F(RequestsTest, ReadyChecksEveryPlugInBeforeEnablingAny) {
   EXPECT_NE(
       log.find("enabling pid=" + std::to_string(host->pid()) + " for plug-in com.example.open"),
       std::string::npos);
-  // The refused request enabled nothing, not even the allowed plug-in; one
-  // named twice is enabled once; the data plug-in needs nothing.
   EXPECT_EQ(log.find("enabling pid=" + std::to_string(plain->pid())), std::string::npos);
   EXPECT_EQ(Occurrences(log, "for plug-in com.example.open"), 1u);
   EXPECT_EQ(log.find("for plug-in com.example.data"), std::string::npos);
 }
 
-// One token per UUID asked for; a bundle folder swapped for a link to /etc
-// is refused (EACCES) rather than signed, and its form carries no token.
+// One token per UUID; a bundle swapped for a link to /etc is refused (EACCES), and has no token.
 TEST_F(RequestsTest, AccessHandsOutOneTokenPerUuid) {
   const std::string a = w.makePlugIn("system/a.appex", "com.example.a");
   w.add({a});
@@ -357,8 +230,7 @@ TEST_F(RequestsTest, AccessHandsOutOneTokenPerUuid) {
   EXPECT_EQ(w.everything().at(0)["extensions"].size(), 0u);
 }
 
-// A hold hides and refuses its plug-ins for as long as the connection that
-// placed it lives.
+// A hold hides and refuses its plug-ins as long as the connection that placed it lives.
 TEST_F(RequestsTest, HoldsHideAndRefuseUntilTheirHostDies) {
   w.makeApp("Host.app", "com.example.host");
   w.add({w.makePlugIn("Host.app/Contents/PlugIns/p.appex", "com.example.p")});
@@ -388,9 +260,7 @@ TEST_F(RequestsTest, HoldsHideAndRefuseUntilTheirHostDies) {
   EXPECT_TRUE(Eventually([&] { return w.match().size() == 1; })) << w.log();
 }
 
-// A running instance of a plug-in refuses a hold of its application, by the
-// plug-in's version (which may differ from its bundle's); naming the one
-// plug-in holds it all the same.
+// A running plug-in refuses a hold of its application (by its own version); naming it holds it.
 TEST_F(RequestsTest, BusyPlugInRefusesAnApplicationHold) {
   const Dictionary rows[] = {{}, {{"UXExtensionAttributes", Value{{"UXExtensionVersion", "1.0"}}}}};
   int n = 0;
