@@ -1,5 +1,4 @@
-// Real bundles in a fresh temporary folder (removed when destroyed), and
-// environment variables set for the life of a test, for the plug-in model.
+// Real bundles in a temporary folder, and environment variables set for a test's life.
 #pragma once
 
 #include <optional>
@@ -18,19 +17,14 @@ class BundleFixture {
   BundleFixture& operator=(const BundleFixture&) = delete;
 
   const std::string& root() const { return root_.path(); }
-  // root()/relative
   std::string path(const std::string& relative) const;
 
-  // Makes the bundle folder root()/relative with Contents/Info.pdoc holding
-  // `info` (no file when absent); with `executable`, also an executable file
-  // Contents/Exec/<executable>. Answers the bundle's path.
+  // root()/relative with Contents/Info.pdoc holding `info` (none when absent) and, with
+  // `executable`, Contents/Exec/<executable>; the bundle's path.
   std::string makeBundle(const std::string& relative, const Value& info,
                          const std::optional<std::string>& executable = std::nullopt);
-  // Writes `value` as a pdoc file at root()/relative (parents made).
   std::string writePdoc(const std::string& relative, const Value& value);
-  // Writes raw bytes at root()/relative (parents made).
   std::string writeFile(const std::string& relative, const std::string& bytes);
-  // Makes the folder root()/relative and its parents.
   std::string makeFolder(const std::string& relative);
 
  private:

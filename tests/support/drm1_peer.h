@@ -1,5 +1,4 @@
-// A blocking DRM1 test peer on a real Unix socket, and a drd process started
-// from the build tree in a fresh temporary environment.
+// A blocking DRM1 peer on a real Unix socket, and a drd of the build tree in a temporary world.
 #pragma once
 
 #include <sys/types.h>
@@ -23,8 +22,6 @@ class Drm1Peer {
   Drm1Peer& operator=(const Drm1Peer&) = delete;
 
   bool connected() const { return connected_; }
-  // The socket, for tests that act on it directly (shutdown from another
-  // thread, for instance).
   int fd() const { return fd_; }
   // False when not every byte could be written.
   bool sendRaw(const std::string& bytes);
@@ -44,12 +41,9 @@ class Drm1Peer {
   drm1::FrameDecoder decoder_{drm1::kFromDaemon};
 };
 
-// A drd of the build tree (../daemon/drd next to the test binary's folder),
-// run with its own DR_SOCKET_DIR, DR_REGISTRY, XDG_STATE_HOME,
-// XDG_CONFIG_HOME, XDG_DATA_HOME, DR_NOTIFY_DIR, DR_USAGE_LOG, DR_POLICY
-// (root/policy.pdoc) and DR_SYSTEM_ROOTS (root/system) under `root`, plus
-// `environment` ("NAME=value" entries, which win). Its standard error goes
-// to a file. Killed (SIGKILL) when destroyed while still running.
+// drd with DR_SOCKET_DIR, DR_REGISTRY, XDG_*, DR_NOTIFY_DIR, DR_USAGE_LOG, DR_POLICY and
+// DR_SYSTEM_ROOTS under `root`, then `environment` (which wins); standard error to a file;
+// SIGKILLed when destroyed while running.
 class DrdProcess {
  public:
   DrdProcess(const std::string& root, std::vector<std::string> arguments,
@@ -62,8 +56,7 @@ class DrdProcess {
 
   pid_t pid() const { return pid_; }
   std::string socketPath(const std::string& serviceName = "com.corvel.dromon.drd") const;
-  // Waits until the socket accepts connections; false when drd exited first
-  // or the time ran out.
+  // False when drd exited first or the time ran out.
   bool waitUntilServing(const std::string& serviceName = "com.corvel.dromon.drd");
   // Waits for the exit; the exit status, or -1 on a signal or timeout.
   int waitForExit(std::chrono::milliseconds timeout = std::chrono::milliseconds(10000));

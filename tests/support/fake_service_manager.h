@@ -1,6 +1,4 @@
-// A service manager whose SDK registry, busy instances and removal answers
-// are tables in memory, for tests of the plug-in model and the daemon. It
-// counts the lookups it answers and records every call it gets.
+// A service manager answering SDKs, busy instances and removals from tables; it records calls.
 #pragma once
 
 #include <sys/types.h>
@@ -24,20 +22,16 @@ class FakeServiceManager : public ServiceManager {
   std::map<std::string, Result<Value>> sdks;
   int lookups = 0;
 
-  // Every grant addExternalService got.
   std::vector<ExternalServiceGrant> grants;
 
-  // What busyExtensionInstances answers: the instances whose identifier was
-  // asked for, in this order, or this error.
+  // busyExtensionInstances: those of `instances` asked for, in order, or `busyError`.
   std::vector<BusyExtensionInstance> instances;
   std::optional<Error> busyError;
   std::vector<std::vector<std::string>> busyQueries;
-  // Called first by busyExtensionInstances, on the asking thread: lets a test
-  // hold a request at that point.
+  // Run first by busyExtensionInstances on the asking thread (to hold a request there).
   std::function<void()> onBusyQuery;
 
-  // (identifier, version) → what removeExternalServiceInstance answers;
-  // kNoInstanceRunning for anything not listed.
+  // (identifier, version) → removal result; kNoInstanceRunning otherwise.
   std::map<std::pair<std::string, std::string>, int> removeResults;
   std::vector<std::pair<std::string, std::string>> removals;
 

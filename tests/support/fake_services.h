@@ -1,7 +1,4 @@
-// In-memory stand-ins for the platform services of code signing,
-// preferences, notifications and usage reports, for unit tests of
-// the daemon's own logic. Each records what it was asked and answers what
-// the test set. Not thread-safe unless noted; tests set them up before use.
+// In-memory code signing, preferences, notifications and usage reports that record calls.
 #pragma once
 
 #include <map>

@@ -1,7 +1,5 @@
-// A type service whose conformance is a table in memory, for tests of rule
-// matching: a type conforms to itself and, transitively, to the parents the
-// table lists, compared exactly. Activation rules go through the real
-// evaluator over that table. It records every conformance question.
+// Type conformance from a table (reflexive, transitive, exact); activation rules through the
+// real evaluator. Records every conformance question.
 #pragma once
 
 #include <map>

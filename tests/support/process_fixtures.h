@@ -1,6 +1,4 @@
-// Test fixtures over real files and processes: a temporary folder removed
-// with everything in it, and a running program (a copy of sleep) placed
-// wherever a test needs its executable to lie.
+// A temporary folder removed with its contents, and a copy of sleep running where a test needs.
 #pragma once
 
 #include <sys/types.h>
@@ -19,7 +17,6 @@ class TempFolder {
   TempFolder& operator=(const TempFolder&) = delete;
 
   const std::string& path() const { return path_; }  // canonical
-  // path() + "/" + relative
   std::string operator/(std::string_view relative) const {
     return path_ + "/" + std::string(relative);
   }
@@ -31,9 +28,8 @@ class TempFolder {
 // Writes `bytes` to `path`, making missing folders (0700); false on failure.
 bool WriteTestFile(const std::string& path, const std::string& bytes, mode_t mode = 0600);
 
-// A copy of the system's sleep program at `executablePath` (folders made; a
-// copy already running there is started again), started and sleeping;
-// killed and reaped when destroyed. pid() is -1 when it could not be started.
+// A copy of sleep at `executablePath` (folders made), started; killed and reaped when destroyed.
+// pid() is -1 when it could not be started.
 class RunningProgram {
  public:
   explicit RunningProgram(const std::string& executablePath);

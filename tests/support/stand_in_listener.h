@@ -1,6 +1,4 @@
-// A stand-in for drd in tests of the message service and the client
-// library: a real listener on a real socket whose connections hand every
-// event to the test.
+// A stand-in for drd: a real listener on a real socket handing every event to the test.
 #pragma once
 
 #include <functional>
@@ -12,17 +10,13 @@
 
 namespace dr::testing {
 
-// Called on the connection's own thread; `connection` is null once the
-// connection is gone. Connection threads may deliver a last event after the
-// test that made the listener ended, so the handler must not reach into a
-// test fixture on a connection-invalid event.
+// On the connection's thread; `connection` is null once gone. A last event may come after the
+// test ended, so the handler must not reach into a fixture on a connection-invalid event.
 using StandInHandler =
     std::function<void(const std::shared_ptr<PeerConnection>& connection, const ConnectionEvent&)>;
 
-// The listener at <socketDirectory>/<serviceName> (no socket activation),
-// accepting; each connection gets `handler` and, while the caller keeps it,
-// `context` (the listener itself holds it only weakly). Null (and a test
-// failure) when it cannot be made.
+// Listens at <socketDirectory>/<serviceName>; connections get `handler` and `context` (held
+// weakly by the listener). Null, and a test failure, when it cannot be made.
 std::unique_ptr<Listener> StartStandInListener(const std::string& socketDirectory,
                                                const std::string& serviceName, SerialQueue* queue,
                                                StandInHandler handler,

@@ -1,6 +1,4 @@
-// A real registry in a temporary folder with plug-in bundles registered in
-// it, for tests of services that read the registered bundles. For tests
-// only; not thread-safe.
+// A real registry in a temporary folder with bundles registered, for tests reading them.
 #pragma once
 
 #include <memory>
@@ -12,13 +10,11 @@
 
 namespace dr::test {
 
-// Opens a new registry database in `folder` (made when missing); fails the
-// test and answers null when it cannot.
+// A new registry database in `folder` (made if missing); null and a test failure if not.
 std::unique_ptr<Registry> OpenTestRegistry(const std::string& folder);
 
-// The information dictionary of a plug-in bundle `bundleIdentifier` at
-// `version` (none when absent) whose executable is named `executable`, with
-// the entries of `extra` added.
+// Info of bundle `bundleIdentifier` at `version` (none if absent), executable `executable`, plus
+// `extra`.
 Value PlugInBundleInfo(const std::string& bundleIdentifier,
                        const std::optional<std::string>& version, const std::string& executable,
                        const Value& extra = Value());
