@@ -31,18 +31,15 @@ TEST(FormatTest, RendersEachConversion) {
       {Format("%03d|%-3d|%x|%X", 7, 7, 255, 255), "007|7  |ff|FF"},
       {Format("%.2f|%f", 1.005, 2), "1.00|2.000000"},
       {Format("%5s|", "ab"), "   ab|"},
-      // Mismatches are bugs in the caller but never undefined behaviour.
       {Format("%d and %@"), "(missing) and (missing)"},
       {Format("%d %f", "word", "text"), "word text"},
       {Format("%s", 12), "12"},
       {Format("%@", 1, 2), "1"},
       {Format("trailing %5"), "trailing %5"},
-      {Format("trailing %"), "trailing %"},
-  };
+      {Format("trailing %"), "trailing %"}};
   for (const auto& [got, expected] : rows) EXPECT_EQ(got, expected);
 }
 
-// Whatever bytes a message holds, the log gets one line of UTF-8.
 TEST(FormatTest, LogLinesAreOneLineOfUtf8) {
   const std::pair<std::string, std::string> rows[] = {
       {"plain é ✓ 𝄞\nb\rc", "plain é ✓ 𝄞\\nb\\rc"},

@@ -19,37 +19,25 @@
 namespace dr {
 namespace {
 
-// Counts pieces of work that run while another runs: the queue is the guard.
-struct Alone {
-  std::atomic<int> running{0};
-  std::atomic<bool> overlapped{false};
-  template <typename F>
-  void run(F f) {
-    if (running.fetch_add(1) != 0) overlapped = true;
-    f();
-    running.fetch_sub(1);
-  }
-};
-
-// Holds `q` busy until the answer is set: work submitted meanwhile waits.
 std::promise<void> Hold(SerialQueue& q) {
   std::promise<void> released;
   q.async([f = released.get_future().share()] { f.wait(); });
   return released;
 }
 
-// Threads submit to a TurnQueue, each for a source of its own, beside work
-// they and this thread give the SerialQueue directly by sync and async:
-// every piece runs once, alone, each source's in order (a lost wake-up hangs
-// this test).
 TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
   SerialQueue q("test");
   TurnQueue turns(&q);
   constexpr int kThreads = 128, kEach = 200;
   std::map<uint64_t, std::vector<int>> seen;  // unguarded on purpose: the queue is the guard
-  Alone alone;
+  std::atomic<int> running{0};
+  std::atomic<bool> overlapped{false};
   auto work = [&](uint64_t source, int i) {
-    return [&, source, i] { alone.run([&] { seen[source].push_back(i); }); };
+    return [&, source, i] {
+      if (running.fetch_add(1) != 0) overlapped = true;
+      seen[source].push_back(i);
+      running.fetch_sub(1);
+    };
   };
   std::vector<std::thread> threads;
   for (uint64_t t = 0; t < kThreads; ++t) {
@@ -63,7 +51,7 @@ TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
   for (int i = 0; i < kEach; ++i) i % 3 ? q.async(work(999, i)) : q.sync(work(999, i));
   for (auto& th : threads) th.join();
   q.sync([] {});
-  EXPECT_FALSE(alone.overlapped);
+  EXPECT_FALSE(overlapped);
   ASSERT_EQ(seen.size(), 2u * kThreads + 1);
   for (const auto& [source, items] : seen) {
     EXPECT_EQ(items.size(), source >= 1000 ? kEach / 10 : kEach) << source;
@@ -79,9 +67,6 @@ TEST(SerialQueueTest, RunsWorkOneAtATimeInSubmissionOrder) {
   EXPECT_EQ(ran, 50) << "destruction runs queued work";
 }
 
-// Background priority lowers only its own thread; a queue keeps its maker's
-// priority even when work first reaches it from a background thread. sync()
-// runs on its caller's thread, which then is on the queue.
 TEST(SerialQueueTest, SyncRunsOnTheCallerAndBackgroundLowersOnlyItsThread) {
   auto nice = [] { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); };
   const int caller = nice(), low = std::min(caller + 10, 19);
@@ -113,18 +98,13 @@ TEST(SerialQueueDeathTest, SyncFromItsOwnWorkStopsTheProcess) {
   EXPECT_DEATH(SerialQueue("checked").assertCurrent("needs"), "needs: not on queue \"checked\"");
 }
 
-// Items (source letter, number; z is source 0) submitted while the queue is
-// held: each source's run in order, sources take turns by first arrival, and
-// what a running item submits ("+": its source's next) waits for the round.
 TEST(TurnQueueTest, SourcesTakeTurnsAndEachKeepsItsOrder) {
-  const std::pair<std::string, std::string> cases[] = {
-      {"a1 a2 a3", "a1 a2 a3"},
-      {"a1 a2 a3 b1 b2 c1", "a1 b1 c1 a2 b2 a3"},
-      {"b1 a1 b2 a2 c1", "b1 a1 c1 b2 a2"},
-      {"a1 a2 a3 b1 c1 d1", "a1 b1 c1 d1 a2 a3"},
-      {"z1 z2 f1", "z1 f1 z2"},
-      {"a1+ b1 c1", "a1 b1 c1 a2"},
-  };
+  const std::pair<std::string, std::string> cases[] = {{"a1 a2 a3", "a1 a2 a3"},
+                                                       {"a1 a2 a3 b1 b2 c1", "a1 b1 c1 a2 b2 a3"},
+                                                       {"b1 a1 b2 a2 c1", "b1 a1 c1 b2 a2"},
+                                                       {"a1 a2 a3 b1 c1 d1", "a1 b1 c1 d1 a2 a3"},
+                                                       {"z1 z2 f1", "z1 f1 z2"},
+                                                       {"a1+ b1 c1", "a1 b1 c1 a2"}};
   for (const auto& [submitted, expected] : cases) {
     SerialQueue q("test");
     TurnQueue turns(&q);
@@ -148,8 +128,6 @@ TEST(TurnQueueTest, SourcesTakeTurnsAndEachKeepsItsOrder) {
   }
 }
 
-// A client gone with requests queued: each item still runs once and the
-// client is released after the last, also when the TurnQueue went first.
 TEST(TurnQueueTest, ItemsOfAGoneSourceRunOnceThenReleaseIt) {
   for (bool dropTurnQueue : {false, true}) {
     SerialQueue q("test");

@@ -58,14 +58,12 @@ TEST(ValueTest, NumbersConvertSaturatingAndCompareAcrossKinds) {
       {Value(true), Value(2), false},
       {Value(-1), Value(kUMax), false},
       {Value(kMax), Value(uint64_t{kMax}), true},
-      // Differ by one but are the same double: compared exactly.
-      {Value(int64_t{9007199254740993}), Value(uint64_t{9007199254740992}), false},
+      {Value(int64_t{9007199254740993}), Value(uint64_t{9007199254740992}), false},  // one double
       {Value(std::nan("")), Value(std::nan("")), false},
       {Value(Array{1, "a"}), Value(Array{1.0, "a"}), true},
       {Value(Array{1, "a"}), Value(Array{"a", 1}), false},
       {Value{{"k", 1}}, Value{{"k", true}}, true},
-      {Value{{"k", 1}}, Value{{"k", 1}, {"j", 1}}, false},
-  };
+      {Value{{"k", 1}}, Value{{"k", 1}, {"j", 1}}, false}};
   for (const auto& [a, b, equal] : rows) {
     EXPECT_EQ(a == b, equal) << a.description() << " vs " << b.description();
     EXPECT_EQ(b == a, equal) << b.description() << " vs " << a.description();
@@ -75,8 +73,6 @@ TEST(ValueTest, NumbersConvertSaturatingAndCompareAcrossKinds) {
   EXPECT_FALSE(Value("1").compareNumber(Value(1)).has_value());
 }
 
-// Random changes against std::map as the model: same entries, same order
-// (bytes compared unsigned), same answers.
 TEST(ValueTest, DictionaryChangesAsAnOrderedMapWould) {
   std::map<std::string, int> model;
   Dictionary d;
@@ -86,24 +82,17 @@ TEST(ValueTest, DictionaryChangesAsAnOrderedMapWould) {
     const std::string k = keys[random() % std::size(keys)];
     const int v = static_cast<int>(random() % 1000);
     EXPECT_EQ(d.find(k) == d.end(), !model.contains(k));
-    switch (random() % 4) {
-      case 0:
-        EXPECT_EQ(d.emplace(k, v).second, model.emplace(k, v).second);
-        break;
-      case 1:  // a hint anywhere, right or wrong
-        EXPECT_EQ(d.emplace_hint(d.begin() + random() % (d.size() + 1), k, v)->first, k);
-        model.emplace(k, v);
-        break;
-      case 2:
-        EXPECT_EQ(d.erase(k), model.erase(k));
-        break;
-      case 3:
-        if (!d.empty()) {
-          auto it = d.begin() + static_cast<ptrdiff_t>(random() % d.size());
-          model.erase(it->first.str());
-          d.erase(it);
-        }
-        break;
+    if (const auto op = random() % 4; op == 0) {
+      EXPECT_EQ(d.emplace(k, v).second, model.emplace(k, v).second);
+    } else if (op == 1) {  // a hint anywhere, right or wrong
+      EXPECT_EQ(d.emplace_hint(d.begin() + random() % (d.size() + 1), k, v)->first, k);
+      model.emplace(k, v);
+    } else if (op == 2) {
+      EXPECT_EQ(d.erase(k), model.erase(k));
+    } else if (!d.empty()) {
+      auto it = d.begin() + static_cast<ptrdiff_t>(random() % d.size());
+      model.erase(it->first.str());
+      d.erase(it);
     }
     ASSERT_EQ(d.size(), model.size()) << step;
     auto m = model.begin();
@@ -151,8 +140,6 @@ TEST(KeyTest, KeysBeyondTheSharedLengthOwnACopyAndStillCompareByText) {
   EXPECT_EQ(own, other);
 }
 
-// Threads making the same keys at once share one copy of each text; past the
-// table's bound texts own their copy, and nothing is lost.
 TEST(KeyTest, SharedTableIsRaceFreeAndBounded) {
   constexpr int kThreads = 8, kTexts = 64;
   std::vector<std::vector<Key>> made(kThreads);

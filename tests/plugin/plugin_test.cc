@@ -1,18 +1,12 @@
-// Plug-in records, bundles, the version order, match rules, the rule index and
-// discovery's choices. Values are written as JSON, tables as text.
 #include "plugin/plugin.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cctype>
-#include <filesystem>
-#include <map>
+#include <random>
 #include <sstream>
-#include <string>
-#include <vector>
 
 #include "core/format.h"
 #include "core/log.h"
@@ -23,6 +17,7 @@
 #include "plugin/discovery.h"
 #include "plugin/helpers.h"
 #include "plugin/plugin_core.h"
+#include "plugin/plugin_keys.h"
 #include "plugin/plugin_set.h"
 #include "registry/service_manager_linux.h"
 #include "tests/support/bundle_fixture.h"
@@ -38,27 +33,22 @@ using std::nullopt;
 using Lines = std::vector<std::string>;
 constexpr const char* kPoint = "com.example.point";
 
-// A value written as JSON (a scalar too).
 Value J(std::string_view json) { return pdoc::Parse("[" + std::string(json) + "]")->at(0); }
 
 // A table as text: rows end at ';' (white space around them is dropped), cells at '|'.
 std::vector<Lines> Table(std::string_view text) {
   std::vector<Lines> rows;
-  while (!text.empty()) {
-    std::string_view row = text.substr(0, text.find(';'));
-    text.remove_prefix(std::min(row.size() + 1, text.size()));
-    size_t first = row.find_first_not_of(" \n"), last = row.find_last_not_of(" \n");
-    if (first == std::string_view::npos) continue;
-    row = row.substr(first, last + 1 - first);
-    rows.emplace_back();
-    for (size_t bar; (bar = row.find('|')) != std::string_view::npos; row.remove_prefix(bar + 1))
-      rows.back().emplace_back(row.substr(0, bar));
-    rows.back().emplace_back(row);
+  std::istringstream in{std::string(text)};
+  for (std::string row; std::getline(in, row, ';');) {
+    row.erase(0, row.find_first_not_of(" \n"));
+    row.erase(row.find_last_not_of(" \n") + 1);
+    if (row.empty()) continue;
+    std::istringstream cells(row + "|");
+    for (rows.emplace_back(); std::getline(cells, row, '|');) rows.back().push_back(row);
   }
   return rows;
 }
 
-// A host as the daemon's client connection presents it.
 struct FakeClient : PlugInClient {
   explicit FakeClient(Value e = Value()) : held(std::move(e)) {}
   pid_t pid() const override { return 4242; }
@@ -72,13 +62,13 @@ struct FakeClient : PlugInClient {
 Value PlugInInfo(const std::string& name, const Value& pd = {}, const Value& attrs = {}) {
   Value p = Value(pd.dictionary()).changing("UXExtensionPointIdentifier", kPoint);
   if (!p.has("UXExtensionProtocol")) p = p.changing("UXExtensionProtocol", "Viewer");
-  return Value{{"BNBundleIdentifier", "com.example." + name},
+  const std::string id = "com.example." + name;
+  p = p.changing("UXExtensionAttributes",
+                 Value(attrs.dictionary()).changing("UXExtensionIdentifier", id + ".ext"));
+  return Value{{"BNBundleIdentifier", id},
                {"BNBundleVersion", "2.0"},
                {"BNBundleExecutable", name},
-               {"UXExtension", p.changing("UXExtensionAttributes",
-                                          Value(attrs.dictionary())
-                                              .changing("UXExtensionIdentifier",
-                                                        "com.example." + name + ".ext"))}};
+               {"UXExtension", p}};
 }
 
 Value Sandboxed() { return Value{{"com.corvel.security.app-sandbox", true}}; }
@@ -87,17 +77,14 @@ class PlugInTest : public ::testing::Test {
  protected:
   PlugInTest() { serviceManager.sdks.insert_or_assign(kPoint, Value::EmptyDictionary()); }
 
-  // A new bundle on disk (with its executable) and the registry entry of its plug-in.
   RegistryEntryPtr entry(const Value& info, const Value& entitlements = Value(),
                          RegistryEntry::Fields f = {}, std::string path = "") {
     f.uuid = Uuid::random();
     f.url = path.empty() ? folder / ("p" + std::to_string(++bundles_) + "/A.plugin") : path;
     registry_test::MakeBundle(f.url, info, entitlements);
-    if (auto name = info["BNBundleExecutable"].string()) {
-      std::string exe = f.url + "/Contents/Exec/" + std::string(*name);
-      registry_test::WriteBytes(exe, "#!/bin/sh\n");
-      EXPECT_EQ(::chmod(exe.c_str(), 0755), 0);
-    }
+    const std::string exe = f.url + "/Contents/Exec/" + info["BNBundleExecutable"].stringValue();
+    registry_test::WriteBytes(exe, "#!/bin/sh\n");
+    EXPECT_EQ(::chmod(exe.c_str(), 0755), 0);
     f.plugInIdentifier =
         info["UXExtension"]["UXExtensionAttributes"]["UXExtensionIdentifier"].stringValue();
     std::optional<std::string> entBytes;
@@ -118,6 +105,7 @@ class PlugInTest : public ::testing::Test {
       return testSdk && std::string_view(name) == "DRTEST_SDK" ? testSdk->c_str() : nullptr;
     };
     s.types = types;
+    s.sandbox = sandbox;
     if (versions.empty()) return s;
     s.plugInVersion = [this](const Uuid& uuid) { return versions[uuid.string()]; };
     return s;
@@ -125,20 +113,21 @@ class PlugInTest : public ::testing::Test {
 
   registry_test::TempFolder folder;
   FakeServiceManager serviceManager;
-  ServiceManager* manager = nullptr;   // instead of serviceManager
-  FakeTypeService* types = nullptr;    // none: a type conforms only to itself
-  std::optional<std::string> testSdk;  // the daemon's DRTEST_SDK
+  ServiceManager* manager = nullptr;  // instead of serviceManager
+  FakeTypeService* types = nullptr;   // none: a type conforms only to itself
+  Sandbox* sandbox = nullptr;
+  std::optional<std::string> testSdk;                          // the daemon's DRTEST_SDK
   std::map<std::string, std::optional<std::string>> versions;  // other plug-ins', by UUID
 
-  // A copy of plug-in "com.example.<name>.ext".
   DRDPlugInPtr copy(const std::string& name, const std::string& version, bool system,
-                    double registered, const Value& attrs = {}) {
+                    double registered, const Value& attrs = {}, const Value& pd = {},
+                    const Value& entitlements = Sandboxed()) {
     RegistryEntry::Fields f;
     f.onSystemVolume = system;
     f.registrationDate = Date{registered};
     if (!system) f.containingApplication = RegistryApplication{folder / "App.app", "App"};
-    return make(PlugInInfo(name, {}, attrs).changing("BNBundleVersion", Value(version)),
-                Sandboxed(), std::move(f));
+    return make(PlugInInfo(name, pd, attrs).changing("BNBundleVersion", Value(version)),
+                entitlements, std::move(f));
   }
   DiscoveryHost host(bool old = false) { return {&client, nullopt, "", old}; }
   FakeClient client;
@@ -149,7 +138,6 @@ class PlugInTest : public ::testing::Test {
 
 const char* const kId = "com.example.viewer";
 const char* const kPath = "/p/Viewer.appex";
-using Opt = std::optional<std::string>;
 Value Ux(const Value& top) { return Value{{"UXExtension", top}}; }
 
 std::shared_ptr<DRPlugInCore> Make(const Value& info, const char* path = kPath,
@@ -157,7 +145,9 @@ std::shared_ptr<DRPlugInCore> Make(const Value& info, const char* path = kPath,
   return DRPlugInCore::initWithNameUrlBundleInfoInfoUuid(kId, path, info, Value(), uuid);
 }
 
-TEST(PlugInCoreTest, SetupRefusesMalformedInputWithItsLogLine) {
+class SubRecord : public DRPlugInCore {};
+
+TEST(PlugInCoreTest, SetupIdentityAndAnnotations) {
   const std::string at = std::string(kId) + " at " + kPath;
   EXPECT_FALSE(DRPlugInCore::initWithNameUrlBundleInfoInfoUuid(kId, {}, Ux(J("{}")), {}, {}));
   for (const char* info :
@@ -173,11 +163,6 @@ TEST(PlugInCoreTest, SetupRefusesMalformedInputWithItsLogLine) {
   EXPECT_FALSE(DRPlugInCore::initWithNameUrlBundleInfoInfoUuid({}, kPath, Ux(J("{}")), {}, {}));
   EXPECT_EQ(log.lines(), (Lines{"missing Info dictionary in plug-in " + at,
                                 "missing identifier in plug-in at /p/Viewer.appex"}));
-}
-
-class SubRecord : public DRPlugInCore {};
-
-TEST(PlugInCoreTest, IdentityIsTheUuidAloneAndAnnotationsAreCopied) {
   const Uuid id = Uuid::random();
   auto a = Make(J(R"({"UXExtension": {"x": 1}})"), kPath, id);
   auto b = Make(J(R"({"UXExtension": {"y": 2}})"), "/elsewhere/O.bundle", id);
@@ -191,10 +176,6 @@ TEST(PlugInCoreTest, IdentityIsTheUuidAloneAndAnnotationsAreCopied) {
       Make(J(R"({"UXExtension": {"Multiple": {"com.example.viewer": {}}}})"))->isMultiplexed());
   EXPECT_FALSE(a->isEqual(nullptr) || c->isEqual(Make(Ux(J("{}")))) ||
                c->isEqual(std::make_shared<DRPlugInCore>()));
-  DRPlugInCore none;
-  EXPECT_DEATH(none.isEqual(c.get()), "self.uuid");
-  EXPECT_DEATH(none.hash(), "self.uuid");
-
   c->setAnnotationValue("election", 1);  // never creates annotations
   EXPECT_TRUE(c->annotations().isAbsent());
   const Value original = J(R"({"election": 0, "extension": {"k": "v"}})");
@@ -205,9 +186,7 @@ TEST(PlugInCoreTest, IdentityIsTheUuidAloneAndAnnotationsAreCopied) {
               original == J(R"({"election": 0, "extension": {"k": "v"}})"));
 }
 
-// Only a string protocol is the data one, only true is dedicated; embedded code
-// that is no name is hybrid without a path; a numeric version reads as text.
-TEST(PlugInCoreTest, DerivedPropertiesAndFlags) {
+TEST(PlugInCoreTest, DerivedPropertiesNormalizingAndMerging) {
   // path | plug-in dictionary | flags: a(pp extension) h(ybrid) d(edicated) x (data) |
   // embedded code path | version | embedded protocol
   const char* rows = R"(/A/B.appex|{}|a|||; /A/B.APPEX|{}||||; /A/B|{"Dedicated": true}|d|||;
@@ -228,11 +207,6 @@ TEST(PlugInCoreTest, DerivedPropertiesAndFlags) {
     EXPECT_EQ(p->exportForm()["version"], Value(r[4]));
     EXPECT_EQ(p->embeddedProtocolSpec(), r[5].empty() ? Value() : J(r[5]));
   }
-}
-
-// "Multiple" entries convert as whole top dictionaries, nested ones too; of an
-// old key beside its new name the later wins; with both styles nothing changes.
-TEST(PlugInCoreTest, NormalizeConvertsOldStyleDictionaries) {
   const Value old = J(R"({"SDK": "S", "Protocol": "old", "UXExtensionProtocol": "new", "C": 1,
       "Attributes": {"com.corvel.version": "old", "UXExtensionVersion": "new",
                      "com.corvel.identifier": "I", "com.corvel.protocol": "N"},
@@ -248,36 +222,24 @@ TEST(PlugInCoreTest, NormalizeConvertsOldStyleDictionaries) {
   const Value both = J(R"({"UXExtension": {"k": 1}, "Dromon": {"Protocol": "P"}})");
   EXPECT_TRUE(DRPlugInCore::normalizeInfoDictionary(both).sameNode(both));
   EXPECT_TRUE(DRPlugInCore::normalizeInfoDictionary(J(R"({"x": 1})")).isAbsent());
-}
-
-// The plug-in wins but for CleanTimeout; PassProxy and dictionaries merge at any
-// depth, Shared is a union; kinds that cannot merge keep the plug-in's value.
-TEST(PlugInCoreTest, MergeLetsThePlugInWinExceptByTheSpecialRules) {
-  const char* rows[][3] = {
-      {R"({"CleanTimeout": 10, "Dedicated": true, "a": [1], "b": {"c": "d"}})",
-       R"({"CleanTimeout": 5, "Dedicated": false})",
-       R"({"CleanTimeout": 10, "Dedicated": false, "a": [1], "b": {"c": "d"}})"},
-      {R"({"U": {"D": {"CleanTimeout": 3, "PassProxy": {"m": 1, "s": "A"}, "keep": "sdk"}}})",
-       R"({"U": {"D": {"CleanTimeout": 4, "PassProxy": {"n": 2, "s": "C"}, "keep": "mine"}}})",
-       R"({"U": {"D": {"CleanTimeout": 3, "PassProxy": {"m": 1, "n": 2, "s": "C"},
-                       "keep": "mine"}}})"},
-      {R"({"k": {"a": 1}, "PassProxy": "x", "Shared": ["a"]})",
-       R"({"k": "s", "PassProxy": {"m": 1}, "Shared": "b"})",
-       R"({"k": "s", "PassProxy": {"m": 1}, "Shared": "b"})"},
-      {R"({"PassProxy": {"m": 1}})", R"({"PassProxy": 7})", R"({"PassProxy": 7})"},
-      {R"("junk")", R"({"k": 1})", R"({"k": 1})"},
-      {R"({"Shared": ["a", "b", "a"]})", R"({"Shared": ["b", "c", 1, 1]})",
-       R"({"Shared": ["b", "c", 1, "a"]})"}};
-  for (const auto& [sdk, target, expected] : rows) {
-    const Value s = J(sdk), t = J(target);
-    EXPECT_EQ(DRPlugInCore::mergeDictionaryInto(s, t), J(expected)) << sdk;
-    EXPECT_EQ(s.description() + t.description(), J(sdk).description() + J(target).description());
+  // the SDK's | the plug-in's | merged
+  const char* merges = R"({"CleanTimeout": 10, "Dedicated": true, "a": [1], "b": {"c": "d"}}|
+      {"CleanTimeout": 5, "Dedicated": false}|{"CleanTimeout": 10, "Dedicated": false, "a": [1], "b": {"c": "d"}};
+      {"U": {"D": {"CleanTimeout": 3, "PassProxy": {"m": 1, "s": "A"}, "keep": "sdk"}}}|
+      {"U": {"D": {"CleanTimeout": 4, "PassProxy": {"n": 2, "s": "C"}, "keep": "mine"}}}|
+      {"U": {"D": {"CleanTimeout": 3, "PassProxy": {"m": 1, "n": 2, "s": "C"}, "keep": "mine"}}};
+      {"k": {"a": 1}, "PassProxy": "x", "Shared": ["a"]}|{"k": "s", "PassProxy": {"m": 1}, "Shared": "b"}|
+      {"k": "s", "PassProxy": {"m": 1}, "Shared": "b"}; {"PassProxy": {"m": 1}}|{"PassProxy": 7}|{"PassProxy": 7};
+      "junk"|{"k": 1}|{"k": 1}; {"Shared": ["a", "b", "a"]}|{"Shared": ["b", "c", 1, 1]}|{"Shared": ["b", "c", 1, "a"]})";
+  for (const auto& r : Table(merges)) {
+    const Value s = J(r[0]), t = J(r[1]);
+    EXPECT_EQ(DRPlugInCore::mergeDictionaryInto(s, t), J(r[2])) << r[0];
+    EXPECT_EQ(s.description() + t.description(), J(r[0]).description() + J(r[1]).description());
   }
   EXPECT_FALSE(DRPlugInCore::sdkOverridesKey("cleantimeout"));
 }
 
-// Odd SDK files never crash, what they break is refused; any protocol counts.
-TEST(PlugInCoreTest, DiagnoseNamesWhatIsMissing) {
+TEST(PlugInCoreTest, DiagnoseAndForm) {
   ScopedEnv noTestSdk("DRTEST_SDK", nullopt);
   const std::string deep = std::string(60, '[') + std::string(60, ']');  // 62 levels in all
   // path | plug-in dictionary | the SDK's UXExtension ("": none) | the missing key, or the error
@@ -308,11 +270,6 @@ TEST(PlugInCoreTest, DiagnoseNamesWhatIsMissing) {
   }
   EXPECT_EQ(DRPlugInCore().diagnose().error().ownDescription(),
             "missing identifier (no UXExtensionIdentifier, nor even BNBundleIdentifier)");
-}
-
-// The form leaves out the information file's path and reads back into an equal
-// record; wrong kinds read as absent; a form without a usable UUID gets a new one.
-TEST(PlugInCoreTest, FormRebuildsAnEqualRecord) {
   auto p = Make(J(R"({"UXExtension": {"UXExtensionProtocol": "P"}, "BNBundleVersion": "4.1",
                       "BNBundleInfoPdocURL": "/p/Viewer.appex/Contents/Info.pdoc"})"));
   p->canonicalize();
@@ -345,16 +302,13 @@ TEST(PlugInCoreTest, FormRebuildsAnEqualRecord) {
   ScopedLogCapture log;
   EXPECT_EQ(DRPlugInCore::initWithForm(plain.changing("identifier", Value())), nullptr);
   EXPECT_EQ(log.lines(), Lines{"missing identifier in plug-in at /p/Viewer.appex"});
-  // Updating takes only the annotations; absent or not a dictionary clears them.
   q->updateFromForm(J(R"({"annotations": {"election": 0}, "identifier": "other"})"));
   EXPECT_TRUE(q->annotations() == J(R"({"election": 0})") && q->identifier() == kId);
   q->updateFromForm(J(R"({"annotations": "junk"})"));
   EXPECT_TRUE(q->annotations().isAbsent());
 }
 
-// Capitals first; leading zeros never count; canonically equivalent text is
-// equal; digits of any script order like ASCII ones; bad UTF-8 never crashes.
-TEST(HelpersTest, CompareVersionStringOrdersVersions) {
+TEST(HelpersTest, VersionOrderAndBundlesOnDisk) {
   const char* rows =
       "1.10|>|1.9; 2.0|<|10.0; 1.0|<|1.0.1; 1.0a|<|1.0b; |=|; |<|0; A|<|a; 1.0|<|1.0A; 01|=|1; "
       "1.01|=|1.1; 1.002|<|1.10; 2|>|1a; 1a2|<|1a10; x01|=|x001; \xd9\xa2|<|3; \xd9\xa2|<|Z; "
@@ -369,27 +323,20 @@ TEST(HelpersTest, CompareVersionStringOrdersVersions) {
   }
   EXPECT_TRUE(dictionaryChangingTo(Value("text"), "a", 1).isAbsent());
   EXPECT_EQ(dictionaryChangingTo(J(R"({"a": 1})"), "b", Value()), J(R"({"a": 1})"));
-  EXPECT_EQ(DRMakeErrorWithFormat(7, "found %d needed %d", 15, 16).localizedDescription(),
-            "found 15 needed 16");
   EXPECT_EQ(DRMakeErrorWithFormat(4, nullptr, 1, 2).localizedDescription(), "Dromon error 4");
-}
-
-// Without a usable executable a bundle stands for it and is its own support folder.
-TEST(HelpersTest, BundlesOnDisk) {
   BundleFixture dir;
   const std::string app = dir.makeBundle(
       "Host.app", J(R"({"BNBundleIdentifier": "com.example.host", "BNBundleExecutable": "Host"})"),
       "Host");
   const std::string exe = app + "/Contents/Exec/Host";
-  for (auto b : {DRBundle::initWithURL(app + "/"), DRBundle::initWithExecutablePath(exe)}) {
+  for (auto b : {DRBundle::initWithURL(app + "/"), DRBundle::initWithExecutablePath(exe)})
     EXPECT_TRUE(b->url() == app && b->executablePath() == exe &&
                 b->plugInsPath() == app + "/Contents/PlugIns");
-  }
-  dir.makeBundle("Escape.appex", J(R"({"BNBundleExecutable": "../x"})"));
+  for (const auto& r :
+       Table(R"(Escape|{"BNBundleExecutable": "../x"}; Bare|{"BNBundleVersion": "1"}; List|[1])"))
+    dir.makeBundle(r[0] + ".appex", J(r[1]));
   dir.makeFolder("Escape.appex/Contents/Exec");
   dir.writeFile("Escape.appex/Contents/x", "");
-  dir.makeBundle("Bare.appex", J(R"({"BNBundleVersion": "1"})"));
-  dir.makeBundle("List.appex", J("[1]"));
   dir.makeBundle("Broken.appex", Value());
   dir.writeFile("Broken.appex/Contents/Info.pdoc", "<pdoc><dict><key>a");
   dir.writeFile("bin/tool", "#!/bin/sh\n");
@@ -402,15 +349,13 @@ TEST(HelpersTest, BundlesOnDisk) {
         << name;
   }
   for (auto b : {DRBundle::initWithPath(dir.path("missing")),
-                 DRBundle::initWithExecutablePath(dir.path("nope"))}) {
+                 DRBundle::initWithExecutablePath(dir.path("nope"))})
     EXPECT_FALSE(b->url() || b->executablePath() || b->plugInsPath());
-  }
   auto main = DRBundle::initForMainBundle();
   EXPECT_EQ(main->path(), std::filesystem::read_symlink("/proc/self/exe").string());
   EXPECT_EQ(main->executablePath(), main->path());
 }
 
-// Sandboxed plug-ins only, but for data or Effecta ones; times clamp to seconds.
 TEST_F(PlugInTest, AdmitsSandboxedPlugInsAndTakesTheEntrysFields) {
   // plug-in dict | attributes | entitlements | registered | last modified and hub, or refusal
   const char* rows = R"({}|{}|{"com.corvel.security.app-sandbox": "NO"}|1.9|1 2; {}|{}||0|sandboxed;
@@ -425,33 +370,20 @@ TEST_F(PlugInTest, AdmitsSandboxedPlugInsAndTakesTheEntrysFields) {
     f.registrationDate = Date{std::stod(r[3])};
     RegistryEntryPtr e =
         entry(PlugInInfo("a", J(r[0]), J(r[1])), r[2].empty() ? Value() : J(r[2]), f);
-    auto plugIn = DRDPlugIn::initWithRGData(e, services());
-    if (!plugIn) {
-      EXPECT_EQ(log.lines(), Lines{"ignoring mis-configured plug-in at " + e->url() +
-                                   ": Dromon error 12: plug-ins must be " + r[4]});
-      continue;
-    }
-    EXPECT_EQ(
-        std::to_string(plugIn->lastModified()) + " " + std::to_string(plugIn->hubProtocolVersion()),
-        r[4]);
+    auto p = DRDPlugIn::initWithRGData(e, services());
+    Lines got = log.lines();
+    if (p) got.push_back(Format("%d %d", p->lastModified(), p->hubProtocolVersion()));
+    EXPECT_EQ(got, Lines{p ? r[4]
+                           : "ignoring mis-configured plug-in at " + e->url() +
+                                 ": Dromon error 12: plug-ins must be " + r[4]});
   }
-  // An entry without a path or a readable information dictionary: nothing, silently.
-  ScopedLogCapture log;
-  RegistryEntry::Fields f;
-  auto files = std::make_shared<RegistryBundleFiles>(*pdoc::WriteXml(PlugInInfo("a")), nullopt);
-  EXPECT_FALSE(DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services()));
-  f.url = folder.path();
-  files = std::make_shared<RegistryBundleFiles>("<pdoc><dict><key>", nullopt);
-  EXPECT_FALSE(DRDPlugIn::initWithRGData(std::make_shared<RegistryEntry>(f, files), services()));
-  EXPECT_TRUE(log.lines().empty());
 }
 
-// Real sandbox tokens, consumed: each grants exactly its resource, never one
-// outside the bundle, and for a link inside it where the link leads.
-TEST_F(PlugInTest, FormGetsOneTokenPerDeclaredResource) {
+TEST_F(PlugInTest, FormTokensAndHostsThePlugInAllows) {
   SandboxOptions options{.keyPath = folder / "keys/sandbox.key"};
   testing::FakeCodeSigning signing;
-  std::unique_ptr<Sandbox> sandbox = MakeLinuxSandbox(options, &signing);
+  std::unique_ptr<Sandbox> real = MakeLinuxSandbox(options, &signing);
+  sandbox = real.get();
   // "Shared" ("": none) | "name=path" relative to the bundle for each token | the failure logged
   const char* rows =
       R"(||; "."|.=.|; {"r/a": true}|r/a=r/a|; 42||; ["r/a", 7, "r/n/b"]|r/a=r/a r/n/b=r/n/b|;
@@ -460,10 +392,8 @@ TEST_F(PlugInTest, FormGetsOneTokenPerDeclaredResource) {
       "r/escape"||/r/escape in plug-in at @: Permission denied; "r/alias"|r/alias=r/n/b|)";
   for (const auto& r : Table(rows)) {
     SCOPED_TRACE(r[0]);
-    PlugInServices s = services();
-    s.sandbox = sandbox.get();
     Value pd = r[0].empty() ? Value() : Value{{"Shared", J(r[0])}};
-    auto plugIn = DRDPlugIn::initWithRGData(entry(PlugInInfo("a", pd), Sandboxed()), s);
+    auto plugIn = make(PlugInInfo("a", pd));
     std::string bundle = *plugIn->url();
     for (const char* file : {"/r/a", "/r/n/b", "/../outside"})
       registry_test::WriteBytes(bundle + file, "x");
@@ -484,17 +414,13 @@ TEST_F(PlugInTest, FormGetsOneTokenPerDeclaredResource) {
     if (size_t at = failure.find('@'); at != std::string::npos) failure.replace(at, 1, bundle);
     EXPECT_EQ(log.lines(), failure.empty() ? Lines{} : Lines{failure});
   }
-}
-
-// The host's restriction comes first; only a string demands; all but false hold.
-TEST_F(PlugInTest, HostRestrictionAndDemandedEntitlement) {
   const std::string restriction = "com.corvel.developer.dromon.allowedplugins";
   // the host's restriction ("": none) or entitlements | the plug-in's demand | the refusal
-  const char* rows = R"(||; []||invalid host restriction entitlement; {}||;
+  const char* hosts = R"(||; []||invalid host restriction entitlement; {}||;
       {"UXExtensionIdentifier": "com.example.a.ext"}||;
       {"UXExtensionIdentifier": "com.example.b.ext"}|"x"|the host's plug-in entitlement does not allow this plug-in;
       {"x": false}|"x"|the host does not have the "x" entitlement; {"x": "NO"}|"x"|; |["x"]|)";
-  for (const auto& r : Table(rows)) {
+  for (const auto& r : Table(hosts)) {
     Value host = r[0].empty() ? J("{}") : J(r[0]);
     if (!r[0].empty() && !host.has("x")) host = Value{{restriction, host}};
     Value pd = r[1].empty() ? Value() : Value{{"UXExtensionHostEntitlement", J(r[1])}};
@@ -503,10 +429,8 @@ TEST_F(PlugInTest, HostRestrictionAndDemandedEntitlement) {
   }
 }
 
-// The real service manager checks the executable and records the grant with its
-// overlay: the daemon's test SDK folder, then the plug-in's own string variables.
 TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
-  registry_test::WriteBytes(folder / (std::string("sdks/") + kPoint + ".pdoc"),
+  registry_test::WriteBytes(folder / ("sdks/" + std::string(kPoint) + ".pdoc"),
                             *pdoc::WriteXml(J("{}")));
   ScopedEnv sdkPath{"DR_SDK_PATH", folder / "sdks"};
   std::unique_ptr<ServiceManager> real = NewServiceManager({});
@@ -526,18 +450,16 @@ TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
     ScopedLogCapture log;
     pid_t pid = ::getpid();  // grants to processes that are gone are dropped
     EXPECT_TRUE(plugIn->enableForPid(pid).ok());
-    EXPECT_EQ(log.lines(), Lines{Format("enabling pid=%d for plug-in com.example.a.ext(2.0) %@ %@",
-                                        pid, *plugIn->uuid(), *plugIn->url())});
+    EXPECT_EQ(log.lines().size(), 1u);
     std::vector<ExternalServiceGrant> grants = manager->externalServiceGrants();
     ASSERT_EQ(grants.size(), ++n);
     EXPECT_TRUE(grants.back().hostPid == pid &&
                 grants.back().executablePath == *plugIn->url() + "/Contents/Exec/a");
-    Value expected = service.isDictionary() ? service : J("{}");
-    expected = expected.changing("EnvironmentVariables", J(r[2]));
+    Value expected =
+        (service.isDictionary() ? service : J("{}")).changing("EnvironmentVariables", J(r[2]));
     EXPECT_EQ(grants.back().overlay,
               (Value{{"IPCService", expected}, {"BNBundlePackageType", "IPC!"}}));
   }
-  // Refused (the executable cannot run) or gone: an error, its log lines, no grant.
   auto plugIn = make(PlugInInfo("a"));
   const std::string id = "com.example.a.ext(" + plugIn->uuid()->string() + ")";
   const std::string path = *plugIn->url();
@@ -548,15 +470,9 @@ TEST_F(PlugInTest, EnablingSendsTheServiceOverlayOrFailsWithItsLogLines) {
   EXPECT_EQ(log.lines().at(1),
             "ipc error 13 allowing pid 77 to use plug-in com.example.a.ext(2.0) " +
                 plugIn->uuid()->string() + " at " + path);
-  std::filesystem::remove_all(path);
-  log.clear();
-  EXPECT_EQ(plugIn->enableForPid(77).description(),
-            Error("Dromon", 4, "cannot obtain executable path for plug-in " + id).description());
-  EXPECT_EQ(log.lines().size(), 1u);  // "enabling ...", and no service-manager line
   EXPECT_EQ(manager->externalServiceGrants().size(), n);
 }
 
-// Other versions are skipped, unknown ones count, incomplete ones are logged.
 TEST_F(PlugInTest, CheckBusyFindsTheFirstInstanceOfThisVersion) {
   std::map<std::string, Uuid> ids;
   for (const char* who : {"v1", "v200", "none", "unknown"}) ids[who] = Uuid::random();
@@ -589,10 +505,7 @@ TEST_F(PlugInTest, CheckBusyFindsTheFirstInstanceOfThisVersion) {
   }
 }
 
-// Entitlement keys read only entitlements, others the identifier, UUID, attributes
-// and bundle information; a missing key fails all but false; arrays match on any
-// string element; "?" starts a type operator; a dictionary is an activation rule.
-TEST_F(PlugInTest, MatchRulesEveryKeyPatternAndOperator) {
+TEST_F(PlugInTest, MatchRulesAndTheRuleIndex) {
   FakeTypeService typeService;
   typeService.parents["org.example.photo"] = {"org.example.picture"};
   types = &typeService;
@@ -606,7 +519,6 @@ TEST_F(PlugInTest, MatchRulesEveryKeyPatternAndOperator) {
                .changing("Name", "BundleName"),
            J(R"({"com.corvel.security.app-sandbox": true, "ent.string": "NO", "ent.false": false,
             "ent.zero": 0, "ent.array": []})"));
-  // key | pattern (JSON) | matches
   const char* rows = R"(
     ENTITLEMENT:ent.string|"NO"|1; ENTITLEMENT:Version|"10.10"|0; OnlyInBundle|"bundle-value"|1;
     UXExtensionIdentifier|"com.example.a.ext"|1; UXExtensionIdentifier|"com.example.A.ext"|0;
@@ -630,54 +542,36 @@ TEST_F(PlugInTest, MatchRulesEveryKeyPatternAndOperator) {
     Rule|{"org.example.other": 1}|0; Rule|{"org.example.other": 0}|1; Rule|{}|1;
     RuleTrue|{"org.example.other": 9}|1; Name|{"Photo": 1}|0; Tags|{"a": 1}|0)";
   ScopedLogCapture quiet;
-  for (const auto& row : Table(rows)) {
+  for (const auto& row : Table(rows))
     EXPECT_EQ(plugIn->match(Value{{row[0], J(row[1])}}), row[2] == "1") << row[0] << " " << row[1];
-  }
   const std::string uuid = plugIn->uuid()->string();
   std::string lower = uuid;
   for (char& c : lower) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
   EXPECT_TRUE(plugIn->match(Value{{"com.corvel.uuid", uuid}}));
   EXPECT_FALSE(plugIn->match(Value{{"com.corvel.uuid", lower}}));
-  for (const Value& v : {Value(Date{0}), Value(Data{'P'}), Value(*plugIn->uuid())}) {
+  for (const Value& v : {Value(Date{0}), Value(Data{'P'}), Value(*plugIn->uuid())})
     EXPECT_FALSE(plugIn->match(Value{{"Name", v}})) << v.description();
-  }
-  // Each operator against operands below, equal to and above the value.
   const char* operators[] = {"", "=", "<>", "<", "<=", ">", ">="};
   const char* orderings = R"(Version|10.9|0010011; Version|10.10|1100101; Version|10.010|1100101;
       Version|10.11|0011100; Version| 10.11|0010011; Two|10|0011100; Name|photo|0011100;
       Name|Photo|1100101; Name||0010011; Empty||1100101; Empty|a|0011100; Tags|a|1110111;
       NoTags|a|0000000; Missing|a|0000000)";
-  for (const auto& row : Table(orderings)) {
-    for (size_t i = 0; i < std::size(operators); ++i) {
-      std::string pattern = operators[i] + row[1];
-      EXPECT_EQ(plugIn->match(Value{{row[0], pattern}}), row[2][i] == '1') << row[0] << pattern;
-    }
-  }
-  // Whole rules: none, empty, all keys, one failing key, not a dictionary.
+  for (const auto& row : Table(orderings))
+    for (size_t i = 0; i < std::size(operators); ++i)
+      EXPECT_EQ(plugIn->match(Value{{row[0], operators[i] + row[1]}}), row[2][i] == '1')
+          << row[0] << operators[i] << row[1];
   EXPECT_TRUE(plugIn->match(Value()) && plugIn->match(J("{}")) &&
               plugIn->match(J(R"({"Name": "Photo", "Two": "2"})")));
   EXPECT_FALSE(plugIn->match(J(R"({"Name": "Photo", "Two": "3"})")) ||
                plugIn->match(J(R"(["Name"])")) || plugIn->match(Value(true)));
-  // Without a type service a type conforms only to itself.
-  auto plain = DRDPlugIn::initWithRGData(plugIn->rgproxy(), PlugInServices{});
-  ASSERT_TRUE(plain);
-  EXPECT_TRUE(plain->matchKeyPattern("Type", "?UT-IS:org.example.photo"));
-  EXPECT_FALSE(plain->matchKeyPattern("Type", "?UT-CONFORMS:org.example.picture"));
-  EXPECT_TRUE(plain->matchKeyPattern("Rule", J(R"({"org.example.picture": 1})")));
-}
-
-// Names, "=", equal versions and arrays of them narrow, also beside other rules;
-// ordering and type operators, activation rules and text not ASCII do not.
-TEST_F(PlugInTest, RuleIndexSelectsEveryRecordTheRulesMatch) {
   std::vector<DRDPlugInPtr> records;
   const Value values = J(R"(["viewer", "Viewer", "1.1", "1.01", ["editor", "viewer", "=viewer"],
       ["x", 3], 3, "\u0661.\u0661", ["v\u00efewer", "editor"], true, ""])");
-  for (const Value& v : values.array()) {
+  for (const Value& v : values.array())
     records.push_back(make(PlugInInfo("p" + std::to_string(records.size()), {}, {{"K", v}})));
-  }
   records.push_back(make(PlugInInfo("none")));
   records.push_back(make(PlugInInfo("top").changing("K", "viewer")));  // in the bundle information
-  const char* rows = R"(
+  const char* indexed = R"(
     {"K": "viewer"}|1; {"K": "=viewer"}|1; {"K": "1.001"}|1; {"K": "1.1"}|1; {"K": ""}|1;
     {"K": "nothing"}|1; {"K": ["editor", 3, "x"]}|1; {"K": []}|1;
     {"K": "viewer", "UXExtensionIdentifier": "com.example.p0.ext"}|1;
@@ -688,38 +582,34 @@ TEST_F(PlugInTest, RuleIndexSelectsEveryRecordTheRulesMatch) {
     {"K": false}|0; {"K": 3}|0; {"K": "viewer", "Other": "?UT-CONFORMS:x"}|0;
     {"K": ["viewer", "?UT-IS:x"]}|0; {"K": "viewer", "Other": {"a": 1}}|0; {}|0)";
   PlugInSet set(records);
-  for (const auto& row : Table(rows)) {
+  for (const auto& row : Table(indexed)) {
     const Value rules = J(row[0]);
     std::optional<std::vector<uint32_t>> chosen = set.mayMatch(rules);
     ASSERT_EQ(chosen.has_value(), row[1] == "1") << row[0];
     if (!chosen) continue;
     EXPECT_TRUE(std::is_sorted(chosen->begin(), chosen->end())) << row[0];
     EXPECT_EQ(std::adjacent_find(chosen->begin(), chosen->end()), chosen->end()) << row[0];
-    for (uint32_t i = 0; i < records.size(); ++i) {
+    for (uint32_t i = 0; i < records.size(); ++i)
       EXPECT_TRUE(!records[i]->match(rules) ||
                   std::binary_search(chosen->begin(), chosen->end(), i))
           << row[0] << ": record " << i;
-    }
     EXPECT_LT(chosen->size(), records.size()) << row[0];
   }
   EXPECT_FALSE(set.mayMatch(Value()));
   EXPECT_TRUE(records[7]->match(J(R"({"K": "1.1"})")));  // the one in another script
 }
 
-// Newer wins, then system over app unless registered later, else the first;
-// every version (0x1) keeps unequal versions, with duplicates (0x4) equal ones.
-TEST_F(PlugInTest, DuplicatesOfOneIdentifier) {
+TEST_F(PlugInTest, DuplicatesWorkaroundBitAndChosenCandidates) {
   // version | (s)ystem or (a)pp | registered, for each copy; flags; the copies returned
-  const char* rows = R"(1.2|s|100|1.10|s|50|0|2; 1.10|s|50|1.2|s|100|0|1; 1|a|200|1|s|100|0|2;
+  const char* copies = R"(1.2|s|100|1.10|s|50|0|2; 1.10|s|50|1.2|s|100|0|1; 1|a|200|1|s|100|0|2;
       1|a|100|1|a|200|0|2; 1|a|100|1|a|100|0|1; 1|a|200|1|a|100|0|1; 1|s|100|1|a|200|0|2;
       1.2|s|100|1.10|s|50|1|12; 1|s|100|1|s|50|1|1; 1|s|100|1|s|50|5|12; 1|s|100|1|s|50|4|1)";
-  for (const auto& r : Table(rows)) {
+  for (const auto& r : Table(copies)) {
     SCOPED_TRACE(r[0] + r[1] + r[2] + " " + r[3] + r[4] + r[5] + " " + r[6]);
     Discovery d(host(), Value(), std::stoul(r[6]), Value(), {});
     DRDPlugInPtr a = copy("p", r[0], r[1] == "s", std::stod(r[2]));
     DRDPlugInPtr b = copy("p", r[3], r[4] == "s", std::stod(r[5]));
-    d.examine(a);
-    d.examine(b);
+    for (const DRDPlugInPtr& p : {a, b}) d.examine(p);
     std::string returned;
     const Value found = d.finish().value();
     for (const Value& form : found.array())
@@ -729,19 +619,13 @@ TEST_F(PlugInTest, DuplicatesOfOneIdentifier) {
       EXPECT_TRUE(v.outcome != DiscoveryOutcome::kSuperseded || v.by == (v.plugIn == a ? b : a));
     }
   }
-}
-
-// Only older listed hosts find internal filters, whose visibility check (even
-// failing the rules) keeps equal copies below; the chosen candidates answer as all.
-TEST_F(PlugInTest, WorkaroundBitAndChosenCandidates) {
   const char* hosts = R"(com.corvel.Brivane|10.1.4|1; com.corvel.Brivane|9.9|1;
       com.corvel.BrivaneTrial|10.1|1; com.corvel.Quellor|4.1.9|1; com.corvel.vorelapp|5.1|1;
       com.corvel.OdelloApp|10|1; com.corvel.Brivane|10.2|0; com.corvel.Brivane|10.10|0;
       com.corvel.Brivane|10.2.1|0; com.corvel.Quellor|4.2|0; com.corvel.brivane|1.0|0;
       com.example.other|1.0|0; com.corvel.BrivaneTrialX|1.0|0)";
-  for (const auto& row : Table(hosts)) {
+  for (const auto& row : Table(hosts))
     EXPECT_EQ(Needs17732150Workaround(row[0], row[1]), row[2] == "1") << row[0] << " " << row[1];
-  }
   std::vector<DRDPlugInPtr> records;  // two internal filters, then copies in an application
   for (int n : {0, 5}) {
     RegistryEntry::Fields f;
@@ -769,11 +653,9 @@ TEST_F(PlugInTest, WorkaroundBitAndChosenCandidates) {
       for (const DRDPlugInPtr& p : examined) d.examine(p);
       return std::make_pair(d.finish().value(), d.flags());
     };
-    std::vector<DRDPlugInPtr> some = records;
-    if (auto chosen = CandidatesToExamine(set, rules, flags, old)) {
-      some.clear();
-      for (uint32_t i : *chosen) some.push_back(records[i]);
-    }
+    const auto chosen = CandidatesToExamine(set, rules, flags, old);
+    std::vector<DRDPlugInPtr> some = chosen ? std::vector<DRDPlugInPtr>{} : records;
+    for (uint32_t i : chosen.value_or(std::vector<uint32_t>{})) some.push_back(records[i]);
     Lines allLogged, someLogged;
     auto all = run(records, allLogged);
     EXPECT_EQ(run(some, someLogged), all);
@@ -783,6 +665,56 @@ TEST_F(PlugInTest, WorkaroundBitAndChosenCandidates) {
     EXPECT_EQ((all.second & message::kDiscoverDuplicates) != 0, bit);
     const std::string found = "found a 17732150 PlugIn: " + *records[0]->path();
     EXPECT_EQ(!allLogged.empty() && allLogged[0].find(found) != std::string::npos, bit);
+  }
+}
+
+TEST_F(PlugInTest, SplicedReplyIsTheReplyEncodedAfresh) {
+  testing::FakeCodeSigning signing;
+  std::unique_ptr<Sandbox> real = MakeLinuxSandbox({.keyPath = folder / "key"}, &signing);
+  sandbox = real.get();
+  const Value values = J(R"([true, -2147483648, "Ω-ω", 613566756.5, [], {}, [{"b": [[-1.25]]}, "a"],
+      {"extensions": [false, {"é": 7}], "b": {"overrider": "zeta", "a": [1e300, ""]}}])");
+  std::mt19937 rng;
+  for (uint32_t seed = 1; seed <= 16; ++seed) {
+    SCOPED_TRACE(seed);
+    rng.seed(seed);
+    std::vector<DRDPlugInPtr> records;
+    std::map<const DRDPlugIn*, Value> annotations;
+    for (int i = 0; i < 8; ++i) {
+      const auto r = static_cast<uint32_t>(rng());  // its bits make each choice
+      Value pd{{"Extra", values.array()[r % 8]}};
+      if (r & 8) pd = pd.changing("Shared", r & 16 ? "." : "missing");
+      const std::string replaced = "com.example." + std::string(1, "abcd"[r >> 5 & 3]) + ".ext";
+      records.push_back(copy(
+          std::string(1, "abcd"[r >> 7 & 3]), std::to_string(r >> 9 & 3), r >> 11 & 1, r >> 12 & 3,
+          {}, pd,
+          r >> 14 & 1 ? Sandboxed() : Sandboxed().changing(kReplacePluginEntitlement, replaced)));
+      ASSERT_TRUE(records.back());
+      if (r >> 15 & 1)
+        annotations[records.back().get()] = Value{{"election", values.array()[r >> 16 & 7]}};
+    }
+    DiscoveryServices hooks;
+    hooks.annotations = [&](const DRDPlugIn& p) {
+      return annotations.contains(&p) ? annotations[&p] : DRPlugInCore::NoAnnotations();
+    };
+    Discovery discovery(host(), Value(), rng() % 2, Value(), hooks);
+    for (const DRDPlugInPtr& record : records) discovery.examine(record);
+    const DiscoveredForms forms = discovery.finish();
+    drm1::Splice spliced(drm1::kMaxReplyBodySize);
+    spliced.container(drm1::kTagDictionary, 1, 1);
+    spliced.key("matches");
+    forms.splice(spliced);
+    ASSERT_TRUE(spliced.seal(9, 4, drm1::kFlagIsReply).ok());
+    const size_t from = rng() % spliced.size();  // where a write resumes
+    std::vector<iovec> parts(spliced.size());
+    parts.resize(spliced.gather(from, parts.data(), parts.size()));
+    std::string tail;
+    for (const iovec& p : parts) tail.append(static_cast<char*>(p.iov_base), p.iov_len);
+    const std::string bytes = std::move(spliced).flatten();
+    const Value afresh{{"matches", forms.value()}};
+    EXPECT_EQ(bytes, *drm1::EncodeFrame(9, 4, drm1::kFlagIsReply, afresh));
+    EXPECT_EQ(*drm1::DecodeBody(std::string_view(bytes).substr(drm1::kHeaderSize)), afresh);
+    EXPECT_EQ(tail, bytes.substr(from));
   }
 }
 
