@@ -31,6 +31,9 @@ class RequestsTest : public ::testing::Test {
 TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
   const std::string a = w.makePlugIn("system/a.appex", "com.example.a");
   const Value v2(uint64_t{2});
+  auto annotate = [](Dictionary annotations) {
+    return Request("annotate", {{"annotations", Value(std::move(annotations))}, {"uuids", "junk"}});
+  };
   const struct {
     Value request;
     uint64_t code;
@@ -62,6 +65,14 @@ TEST_F(RequestsTest, EachRequestGetsOneBoundReply) {
       {Request("access", {{"uuids", Value(Array{Value(Uuid::random())})}}), 4,
        "no such plugin (uuid not found)"},
       {Request("match", {{"rules", "x"}}), 4, "invalid request format (bad rules dictionary)"},
+      // Settings are checked before the UUIDs; nothing to change succeeds
+      // without them. The annotation file could not hold a UUID.
+      {annotate({{"other", 1}}), 0, ""},
+      {annotate({{"election", "yes"}}), 4, "invalid request format (annotation election)"},
+      {annotate({{"election", true}}), 4, "invalid request format (annotation election)"},
+      {annotate({{"extension", 3}}), 4, "invalid request format (annotation extension)"},
+      {annotate({{"extension", Value{{"id", Value(Uuid::random())}}}}), 4,
+       "invalid request format (annotation extension)"},
   };
   Drm1Peer peer(w.drd().socketPath());
   ASSERT_TRUE(peer.send(1, Request("match"), false));

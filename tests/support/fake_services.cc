@@ -19,18 +19,6 @@ Value FakePreferences::copyCurrentHostValue(std::string_view key, std::string_vi
   return it == values.end() ? Value() : it->second;
 }
 
-Status FakeNotificationCenter::post(std::string_view name) {
-  if (!IsValidNotificationName(name)) return PosixError(EINVAL, "notification name");
-  std::lock_guard<std::mutex> lock(mu_);
-  posted_.emplace_back(name);
-  return Status::OK();
-}
-
-std::vector<std::string> FakeNotificationCenter::posted() const {
-  std::lock_guard<std::mutex> lock(mu_);
-  return posted_;
-}
-
 void FakeUsageReports::sendReport(std::string_view domain, int level, const UsageReportKeys& keys) {
   std::lock_guard<std::mutex> lock(mu_);
   reports_.push_back({std::string(domain), level, keys});

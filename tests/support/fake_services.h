@@ -1,4 +1,4 @@
-// In-memory code signing, preferences, notifications and usage reports that record calls.
+// In-memory code signing, preferences and usage reports that record calls.
 #pragma once
 
 #include <map>
@@ -8,7 +8,6 @@
 #include <vector>
 
 #include "platform/code_signing.h"
-#include "platform/notifications.h"
 #include "platform/preferences.h"
 #include "platform/usage_reports.h"
 
@@ -30,17 +29,6 @@ class FakePreferences : public Preferences {
 
   void synchronizeCurrentHost(std::string_view) override {}
   Value copyCurrentHostValue(std::string_view key, std::string_view domain) override;
-};
-
-// Records posted names. Thread-safe.
-class FakeNotificationCenter : public NotificationCenter {
- public:
-  Status post(std::string_view name) override;
-  std::vector<std::string> posted() const;
-
- private:
-  mutable std::mutex mu_;
-  std::vector<std::string> posted_;
 };
 
 struct SentUsageReport {
