@@ -203,11 +203,10 @@ bool Discovery::resolveDuplicates(const DRDPlugInPtr& candidate, size_t verdict)
   std::vector<size_t>& positions = same->second;  // in the order accepted
   for (auto it = positions.begin(); it != positions.end(); ++it) {
     Accepted& existing = accepted_[*it];
-    const DRPlugInCore::EncodedForm& e = *existing.form.encoded;
-    const int order = compareVersionString(version, e.version.stringValue());
-    const bool systemResident = e.systemResident.isBool() && e.systemResident.boolValue();
+    const DRDPlugIn& e = *existing.form.plugIn;
+    const int order = compareVersionString(version, e.version().value_or(""));
     const bool fresher =
-        (p.onSystemVolume() && !systemResident) || p.lastModified() > e.lastModified.intValue();
+        (p.onSystemVolume() && !e.onSystemVolume()) || p.lastModified() > e.lastModified();
     bool replaceExisting;
     if (flags_ & message::kDiscoverAllVersions) {
       if ((flags_ & message::kDiscoverDuplicates) || order != 0) continue;  // both stay

@@ -97,9 +97,6 @@ std::shared_ptr<const DRPlugInCore::EncodedForm> DRPlugInCore::encodedForm() con
   made->entries = drm1::EncodeEntries(entries, kFormDepth + 1);
   const Value form(std::move(entries));
   made->identifier = form[kFormIdentifierKey];
-  made->version = form[kFormVersionKey];
-  made->lastModified = form[kFormLastModifiedKey];
-  made->systemResident = form[kFormSystemResidentKey];
   made->uuid = form[kFormUuidKey];
   for (size_t i = 0; i < kFormRequestKeys.size(); ++i) {
     made->requestKeyAt[i] = static_cast<uint32_t>(made->entries.lowerBound(kFormRequestKeys[i]));

@@ -234,15 +234,12 @@ class DRPlugInCore {
   // "matches" array level 2.
   static constexpr int kFormDepth = 3;
   // The form's entries that stay the same from request to request (all but
-  // "annotations"), encoded as they sit in a "match" reply, and the values
-  // discovery decides by, so that a reply carrying the form copies neither.
+  // "annotations"), encoded as they sit in a "match" reply, and the two a
+  // request's replacement marks carry, so that a reply copies neither.
   struct EncodedForm {
     drm1::EncodedEntries entries;
-    Value identifier;      // string
-    Value version;         // string
-    Value lastModified;    // signed
-    Value systemResident;  // boolean
-    Value uuid;            // string
+    Value identifier;  // string
+    Value uuid;        // string
     // The entry before which each of kFormRequestKeys sorts in.
     std::array<uint32_t, 4> requestKeyAt;
   };
